@@ -1,0 +1,46 @@
+# A thin front over CMake so that the everyday commands are short.
+#   make demo   build everything and render the demo farm on this machine
+#   make test   build and run every test (plain build)
+#   make asan   build and run every test with AddressSanitizer + UBSan
+#   make fuzz   build the fuzzers with clang and run each for a bounded time
+#   make bench  build the benchmarks and report them
+JOBS ?= $(shell nproc 2>/dev/null || echo 2)
+BUILD ?= build
+FUZZ_SECONDS ?= 60
+
+.PHONY: all deps build test asan fuzz bench demo format clean
+
+all: build
+
+deps:
+	@tools/install-deps.sh
+
+build: deps
+	cmake -S . -B $(BUILD) -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
+	cmake --build $(BUILD) -j $(JOBS)
+
+test: build
+	cd $(BUILD) && ctest --output-on-failure -j $(JOBS)
+
+asan: deps
+	cmake -S . -B $(BUILD)-asan -DCMAKE_BUILD_TYPE=Debug -DRJ_SANITIZE=ON -DRJ_BENCH=OFF >/dev/null
+	cmake --build $(BUILD)-asan -j $(JOBS)
+	cd $(BUILD)-asan && ASAN_OPTIONS=detect_leaks=1 UBSAN_OPTIONS=print_stacktrace=1 ctest --output-on-failure -j $(JOBS)
+
+fuzz:
+	@RJ_NEED_CLANG=1 tools/install-deps.sh
+	CC=clang CXX=clang++ cmake -S . -B $(BUILD)-fuzz -DCMAKE_BUILD_TYPE=Debug -DRJ_FUZZ=ON >/dev/null
+	cmake --build $(BUILD)-fuzz -j $(JOBS)
+	tests/fuzz/run.sh $(BUILD)-fuzz $(FUZZ_SECONDS)
+
+bench: build
+	bench/run.sh $(BUILD)
+
+demo: build
+	demo/run.sh $(BUILD)
+
+format:
+	clang-format -i $$(git ls-files '*.cpp' '*.h')
+
+clean:
+	rm -rf $(BUILD) $(BUILD)-asan $(BUILD)-fuzz

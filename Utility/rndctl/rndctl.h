@@ -1,0 +1,491 @@
+/// The render queue: records, the process-wide control block and the
+/// operations shared by the render daemon, the queue editors and the tools.
+///
+/// Everything lives in one shared control directory of plain-text files:
+/// jobs (Render_Job_Control), render hosts or "resources"
+/// (Render_Resource_Control), the tasks the jobs are cut into (Render_Tasks),
+/// lock directories, per-host pid files.  Every read-modify-write of a shared
+/// file happens under that file's lock directory (lock_fileop).
+///
+/// Records hang from the control block `rndctl` in doubly linked lists; the
+/// list order is part of the behaviour (writers print in list order, lookups
+/// return the first match).  List links and the back pointers between records
+/// are non-owning raw pointers: the lists own their records, and each record
+/// is freed only by its delete operation (Job_del, Dev_del, TASK_free, ...).
+///
+/// Return codes, never exceptions: 1/0, a count, or a pointer/null.  None of
+/// these functions is safe inside a signal handler except where noted; the
+/// daemon runs its handler only inside its one wait (RJ_pause), so the
+/// handler never interrupts work on these structures.
+#pragma once
+
+#include <sys/types.h>
+
+#include <csignal>
+#include <cstdint>
+#include <cstdio>
+#include <ctime>
+#include <unordered_map>
+
+#include "Utility/rndctl/rj_text.h"
+
+struct Job;
+struct Dev;
+struct TASK;
+struct TaskGroup;
+struct TaskRec;
+struct RndDevList;
+struct RndJobList;
+struct RndPathList;
+
+// ---------------------------------------------------------------------------
+// Week grids: 336 half hours, index = day * 48 + slot, day 0 = Sunday.  One
+// more always-clear entry stands for the week's end (position 336), which the
+// next-available-time scans visit.
+constexpr int RJ_WEEK = 336;
+constexpr int RJ_WEEK_SCAN = 337;
+
+// Job run states (Job_get_runstate) and resource lock states (Dev_get_lockstate).
+enum { RUN_UNSET = 0, RUN_PAUSED = 1, RUN_AVAILABLE = 2, RUN_SCHEDULE = 3, RUN_NOW = 4 };
+enum { LOCK_UNSET = 0, LOCK_LOCKED = 1, LOCK_AVAILABLE = 2, LOCK_SCHEDULE = 3 };
+
+// Task status codes: the index into task_status_table.
+enum {
+  TASK_PENDING = 0,
+  TASK_CRASHED = 1,
+  TASK_RUNNING = 2,
+  TASK_FINISHED = 3,
+  TASK_ABORTED = 4,
+  TASK_FAILED = 5,
+  TASK_STARTED = 6,
+  TASK_STOPPED = 7
+};
+
+// The shared files, by index into control_names.
+enum {
+  FILE_JOBS = 0,
+  FILE_RESOURCES = 1,
+  FILE_TASKS = 2,
+  FILE_EDITPIDS = 3,
+  FILE_DEV_INDEX = 4,
+  FILE_JOB_INDEX = 5,
+  FILE_ACCESS = 6,
+  FILE_STATUS = 7,
+  FILE_COUNT = 8
+};
+
+/// First-match lookup table for a record list: for each key, the first record
+/// in list order and how many records of the list share the key.  Kept up to
+/// date by the list operations of the record kind (rj_job, rj_dev); swapped
+/// together with the list head when a list is set aside (Update_from_demon).
+template <class T, class Key>
+struct RecordIndex {
+  struct Slot {
+    T* first = nullptr;  // non-owning
+    int count = 0;
+  };
+  std::unordered_map<Key, Slot> slots;
+};
+
+// ---------------------------------------------------------------------------
+// Job record (rj_job).  Strings are owned Texts; links are non-owning.
+struct Job {
+  Job* next = nullptr;
+  Job* prev = nullptr;
+  int pick_level = 0;
+  void* listitem = nullptr;  // editor's list entry; non-owning
+  int index = 0;
+  Text name;
+  Text status;
+  int priority = 0;
+  Text sdl;
+  int use_sdl_paths = 1;
+  int output_mask = 0;
+  Text pix;
+  Text matte;
+  int animate = 0;
+  float frames[3] = {0.0f, 0.0f, 0.0f};  // start, end, by
+  int fields = 0;
+  int extension = 0;  // flag word; the reader stores 291
+  int ext_start = 0;
+  int ext_by = 1;
+  int ext_size = 1;
+  int totalframes = 1;
+  int doneframes = 0;
+  int further[4] = {0, 0, 0, 0};
+  Text comment;
+  Text executable;
+  Text rnd_opts;
+  Text further_text;
+  Text user;
+  RndDevList* resources = nullptr;   // owned pick list
+  RndPathList* searchpath = nullptr;  // owned path list
+  int lock_pid = 0;
+  int deleted = 0;  // deletion mark: the next write of the job file drops it
+  int del_when_done = 0;
+  int save_out = 0;
+  int ctrl = RUN_AVAILABLE;
+  int runs[RJ_WEEK_SCAN] = {};
+};
+
+// Resource ("dev") record: one render host as the queue sees it (rj_dev).
+struct Dev {
+  Dev* next = nullptr;
+  Dev* prev = nullptr;
+  int index = 0;
+  Text name;
+  Text host_name;
+  Text comment;
+  Text remote_location;
+  int status = LOCK_SCHEDULE;
+  void* listitem = nullptr;  // editor's list entry; non-owning
+  int word1 = 0;
+  int max_frames = 4;
+  int num_processors = 0;
+  int locks[RJ_WEEK_SCAN] = {};
+  int words[2] = {0, 0};
+  int lock_pid = 0;
+  int word2 = 0;
+  int default_dev = 0;
+  RndJobList* jobs = nullptr;  // owned mirror of the jobs' pick lists
+  TASK* last_task = nullptr;   // last task started on it; non-owning
+};
+
+// Pick lists (rj_lst).
+struct RndDevList {  // hangs from a job: a resource the job may use
+  RndDevList* next = nullptr;
+  RndDevList* prev = nullptr;
+  Dev* dev = nullptr;  // non-owning
+  int picked = 0;
+  RndJobList* mirror = nullptr;  // the matching entry of dev->jobs; non-owning
+};
+struct RndJobList {  // hangs from a resource: a job that names it
+  RndJobList* next = nullptr;
+  RndJobList* prev = nullptr;
+  Job* job = nullptr;  // non-owning
+  int picked = 0;
+  RndDevList* mirror = nullptr;  // non-owning
+};
+struct RndPathList {  // hangs from a job: one image search path
+  RndPathList* next = nullptr;
+  RndPathList* prev = nullptr;
+  Text path;
+};
+
+// ---------------------------------------------------------------------------
+// Tasks (rj_tskio, rj_task).
+struct TaskGroup {
+  TaskGroup* next = nullptr;
+  Job* job = nullptr;         // non-owning
+  TaskRec* tasks = nullptr;   // records in creation order
+  int next_task_id = 0;
+};
+
+struct TaskRec {
+  TaskRec* next = nullptr;
+  TaskGroup* group = nullptr;  // owning group, or null once the group is gone
+  TASK* task = nullptr;        // running-task entry that owns it; non-owning
+  float start = 0.0f;
+  float end = 0.0f;
+  float current = 0.0f;
+  int status = TASK_PENDING;
+  int retries = 0;
+  int id = 0;
+  int keep = 0;  // 1: the group's release frees it; 2: the next release only clears the mark
+  Text output;
+  Dev* dev = nullptr;  // non-owning
+};
+
+/// Running-task entry: links a task record to the process that renders it.
+struct TASK {
+  TASK* next = nullptr;
+  TASK* prev = nullptr;
+  TaskRec* rec = nullptr;  // owned once the entry has taken it over
+  Job* job = nullptr;      // non-owning; null when the job left the file
+  volatile int pid = 0;        // written by the SIGCHLD handler
+  volatile int waitstatus = 0;  // exit value, written by the SIGCHLD handler
+  FILE* stream = nullptr;  // owned: the task's log stream, open for reading
+  Text out_path;
+  Text stream_path;
+  Text output;
+  float progress = 0.0f;
+  int work = 0;
+  int stale = 0;
+};
+
+// ---------------------------------------------------------------------------
+/// The control block: the one process-wide record every part reads.
+struct RndCtl {
+  Job* current_job = nullptr;  // non-owning
+  Job* jobs = nullptr;         // owned list
+  Dev* current_dev = nullptr;  // non-owning
+  Dev* devs = nullptr;         // owned list
+  TASK* tasks = nullptr;       // owned list of running-task entries
+  Text location;               // the control directory
+  Text user;
+  Text host;
+  int64_t last_update = 0;  // host update time (ns) as of the last reconciling reload
+  int pid = 0;
+  volatile int running = 0;  // render children started and not yet reaped
+  unsigned interval_min = 0;
+  unsigned interval_sec = 0;
+  volatile int signal_seen = 0;
+  int editors = 0;
+  int single_pass = 0;
+  Text install;
+  int out_counter = 0;     // names the render output files
+  int stream_counter = 0;  // names the task log streams
+  RecordIndex<Job, int> job_index;
+  RecordIndex<Dev, int> dev_index;
+};
+
+extern RndCtl rndctl;
+
+// ---------------------------------------------------------------------------
+// Diagnostics and process identity (rj_rndctl).
+extern int debug;          // gates dbgpnt; any non-zero level acts as 1
+extern int debug_fileacc;  // gates dbg_logfile
+extern const char* PrgName;
+extern char* ProgramName;
+extern char ApplModeName[64];
+
+void dbgpnt(const char* format, ...) __attribute__((format(printf, 1, 2)));
+void EDuprintf(const char* format, ...) __attribute__((format(printf, 1, 2)));
+void wrt_logfile(const char* format, ...) __attribute__((format(printf, 1, 2)));
+void dbg_logfile(const char* format, ...) __attribute__((format(printf, 1, 2)));
+
+/// The clock of the whole queue.  Tests replace `rj_clock`.
+extern time_t (*rj_clock)();
+time_t rj_now();
+
+/// The temporary directory: DRCTMPDIR, else "/usr/tmp" when it exists, else "/var/tmp".
+const char* rj_tmpdir();
+
+void RJC_init_rndctl(const char* location);
+int64_t daemon_updatetime_set(const char* host);
+int64_t daemon_updatetime_get(const char* host);
+int64_t editor_updatetime_get();
+long IS_enough_disk();
+extern long min_disk_space;
+
+// Editor stubs: the daemon shares code with the editors.
+int is_editor();
+void sounder(int code);
+void IR_repoint_editor_list();
+void IR_rebuild_rndctl();
+void Update_control_and_editors(void* what);
+
+// ---------------------------------------------------------------------------
+// Locked file operations (rj_fileio).
+extern const char* const control_names[FILE_COUNT];
+int init_fileop();
+int lock_fileop(int index, int take);
+FILE* read_fileop(int index);
+FILE* update_fileop(int index);
+void rewind_fileop(int index);
+void close_fileop(int index);
+void close_and_truncate_fileop(int index);
+mode_t get_original_umask();
+/// The path of shared file `index` ("%s/%s"), building the table when needed.
+const char* fileop_path(int index);
+/// The access log stream opened by init_fileop, or null.
+FILE* fileop_access_stream();
+/// Closes the access log and forgets every path, so that the next lock or
+/// open builds the table again (a process that changes control directory).
+void fileop_reset();
+
+// Editor registry (rj_editreg).
+void Editor_process_list(int mode);
+int Editor_process_validate(int pid);
+const char* Editor_process_getuser(int pid);
+
+// Reload and write-back (rj_reload).
+int RJC_reload(int flag);
+int RRC_reload(int flag);
+void Job_control_write(const char* dir);
+void Resource_control_write(const char* dir);
+int RJC_parse();
+int get_fvalue(const char* text, float* value);
+void Update_from_demon(int editor);
+int RJC_in();
+void RJC_out();
+
+// Signals and child tracking (rj_signal).
+extern volatile int last_signal;
+void sig_handler(int sig);
+int RJ_signal(const char* host, int pid, int sig);
+const char* RGget_sig_desc(int sig);
+int RJ_sighold(int sig);
+int RJ_sigrelse(int sig);
+int RJ_sigignore(int sig);
+int RJ_sigset(int sig, void (*handler)(int));
+unsigned RJ_alarm(unsigned seconds);
+int RJ_pause();
+int RJ_wait(int* status);
+
+// ---------------------------------------------------------------------------
+// Control-file language (RJClex.l, RJCgram.y, rj_write).
+extern FILE* RJCin;
+extern FILE* RJCout;
+extern const char* RJCreadfile;
+extern const char* RJCpath;
+extern int RJCcurrent_lineno;
+extern int RJClineno;
+int RJCparse();
+int RJClex();
+int RJCwrap();
+void RJCerror(const char* message);
+void RJClexerror(const char* text);
+/// How a syntax or lexical error ends the process; tests replace it.
+extern void (*RJC_fatal_exit)(int status);
+/// Parses a control file held in memory (for tests and fuzzers).
+int RJC_parse_string(const char* text, size_t length, const char* file_name);
+void Job_control_write_dev(FILE* fp);
+void Resource_control_write_dev(FILE* fp);
+
+// ---------------------------------------------------------------------------
+// Job records (rj_job).
+Job* Job_new(Job* before, void* listitem, const char* path, int index);
+Job* Add_a_job(void* listitem, const char* path, int index);
+Job* Insert_a_job(Job* before, void* listitem, const char* path, int index);
+Job* Job_by_listitem(void* item);
+Job* Job_by_name(const char* name);
+Job* Job_by_index(int index);
+int ISA_resource_usedby(Job* job, Dev* dev);
+int get_job_pick_level(Job* job);
+void reorder_picklevels();
+Job* Job_del(Job* job);
+int Job_get_runstate(const char* word);
+int Job_available(Job* job);
+void setcurrent_job(Job* job);
+Job* Job_clone(Job* job);
+void Job_Error_Update(TASK* entry);  // rj_joberr
+
+// Resource records (rj_dev) and pick lists (rj_lst).
+Dev* Dev_new(Dev* before, void* listitem, const char* name, int index);
+Dev* Add_a_dev(void* listitem, const char* name, int index);
+Dev* Insert_a_dev(Dev* before, void* listitem, const char* name, int index);
+Dev* Dev_by_name(const char* name);
+Dev* Dev_by_index(int index);
+Dev* dev_by_listitem(void* item);
+Dev* Dev_del(Dev* dev);
+int Dev_get_lockstate(const char* word);
+void Dev_field_check();
+void reset_autoadd_dev();
+void setcurrent_dev(Dev* dev);
+int Dev_processes_available(Dev* dev);  // rj_select
+
+RndDevList* RndDevList_add(Job* job, Dev* dev);
+Dev* RndDevList_del(Job* job, Dev* dev);
+void RndDevList_pick(Job* job, Dev* dev);
+Dev* RndDevList_picked(Job* job);
+RndJobList* RndJobList_add(Dev* dev, Job* job, RndDevList* mirror);
+Job* RndJobList_del(Dev* dev, Job* job);
+void RndJobList_pick(Dev* dev, Job* job);
+Job* RndJobList_picked(Dev* dev);
+RndPathList* RndPathList_add(Job* job, const char* path);
+void RndPathList_del(Job* job, const char* path);
+
+// Job validation and comparison (rj_jobcheck).
+int RJCget_next_index(int file_id);
+char* get_strstr(const char* key, char* line);
+int Job_check_sdlfields(Job* job);
+int Job_set_frame_range(Job* job);
+int Calc_frame_range(float start, float end, float step);
+int Job_check_sdl(Job* job);
+int rj_strcmp(const char* a, const char* b);
+void Job_field_check();
+int Job_file_search(const char* host);
+int ISA_devdif(Dev* a, Dev* b);
+int ISA_jobdif(Job* a, Job* b);
+
+// Weekly schedules (rj_schedule).
+extern const char* const day_table[7];
+extern const char* const day_nametable[7][4];
+extern const char* const time_table[48];
+extern float last_float_time_index;
+const char* Schedule_get_day(const char* name);
+void Schedule_job_runs(Job* job, int start, int end, const char* first_day, const char* last_day);
+void Schedule_dev_lock(Dev* dev, int start, int end, const char* first_day, const char* last_day);
+int Schedule_get_a_block(int* grid, int times[2], const char* days[2]);
+int set_in_betweens(int* grid, const int a[2], const int b[2], int mode);
+int get_abbreviated_day_index(const char* abbr);
+int get_current_schedule_index();
+int Job_schedule_check(Job* job);
+int Dev_schedule_check(const char* host);
+int get_next_available_time(const char* host, int index);
+int job_get_next_available_time(Job* job, int index);
+
+// ---------------------------------------------------------------------------
+// Task groups, records and the task file (rj_tskio); running-task entries (rj_task).
+extern const char* const task_status_table[];
+const char* GetTaskStatusStr(int code);
+int ISA_task_status(const char* text, int* code);
+TaskGroup* TaskGroup_alloc(Job* job, int next_task_id);
+TaskRec* TaskRec_alloc(TaskGroup* group, float start, float end, float current, Dev* dev,
+                       int status, const char* status_text, int id);
+void TaskRec_free(TaskRec* rec);
+void TaskRec_freeOnly(TaskRec* rec);
+void TaskGroup_free(TaskGroup** list, TaskGroup* group);
+/// Frees every group of a list and every record still owned by a group.
+void TaskGroup_free_all(TaskGroup** list);
+int TaskGroup_find(TaskGroup* group, const char* host);
+int Task_find(TaskGroup* groups, const char* host);
+TaskGroup* TaskGroup_by_job(TaskGroup* groups, Job* job);
+TASK* Task_add(Job* job, TaskRec* rec);
+void TASK_free(TASK* entry);
+TASK* Task_by_pid(int pid);  // safe in the SIGCHLD handler (a list walk)
+TaskGroup* Task_read(FILE* fp);
+TaskGroup* TaskGroup_read(FILE* fp);
+int Task_write(FILE* fp, TaskGroup* groups);
+int TaskGroup_write(FILE* fp, TaskGroup* group);
+int Task_write_dump(TaskGroup* groups);
+int TaskGroup_write_dump(TaskGroup* group);
+void Task_file_dump();
+int Task_file_search(const char* host);
+void Task_file_update(Job* job);
+int Task_file_check(Job* job);
+void Editor_load_Tasks();
+void Task_update_status();
+void Task_sfile_dump(Dev* dev);
+char* Task_current_filenames(Job* job, Dev* dev);
+
+// Task selection and splitting (rj_select).
+TASK* GetaPendingTask();
+TASK* Get_a_task();
+TASK* Task_get();
+void insert_unknown_pending_jobs(TaskGroup** groups);
+TaskRec* insert_task(TaskGroup** groups, Job* job, float start, float end, int status);
+TaskRec* extract_pending_task(TaskGroup** groups);
+TaskGroup* get_highest_taskgroup(TaskGroup* groups, int mode);
+TaskRec* check_for_pending_tasks(TaskGroup* group);
+int isa_job_using_host(const char* host, Job* job);
+TASK* match_a_taskrec(TaskRec* rec);
+void split_a_task(TaskGroup* group, TaskRec* rec);
+TaskRec* Split_first_splittable_failed_tasks();
+TaskRec* Task_split_and_insert(TaskRec* rec);
+void Walk_rndctl_tasks(const char* label);
+void Check_for_same_task(TASK* entry);
+void Check_RndTasks(const char* label);
+
+// Running a task (rj_perform).
+int Perform_a_Task(TASK* entry);
+int rj_system(char* const argv[], const char* stream_path, const char* out_path, Job* job);
+int rj_splitpath(const char* path, char** base, char** dir, const char* last);
+void rj_set_paths(Job* job, char** path, char** root);
+int get_task_frame_range(TASK* entry, int* first_extension);
+int get_current_frame_extension(Job* job, Dev* dev, int* extension);
+void Job_Log_out(Job* job);
+FILE* Logfile_open(Job* job);
+FILE* Logfile_open_nr(Job* job);
+void daemon_kill_running_tasks(const char* host);
+
+// Task status, job state and progress (rj_status).
+int SetTaskStatus(TASK* entry, int status);
+int ISA_task_running(TASK* entry);
+int ISA_task_active(TASK* entry);
+int UpdateRunningTasks();
+int VerifyRunningTasks();
+int set_image_percentage_done(TASK* entry);
+void Job_clear_tasks(Job* job);
+void UpdateJobState(Job* job);

@@ -1,0 +1,2 @@
+// The render daemon: one per render host.
+int main() { return 1; }
