@@ -184,8 +184,8 @@ long IS_enough_disk() {
     perror("Control File System:");
     memset(&fs, 0, sizeof fs);
   }
-  long long available = static_cast<long long>(fs.f_bavail) * static_cast<long long>(fs.f_frsize) -
-                        min_disk_space;
+  long long available =
+      static_cast<long long>(fs.f_bavail) * static_cast<long long>(fs.f_frsize) - min_disk_space;
   dbgpnt("available_disk = %d\n", static_cast<int>(available));
   return static_cast<long>(available);
 }

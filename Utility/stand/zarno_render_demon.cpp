@@ -1,2 +1,268 @@
-// The render daemon: one per render host.
-int main() { return 1; }
+// zarno_render_demon: the render daemon, one per render host.
+//
+// It claims its host's pid file (a second daemon on the same host refuses to
+// start), sends its diagnostics to a per-host log in the temporary directory,
+// loads the control files and then serves: reload what changed, judge the
+// render programs that ended, start what this host may render, and wait in
+// 20-second steps until something changes.  It exits (status 1) when its pid
+// file no longer names it or when it has found no work for a long time.
+#include <fcntl.h>
+#include <getopt.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <csignal>
+#include <cstdint>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <ctime>
+
+#include "Shared/memory/MA_rtns.h"
+#include "Utility/rndctl/rndctl.h"
+
+namespace {
+
+void pid_file_path(char* out, size_t size) {
+  snprintf(out, size, "%s/%s.pid", rndctl.location.or_else("."), rndctl.host.or_else(""));
+}
+
+// Reads the 4-byte native pid of this host's pid file; 0 when absent or short.
+// Returns false when the file cannot be opened.
+bool read_pid_file(int* pid, bool log_failures) {
+  char path[4096];
+  pid_file_path(path, sizeof path);
+  *pid = 0;
+  FILE* fp = fopen(path, "r");
+  if (fp == nullptr) {
+    if (log_failures) wrt_logfile("error openning \"%s\", <%s>", path, strerror(errno));
+    return false;
+  }
+  int32_t value = 0;
+  if (fread(&value, sizeof value, 1, fp) != 1) {
+    const char* why = ferror(fp) ? strerror(errno) : "short pid file";
+    dbgpnt("%s\n", why);
+    if (log_failures) wrt_logfile("%s", why);
+    value = 0;
+  }
+  fclose(fp);
+  *pid = value;
+  return true;
+}
+
+// Start-up pid check: 1 when another daemon is alive on this host, else
+// claims the pid file and returns 0.
+int pid_file_startup_check() {
+  int pid = 0;
+  read_pid_file(&pid, false);
+  int alive = 0;
+  if (pid != 0) {
+    if (RJ_signal(rndctl.host.c_str(), pid, 0) != 0) {
+      dbgpnt("process is DEAD --> %s:%d\n", rndctl.host.c_str(), pid);
+    } else {
+      dbgpnt("process is alive --> %s:%d\n", rndctl.host.c_str(), pid);
+      alive = 1;
+    }
+  }
+  daemon_updatetime_set(rndctl.host.c_str());
+  if (alive) return 1;
+
+  char path[4096];
+  pid_file_path(path, sizeof path);
+  FILE* fp = fopen(path, "w");
+  if (fp != nullptr) {
+    int32_t value = rndctl.pid;
+    if (fwrite(&value, sizeof value, 1, fp) != 1) EDuprintf("%s", strerror(errno));
+    if (fclose(fp) != 0) EDuprintf("%s", strerror(errno));
+  }
+  return 0;
+}
+
+bool self_check() {
+  int pid = 0;
+  if (!read_pid_file(&pid, true)) return false;
+  return pid == rndctl.pid;
+}
+
+int work_check() {
+  if (rndctl.running != 0) return rndctl.running;
+  int found = Task_file_search(rndctl.host.c_str());
+  if (found != 0) return found;
+  return Job_file_search(rndctl.host.c_str());
+}
+
+// The per-host log.  It lives in a world-writable directory: remove whatever
+// stands there and create the file anew, refusing to follow a planted link.
+void open_log_file() {
+  char path[4096];
+  snprintf(path, sizeof path, "%s/zarno_render_demon.LOG", rj_tmpdir());
+  unlink(path);
+  int fd = open(path, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_APPEND, 0644);
+  if (fd < 0) {
+    dbgpnt("failed to reopen stderr as %s\n", path);
+    return;
+  }
+  fflush(stderr);
+  fflush(stdout);
+  if (dup2(fd, 2) < 0) dbgpnt("failed to reopen stderr as %s\n", path);
+  if (dup2(fd, 1) < 0) dbgpnt("failed to reopen %s as stdout\n", path);
+  close(fd);
+}
+
+// Refuses a control directory that cannot work, instead of waiting for ever
+// on the first lock.
+void check_control_directory() {
+  const char* dir = rndctl.location.c_str();
+  struct stat st;
+  const char* why = nullptr;
+  if (stat(dir, &st) != 0) {
+    why = strerror(errno);
+  } else if (!S_ISDIR(st.st_mode)) {
+    why = "not a directory";
+  } else if (access(dir, W_OK | X_OK) != 0) {
+    why = "not writable";
+  }
+  if (why != nullptr) {
+    fprintf(stderr, "%s: control directory %s: %s\n", PrgName, dir, why);
+    exit(-1);
+  }
+}
+
+int interval_seconds() { return static_cast<int>(rndctl.interval_min * 60 + rndctl.interval_sec); }
+
+// The service loop.  Returns when the daemon is to exit.
+void zrd() {
+  const char* host = rndctl.host.c_str();
+  VerifyRunningTasks();
+  // Deliberately the unconverted index: a free host (-1) starts as "locked"
+  // and a host locked in slot 0 as "free", so that the first wake-up in
+  // either case performs a transition.
+  int locked = Dev_schedule_check(host);
+
+  // SIGALRM and SIGCHLD stay blocked from here on; RJ_pause lets them
+  // through only while it waits.
+  RJ_sighold(SIGALRM);
+  RJ_sighold(SIGCHLD);
+  RJ_sigset(SIGALRM, sig_handler);
+  RJ_sigset(SIGCHLD, sig_handler);
+  int interval = interval_seconds();
+  umask(2);
+  int idle = 10;
+
+  for (;;) {
+    if (daemon_updatetime_get(host) != rndctl.last_update) Update_from_demon(0);
+    UpdateRunningTasks();
+    for (TASK* task = GetaPendingTask(); task != nullptr; task = GetaPendingTask()) {
+      if (Perform_a_Task(task) == 0) SetTaskStatus(task, TASK_FAILED);
+    }
+    UpdateRunningTasks();
+
+    time_t start = time(nullptr);
+    bool reload = daemon_updatetime_get(host) != rndctl.last_update || interval < 0;
+    while (!reload) {
+      RJ_alarm(20);
+      RJ_pause();
+      if (!self_check()) {
+        wrt_logfile("Exiting due to self check failure");
+        return;
+      }
+      if (work_check() == 0) {
+        idle = idle - 1;
+        if (idle < 0) {
+          dbg_logfile("Exiting due to no work found");
+          return;
+        }
+      } else {
+        idle = 180;
+      }
+      interval = interval_seconds();
+      int elapsed = static_cast<int>(time(nullptr) - start);
+      dbgpnt("pause %d:%02d\t\tsec since last check = %d\n", rndctl.interval_min,
+             rndctl.interval_sec, elapsed);
+
+      int r = Dev_schedule_check(host);
+      if (r >= 0 && !locked) {
+        dbgpnt("locked = %d\n", 1);
+        daemon_updatetime_set(host);
+        daemon_kill_running_tasks(host);
+        locked = 1;
+      } else if (r < 0 && locked) {
+        dbgpnt("locked = %d\n", 0);
+        locked = 0;
+        daemon_updatetime_set(host);
+      }
+
+      if (daemon_updatetime_get(host) != rndctl.last_update) {
+        reload = true;
+      } else if (interval == 0 || elapsed < interval) {
+        continue;
+      } else {
+        reload = true;
+      }
+    }
+
+    RJ_sighold(SIGALRM);
+    RJ_sighold(SIGCHLD);
+    dbgpnt("good morning\n");
+    dbgpnt("somthings changed\n");  // read by log watchers: keep the spelling
+    RJC_in();
+  }
+}
+
+}  // namespace
+
+int main(int argc, char* argv[]) {
+  umask(2);
+
+  const char* slash = strrchr(argv[0], '/');
+  PrgName = slash != nullptr ? slash + 1 : argv[0];
+  MA_init();
+  ProgramName = MA_strdup(PrgName, __LINE__, "Utility/stand/zarno_render_demon");
+  snprintf(ApplModeName, sizeof ApplModeName, "%s", PrgName);
+
+  debug = 0;
+  rndctl.single_pass = 0;
+
+  int interval = 0;
+  const char* location = nullptr;
+  bool debug_given = false;
+  opterr = 0;  // unknown options are ignored without a word
+  int c;
+  while ((c = getopt(argc, argv, "u:l:d:s")) != -1) {
+    switch (c) {
+      case 'u':
+        interval = atoi(optarg);
+        break;
+      case 'l':
+        location = optarg;
+        break;
+      case 'd':
+        debug = atoi(optarg);
+        debug_given = true;
+        break;
+      case 's':
+        rndctl.single_pass = 1;
+        break;
+      default:
+        break;
+    }
+  }
+  if (!debug_given) {
+    const char* level = getenv("RNDCTL_DEBUG");
+    if (level != nullptr) debug = atoi(level);
+  }
+
+  RJC_init_rndctl(location);
+  check_control_directory();
+  if (interval != 0) {
+    rndctl.interval_min = static_cast<unsigned>(interval / 60);
+    rndctl.interval_sec = static_cast<unsigned>(interval % 60);
+  }
+
+  if (pid_file_startup_check() != 0) exit(1);
+  open_log_file();
+  RJC_in();
+  zrd();
+  exit(1);
+}
