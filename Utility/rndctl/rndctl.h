@@ -293,6 +293,13 @@ FILE* fileop_access_stream();
 /// Closes the access log and forgets every path, so that the next lock or
 /// open builds the table again (a process that changes control directory).
 void fileop_reset();
+/// Seconds between two attempts at a busy lock (5; tests lower it).
+extern unsigned fileop_poll_seconds;
+/// One look at a busy lock directory: when its access time is 181 seconds old
+/// or older, removes its holder file and the directory, reports the break on
+/// stderr and in the access log, and returns 1; otherwise (also when it is
+/// gone) returns 0.  lock_fileop calls it between its attempts.
+int fileop_break_stale_lock(const char* lock_path);
 
 // Editor registry (rj_editreg).
 void Editor_process_list(int mode);
