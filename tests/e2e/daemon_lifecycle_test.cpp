@@ -1,0 +1,132 @@
+// The daemon as a process: singleton per host, its pid file, its log, its
+// service loop's wake-ups and its ways to exit.
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include "tests/e2e/e2e_support.h"
+
+namespace {
+
+// Waits until the daemon has claimed the pid file, opened its log and
+// entered its loop (from then on SIGALRM wakes it instead of ending it).
+bool started(Farm& farm, Daemon& d) {
+  return wait_for([&] { return read_pid_file(farm.path(d.host + ".pid")) == d.pid && d.in_loop(); },
+                  20);
+}
+
+// Wakes the daemon once and waits until it has traced `n` pauses in all.
+bool woken(Daemon& d, int n) {
+  d.wake();
+  return wait_for([&] { return count_of(d.log(), "pause ") >= n || d.ended(); }, 10);
+}
+
+TEST(DaemonLifecycle, SecondDaemonOnTheSameHostRefusesToStart) {
+  Farm farm;
+  Daemon& first = farm.start_on_farm();
+  ASSERT_TRUE(started(farm, first));
+
+  Daemon& second = farm.start_on_farm();
+  ASSERT_TRUE(wait_for([&] { return second.ended(); }, 20));
+  EXPECT_EQ(second.exit_code(), 1);
+  std::string early = read_text_file(second.tmpdir + "/early");
+  EXPECT_NE(
+      early.find("process is alive --> " + first.host + ":" + std::to_string(first.pid) + "\n"),
+      std::string::npos)
+      << early;
+  EXPECT_EQ(read_pid_file(farm.path(first.host + ".pid")), first.pid);
+  EXPECT_FALSE(first.ended());
+}
+
+TEST(DaemonLifecycle, StalePidFileIsTakenOver) {
+  Farm farm;
+  int gone = dead_pid();
+  write_pid_file(farm.path(this_host_name() + ".pid"), gone);
+  Daemon& d = farm.start_on_farm();
+  ASSERT_TRUE(started(farm, d));
+  std::string early = read_text_file(d.tmpdir + "/early");
+  EXPECT_NE(early.find("process is DEAD --> " + d.host + ":" + std::to_string(gone)),
+            std::string::npos)
+      << early;
+}
+
+TEST(DaemonLifecycle, RemovedPidFileEndsTheDaemonAtItsNextWakeUp) {
+  Farm farm;
+  Daemon& d = farm.start_on_farm();
+  ASSERT_TRUE(started(farm, d));
+  ASSERT_EQ(unlink(farm.path(d.host + ".pid").c_str()), 0);
+  d.wake();
+  ASSERT_TRUE(wait_for([&] { return d.ended(); }, 20));
+  EXPECT_EQ(d.exit_code(), 1);
+  std::string access = farm.read("Render_Access");
+  EXPECT_NE(access.find("* Exiting due to self check failure --  " + d.host +
+                        ":zarno_render_demon(" + std::to_string(d.pid) + ") "),
+            std::string::npos)
+      << access;
+  EXPECT_NE(access.find("error openning \""), std::string::npos) << access;
+}
+
+TEST(DaemonLifecycle, CheckIntervalFromTheCommandLineShowsInThePauseTrace) {
+  Farm farm;
+  Daemon& d = farm.start_on_farm({"-u", "150"});
+  ASSERT_TRUE(started(farm, d));
+  ASSERT_TRUE(woken(d, 1));
+  EXPECT_NE(d.log().find("pause 2:30\t\tsec since last check = "), std::string::npos) << d.log();
+}
+
+TEST(DaemonLifecycle, ExitsOnTheEleventhWorklessWakeUp) {
+  Farm farm;
+  Daemon& d = farm.start_on_farm();
+  ASSERT_TRUE(started(farm, d));
+  for (int i = 1; i <= 10; ++i) ASSERT_TRUE(woken(d, i)) << "wake-up " << i;
+  EXPECT_FALSE(d.ended());
+  d.wake();
+  ASSERT_TRUE(wait_for([&] { return d.ended(); }, 20));
+  EXPECT_EQ(d.exit_code(), 1);
+  EXPECT_EQ(count_of(d.log(), "pause "), 10);
+}
+
+TEST(DaemonLifecycle, RefusesAControlDirectoryThatIsNotThere) {
+  Farm farm;
+  Daemon& d = farm.start({"-l", farm.path("missing")});
+  ASSERT_TRUE(wait_for([&] { return d.ended(); }, 20));
+  EXPECT_EQ(d.exit_code(), 255);
+  std::string early = read_text_file(d.tmpdir + "/early");
+  EXPECT_NE(early.find("control directory " + farm.path("missing")), std::string::npos) << early;
+  EXPECT_EQ(count_of(early, "\n"), 1) << early;
+}
+
+TEST(DaemonLifecycle, APlantedLinkDoesNotRedirectTheLog) {
+  Farm farm;
+  std::string tmp = farm.path("plantedtmp");
+  ASSERT_EQ(mkdir(tmp.c_str(), 0777), 0);
+  std::string victim = farm.path("victim");
+  write_text_file(victim, "precious\n");
+  ASSERT_EQ(symlink(victim.c_str(), (tmp + "/zarno_render_demon.LOG").c_str()), 0);
+  Daemon& d = farm.start_on_farm({}, "", {"DRCTMPDIR=" + tmp});
+  d.tmpdir = tmp;
+  ASSERT_TRUE(started(farm, d));
+  EXPECT_EQ(read_text_file(victim), "precious\n");
+  struct stat st;
+  ASSERT_EQ(lstat((tmp + "/zarno_render_demon.LOG").c_str(), &st), 0);
+  EXPECT_TRUE(S_ISREG(st.st_mode));
+}
+
+TEST(DaemonLifecycle, DebugOptionWinsOverTheEnvironment) {
+  Farm farm;
+  Daemon& traced = farm.start({"-l", farm.dir()}, "", {"RNDCTL_DEBUG=3"});
+  ASSERT_TRUE(started(farm, traced));
+  ASSERT_EQ(unlink(farm.path(traced.host + ".pid").c_str()), 0);
+  traced.wake();
+  ASSERT_TRUE(wait_for([&] { return traced.ended(); }, 20));
+
+  Daemon& quiet = farm.start({"-l", farm.dir(), "-d", "0"}, "", {"RNDCTL_DEBUG=1"});
+  ASSERT_TRUE(started(farm, quiet));
+  ASSERT_EQ(unlink(farm.path(quiet.host + ".pid").c_str()), 0);
+  // Its exit proves it went through a wake-up without tracing anything.
+  quiet.wake();
+  ASSERT_TRUE(wait_for([&] { return quiet.ended(); }, 20));
+  EXPECT_EQ(quiet.exit_code(), 1);
+  EXPECT_EQ(quiet.log(), "");
+}
+
+}  // namespace

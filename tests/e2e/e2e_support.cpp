@@ -1,0 +1,173 @@
+#include "tests/e2e/e2e_support.h"
+
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstdint>
+#include <cstdlib>
+#include <thread>
+
+std::string this_host_name() {
+  char host[64];
+  if (gethostname(host, sizeof host) != 0) return "";
+  host[sizeof host - 1] = '\0';
+  return host;
+}
+
+bool Daemon::in_loop() const {
+  if (pid <= 0 || reaped) return false;
+  std::string status = read_text_file("/proc/" + std::to_string(pid) + "/status");
+  size_t at = status.find("SigCgt:");
+  if (at == std::string::npos) return false;
+  unsigned long long caught = strtoull(status.c_str() + at + 7, nullptr, 16);
+  return (caught & (1ULL << (SIGALRM - 1))) != 0;
+}
+
+void Daemon::wake() const {
+  if (pid > 0 && !reaped) kill(pid, SIGALRM);
+}
+
+bool Daemon::ended() {
+  if (reaped) return true;
+  if (pid <= 0) return true;
+  int st = 0;
+  pid_t r = waitpid(pid, &st, WNOHANG);
+  if (r == pid) {
+    status = st;
+    reaped = true;
+  }
+  return reaped;
+}
+
+int Daemon::exit_code() const {
+  if (!reaped || !WIFEXITED(status)) return -1;
+  return WEXITSTATUS(status);
+}
+
+void Daemon::stop() {
+  if (pid <= 0 || reaped) return;
+  kill(pid, SIGKILL);
+  int st = 0;
+  if (waitpid(pid, &st, 0) == pid) {
+    status = st;
+    reaped = true;
+  }
+}
+
+Farm::Farm() {
+  const char* tmp = getenv("TMPDIR");
+  std::string base = std::string(tmp != nullptr ? tmp : "/tmp") + "/rndctl_e2e_XXXXXX";
+  char* made = mkdtemp(base.data());
+  if (made != nullptr) {
+    scratch_ = made;
+    dir_ = scratch_ + "/ctl";
+    mkdir(dir_.c_str(), 0777);
+  }
+}
+
+Farm::~Farm() {
+  for (Daemon* d : daemons_) {
+    d->stop();
+    // Render programs run in their own process groups; end what is left.
+    delete d;
+  }
+  if (!scratch_.empty() && getenv("RJ_KEEP_TEST_DIRS") == nullptr) remove_tree(scratch_);
+}
+
+void Farm::write(const std::string& name, const std::string& content) const {
+  write_text_file(path(name), content);
+}
+
+Daemon& Farm::start(const std::vector<std::string>& args, const std::string& host,
+                    const std::vector<std::string>& env) {
+  auto* d = new Daemon();
+  daemons_.push_back(d);
+  d->host = host.empty() ? this_host_name() : host;
+  d->tmpdir = scratch_ + "/tmp" + std::to_string(counter_++);
+  mkdir(d->tmpdir.c_str(), 0777);
+  std::string early = d->tmpdir + "/early";
+
+  std::vector<std::string> argv;
+  bool own_uts = !host.empty() && host != this_host_name();
+  if (own_uts) {
+    argv = {"/usr/bin/unshare", "-u", "/bin/sh", "-c", "hostname \"$0\" && exec \"$@\"", host,
+            DAEMON_PATH};
+  } else {
+    argv = {DAEMON_PATH};
+  }
+  for (const auto& a : args) argv.push_back(a);
+
+  pid_t pid = fork();
+  if (pid == 0) {
+    setenv("DRCTMPDIR", d->tmpdir.c_str(), 1);
+    unsetenv("RNDCTL_DEBUG");
+    for (const auto& e : env) putenv(const_cast<char*>(e.c_str()));
+    int fd = open(early.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    if (fd >= 0) {
+      dup2(fd, 1);
+      dup2(fd, 2);
+      close(fd);
+    }
+    std::vector<char*> cargv;
+    for (auto& a : argv) cargv.push_back(a.data());
+    cargv.push_back(nullptr);
+    execv(cargv[0], cargv.data());
+    _exit(127);
+  }
+  d->pid = pid;
+  return *d;
+}
+
+Daemon& Farm::start_on_farm(const std::vector<std::string>& extra, const std::string& host,
+                            const std::vector<std::string>& env) {
+  std::vector<std::string> args = {"-l", dir_, "-d", "1"};
+  for (const auto& a : extra) args.push_back(a);
+  return start(args, host, env);
+}
+
+bool wait_for(const std::function<bool()>& done, double seconds, Daemon* wake) {
+  auto deadline = std::chrono::steady_clock::now() + std::chrono::duration<double>(seconds);
+  int round = 0;
+  while (std::chrono::steady_clock::now() < deadline) {
+    if (done()) return true;
+    if (wake != nullptr && ++round % 25 == 0) wake->wake();
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  }
+  return done();
+}
+
+int count_of(const std::string& text, const std::string& needle) {
+  int n = 0;
+  for (size_t at = text.find(needle); at != std::string::npos; at = text.find(needle, at + 1)) ++n;
+  return n;
+}
+
+bool is_root() { return geteuid() == 0; }
+
+int read_pid_file(const std::string& path) {
+  int32_t pid = 0;
+  FILE* fp = fopen(path.c_str(), "r");
+  if (fp == nullptr) return 0;
+  if (fread(&pid, sizeof pid, 1, fp) != 1) pid = 0;
+  fclose(fp);
+  return pid;
+}
+
+void write_pid_file(const std::string& path, int pid) {
+  FILE* fp = fopen(path.c_str(), "w");
+  if (fp == nullptr) return;
+  int32_t value = pid;
+  fwrite(&value, sizeof value, 1, fp);
+  fclose(fp);
+}
+
+int dead_pid() {
+  pid_t child = fork();
+  if (child == 0) _exit(0);
+  int st;
+  waitpid(child, &st, 0);
+  return child;
+}

@@ -1,0 +1,83 @@
+// End-to-end support: a control directory in a temporary folder and real
+// daemon processes started on it, woken with SIGALRM instead of waiting.
+#pragma once
+
+#include <sys/types.h>
+
+#include <functional>
+#include <string>
+#include <vector>
+
+#include "tests/support/test_support.h"
+
+/// This machine's host name, as a daemon started here sees it.
+std::string this_host_name();
+
+/// A running (or ended) daemon process.
+struct Daemon {
+  pid_t pid = -1;
+  int status = -1;  // wait status once reaped
+  bool reaped = false;
+  std::string host;    // the host name it runs under
+  std::string tmpdir;  // its DRCTMPDIR (where its log is)
+  std::string log_path() const { return tmpdir + "/zarno_render_demon.LOG"; }
+  std::string log() const { return read_text_file(log_path()); }
+  /// True once the daemon catches SIGALRM (it has entered its service loop;
+  /// before that a SIGALRM would end it).
+  bool in_loop() const;
+  /// Sends SIGALRM: the daemon wakes as from its 20-second alarm.
+  void wake() const;
+  /// True once the process has ended (reaps it).
+  bool ended();
+  /// Exit code once ended (-1 when killed by a signal or still running).
+  int exit_code() const;
+  /// Kills and reaps the process when it still runs.
+  void stop();
+};
+
+/// A temporary control directory and the daemons started on it.
+class Farm {
+ public:
+  Farm();
+  ~Farm();
+  Farm(const Farm&) = delete;
+  Farm& operator=(const Farm&) = delete;
+
+  const std::string& dir() const { return dir_; }
+  std::string path(const std::string& name) const { return dir_ + "/" + name; }
+  void write(const std::string& name, const std::string& content) const;
+  std::string read(const std::string& name) const { return read_text_file(path(name)); }
+
+  /// Starts a daemon with `args` (the control directory is not added) and
+  /// its own DRCTMPDIR.  With a host name other than this machine's, the
+  /// daemon runs in its own UTS namespace under that name (needs root).
+  /// Its stdout and stderr before the log takes over go to "<tmpdir>/early".
+  Daemon& start(const std::vector<std::string>& args, const std::string& host = "",
+                const std::vector<std::string>& env = {});
+  /// Starts a daemon on this control directory ("-l dir -d 1" plus `extra`).
+  Daemon& start_on_farm(const std::vector<std::string>& extra = {}, const std::string& host = "",
+                        const std::vector<std::string>& env = {});
+
+ private:
+  std::string dir_;
+  std::string scratch_;
+  int counter_ = 0;
+  std::vector<Daemon*> daemons_;
+};
+
+/// Polls `done` every few milliseconds, waking `daemon` (when given) now and
+/// then, until it holds or `seconds` have passed.  Returns whether it held.
+bool wait_for(const std::function<bool()>& done, double seconds, Daemon* wake = nullptr);
+
+/// Counts the occurrences of `needle` in `text`.
+int count_of(const std::string& text, const std::string& needle);
+
+/// True when running as root (needed for UTS namespaces).
+bool is_root();
+
+/// The 4-byte native pid stored in a pid file, or 0.
+int read_pid_file(const std::string& path);
+/// Writes a 4-byte native pid file.
+void write_pid_file(const std::string& path, int pid);
+/// The pid of a process that has surely ended (a reaped child).
+int dead_pid();
