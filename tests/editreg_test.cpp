@@ -1,0 +1,166 @@
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <fstream>
+#include <ostream>
+#include <string>
+
+#include "tests/support/test_support.h"
+
+namespace {
+
+// A pid that surely names no process: a child that has been reaped.
+int dead_pid() {
+  pid_t child = fork();
+  if (child == 0) _exit(0);
+  int status = 0;
+  waitpid(child, &status, 0);
+  return child;
+}
+
+std::string entry(const std::string& host, int pid, const std::string& user) {
+  return host + " " + std::to_string(pid) + " " + user + "\n";
+}
+
+class EditRegTest : public ControlDirTest {
+ protected:
+  void SetUp() override {
+    ControlDirTest::SetUp();
+    fileop_poll_seconds = 0;
+  }
+  // Records linked in by a test are the test's own: unlink them before the
+  // fixture frees the lists.
+  void TearDown() override {
+    rndctl.jobs = nullptr;
+    rndctl.devs = nullptr;
+    ControlDirTest::TearDown();
+  }
+};
+
+TEST_F(EditRegTest, DeadEditorIsDroppedAndItsRecordsFreed) {
+  int dead = dead_pid();
+  int alive = getppid();
+  write_file("RndCtl_EditPids", entry("testhost", dead, "gone") + entry("testhost", alive, "ed"));
+
+  Job held_by_dead, held_by_alive;
+  held_by_dead.lock_pid = dead;
+  held_by_alive.lock_pid = alive;
+  held_by_dead.next = &held_by_alive;
+  Dev dev;
+  dev.lock_pid = dead;
+  rndctl.jobs = &held_by_dead;
+  rndctl.devs = &dev;
+
+  Editor_process_list(0);
+
+  EXPECT_EQ(read_file("RndCtl_EditPids"), entry("testhost", alive, "ed"));
+  EXPECT_EQ(held_by_dead.lock_pid, 0);
+  EXPECT_EQ(held_by_alive.lock_pid, alive);
+  EXPECT_EQ(dev.lock_pid, 0);
+
+  // Only entry dead: the registry ends up empty.
+  write_file("RndCtl_EditPids", entry("testhost", dead, "gone"));
+  Editor_process_list(0);
+  EXPECT_EQ(read_file("RndCtl_EditPids"), "");
+  EXPECT_FALSE(std::ifstream(path("RndCtl_EditPids.lock")).good());
+}
+
+TEST_F(EditRegTest, ValidateAnswersFromTheTableUntilTheFileChanges) {
+  write_file("RndCtl_EditPids",
+             entry("h1", 111, "anna") + entry("h2", 222, "bert") + entry("h4", 444, "dora"));
+  EXPECT_EQ(Editor_process_validate(222), 222);
+  EXPECT_EQ(Editor_process_validate(333), 0);
+  EXPECT_STREQ(Editor_process_getuser(111), "anna");
+  EXPECT_EQ(Editor_process_getuser(333), nullptr);
+
+  // Rewritten behind our back with the same modification time: not re-read.
+  struct stat st;
+  ASSERT_EQ(stat(path("RndCtl_EditPids").c_str(), &st), 0);
+  write_file("RndCtl_EditPids", entry("h3", 333, "carl"));
+  struct timespec same[2] = {st.st_atim, st.st_mtim};
+  ASSERT_EQ(utimensat(AT_FDCWD, path("RndCtl_EditPids").c_str(), same, 0), 0);
+  EXPECT_EQ(Editor_process_validate(222), 222);
+  EXPECT_EQ(Editor_process_validate(333), 0);
+
+  // One nanosecond newer is a change.
+  struct timespec newer[2] = {st.st_atim, st.st_mtim};
+  if (++newer[1].tv_nsec == 1000000000) {
+    newer[1].tv_nsec = 0;
+    newer[1].tv_sec++;
+  }
+  ASSERT_EQ(utimensat(AT_FDCWD, path("RndCtl_EditPids").c_str(), newer, 0), 0);
+  EXPECT_EQ(Editor_process_validate(333), 333);
+  EXPECT_EQ(Editor_process_validate(222), 0);
+  // Users of an earlier load are still found past the end of the table.
+  EXPECT_STREQ(Editor_process_getuser(444), "dora");
+}
+
+class RegistrationTest : public EditRegTest, public ::testing::WithParamInterface<int> {};
+
+TEST_P(RegistrationTest, RegistersUpToFifteenEditors) {
+  const int already = GetParam();
+  std::string before;
+  for (int i = 0; i < already; i++) before += entry("h" + std::to_string(i), 1000 + i, "u");
+  write_file("RndCtl_EditPids", before);
+
+  testing::internal::CaptureStderr();
+  Editor_process_list(1);
+  std::string err = testing::internal::GetCapturedStderr();
+
+  if (already < 15) {
+    EXPECT_EQ(read_file("RndCtl_EditPids"), before + entry("testhost", getpid(), "tester"));
+    EXPECT_EQ(err, "");
+  } else {
+    EXPECT_EQ(read_file("RndCtl_EditPids"), before);
+    EXPECT_NE(err.find("not registered"), std::string::npos) << err;
+  }
+}
+
+INSTANTIATE_TEST_SUITE_P(Counts, RegistrationTest, testing::Values(0, 14, 15));
+
+struct Garbled {
+  const char* name;
+  std::string file;
+  std::string kept;  // what a rewrite keeps
+};
+
+void PrintTo(const Garbled& g, std::ostream* os) { *os << g.name; }
+
+class GarbledRegistryTest : public EditRegTest, public ::testing::WithParamInterface<Garbled> {};
+
+TEST_P(GarbledRegistryTest, ReadingStopsWhereTheFileStopsMakingSense) {
+  write_file("RndCtl_EditPids", GetParam().file);
+  Editor_process_list(2);
+  EXPECT_EQ(read_file("RndCtl_EditPids"), GetParam().kept);
+}
+
+const std::string kGood = "h1 10 u1\n";
+
+INSTANTIATE_TEST_SUITE_P(
+    Inputs, GarbledRegistryTest,
+    testing::Values(Garbled{"Empty", "", ""}, Garbled{"BlankLines", "\n\n  \n", ""},
+                    Garbled{"TruncatedEntry", kGood + "h2 20", kGood},
+                    Garbled{"PidNotANumber", kGood + "h2 x u2\n" + entry("h3", 30, "u3"), kGood},
+                    Garbled{"HostTooLong", std::string(100, 'H') + " 20 u2\n" + kGood, ""},
+                    Garbled{"UserTooLong", kGood + "h2 20 " + std::string(200, 'U') + "\n" + kGood,
+                            kGood},
+                    Garbled{"PidOverflow", kGood + "h2 99999999999 u2\n", kGood},
+                    Garbled{"PidZero", kGood + "h2 0 u2\n" + kGood, kGood},
+                    Garbled{"PidNegative", kGood + "h2 -5 u2\n", kGood},
+                    Garbled{"Binary", kGood + std::string("\x01\xff\x00\x02", 4), kGood},
+                    Garbled{"SixteenEntries",
+                            [] {
+                              std::string s;
+                              for (int i = 0; i < 16; i++) s += entry("h", 100 + i, "u");
+                              return s;
+                            }(),
+                            [] {
+                              std::string s;
+                              for (int i = 0; i < 15; i++) s += entry("h", 100 + i, "u");
+                              return s;
+                            }()}),
+    [](const auto& info) { return std::string(info.param.name); });
+
+}  // namespace
