@@ -1,13 +1,213 @@
-// Stub bodies: replaced by the real implementation.
+// Pick lists: the resources a job may use (hanging from the job), their
+// mirror the jobs that name a resource (hanging from the resource), and a
+// job's image search paths.  A resource entry and its mirror point at each
+// other; removing either removes both.
+#include <unordered_map>
+
+#include "Shared/memory/MA_rtns.h"
 #include "Utility/rndctl/rndctl.h"
 
-RndDevList* RndDevList_add(Job* /*job*/, Dev* /*dev*/) { return {}; }
-Dev* RndDevList_del(Job* /*job*/, Dev* /*dev*/) { return {}; }
-void RndDevList_pick(Job* /*job*/, Dev* /*dev*/) {}
-Dev* RndDevList_picked(Job* /*job*/) { return {}; }
-RndJobList* RndJobList_add(Dev* /*dev*/, Job* /*job*/, RndDevList* /*mirror*/) { return {}; }
-Job* RndJobList_del(Dev* /*dev*/, Job* /*job*/) { return {}; }
-void RndJobList_pick(Dev* /*dev*/, Job* /*job*/) {}
-Job* RndJobList_picked(Dev* /*dev*/) { return {}; }
-RndPathList* RndPathList_add(Job* /*job*/, const char* /*path*/) { return {}; }
-void RndPathList_del(Job* /*job*/, const char* /*path*/) {}
+namespace {
+
+const char* const kUnit = "Utility/rndctl/rj_lst";
+
+// The allocator trace names resource entries by this tag.
+constexpr int kDevEntryTag = 122;
+
+template <class E>
+void append(E*& head, E* entry) {
+  if (head == nullptr) {
+    head = entry;
+    return;
+  }
+  E* last = head;
+  while (last->next != nullptr) last = last->next;
+  last->next = entry;
+  entry->prev = last;
+}
+
+template <class E>
+void unlink(E*& head, E* entry) {
+  if (entry->prev != nullptr)
+    entry->prev->next = entry->next;
+  else if (head == entry)
+    head = entry->next;
+  if (entry->next != nullptr) entry->next->prev = entry->prev;
+  entry->next = entry->prev = nullptr;
+}
+
+// A resource named by every job has ten thousand entries in its job list;
+// appending by walking would make reading the job file quadratic.  The tail
+// of each resource's job list is remembered here and checked before use.
+std::unordered_map<const Dev*, RndJobList*>& job_list_tails() {
+  static auto* tails = new std::unordered_map<const Dev*, RndJobList*>;
+  return *tails;
+}
+
+void append_job_entry(Dev* dev, RndJobList* entry) {
+  auto& tails = job_list_tails();
+  auto it = tails.find(dev);
+  RndJobList* last = dev->jobs;
+  if (it != tails.end() && it->second->next == nullptr &&
+      (it->second->prev != nullptr || dev->jobs == it->second))
+    last = it->second;
+  if (last == nullptr) {
+    dev->jobs = entry;
+  } else {
+    while (last->next != nullptr) last = last->next;
+    last->next = entry;
+    entry->prev = last;
+  }
+  tails[dev] = entry;
+}
+
+// Takes one entry out of a resource's job list and frees it; the other half
+// of the pair is left to the caller.
+void drop_job_entry(Dev* dev, RndJobList* entry) {
+  auto& tails = job_list_tails();
+  auto it = tails.find(dev);
+  if (it != tails.end() && it->second == entry) {
+    if (entry->prev != nullptr)
+      it->second = entry->prev;
+    else
+      tails.erase(it);
+  }
+  unlink(dev->jobs, entry);
+  if (dev->jobs == nullptr) tails.erase(dev);
+  if (entry->mirror != nullptr) entry->mirror->mirror = nullptr;
+  entry->mirror = nullptr;
+  entry->picked = -1;
+  MA_delete(entry, __LINE__, kUnit);
+}
+
+void drop_dev_entry(Job* job, RndDevList* entry) {
+  unlink(job->resources, entry);
+  if (entry->mirror != nullptr) entry->mirror->mirror = nullptr;
+  entry->mirror = nullptr;
+  entry->picked = -1;
+  MA_delete(entry, __LINE__, kUnit);
+}
+
+}  // namespace
+
+RndDevList* RndDevList_add(Job* job, Dev* dev) {
+  if (job == nullptr || dev == nullptr) return nullptr;
+  for (RndDevList* e = job->resources; e != nullptr; e = e->next)
+    if (e->dev == dev || (e->dev != nullptr && e->dev->index == dev->index)) return e;
+
+  RndDevList* entry = MA_new<RndDevList>(kDevEntryTag, kUnit);
+  if (entry == nullptr) return nullptr;
+  entry->dev = dev;
+  entry->picked = 0;
+  // Both halves exist before either is linked: out of memory links nothing.
+  if (RndJobList_add(dev, job, entry) == nullptr) {
+    MA_delete(entry, __LINE__, kUnit);
+    return nullptr;
+  }
+  append(job->resources, entry);
+  return entry;
+}
+
+Dev* RndDevList_del(Job* job, Dev* dev) {
+  if (job == nullptr) return nullptr;
+  RndDevList* entry = job->resources;
+  while (entry != nullptr && entry->dev != dev) entry = entry->next;
+  if (entry == nullptr) return nullptr;
+
+  RndDevList* after = entry->next;
+  RndDevList* before = entry->prev;
+  RndJobList* mirror = entry->mirror;
+  drop_dev_entry(job, entry);
+  if (mirror != nullptr && dev != nullptr)
+    drop_job_entry(dev, mirror);
+  else
+    RndJobList_del(dev, job);
+  if (after != nullptr) return after->dev;
+  if (before != nullptr) return before->dev;
+  return nullptr;
+}
+
+void RndDevList_pick(Job* job, Dev* dev) {
+  if (job == nullptr) return;
+  for (RndDevList* e = job->resources; e != nullptr; e = e->next) e->picked = e->dev == dev ? 1 : 0;
+}
+
+Dev* RndDevList_picked(Job* job) {
+  if (job == nullptr) return nullptr;
+  for (RndDevList* e = job->resources; e != nullptr; e = e->next)
+    if (e->picked != 0) return e->dev;
+  return nullptr;
+}
+
+RndJobList* RndJobList_add(Dev* dev, Job* job, RndDevList* mirror) {
+  if (dev == nullptr || job == nullptr) return nullptr;
+  RndJobList* entry = nullptr;
+  // Called for a job's new entry, the job cannot be in the list yet (the
+  // job's own list was searched); only a lone add searches.
+  if (mirror == nullptr) {
+    entry = dev->jobs;
+    while (entry != nullptr && entry->job != job &&
+           (entry->job == nullptr || entry->job->index != job->index))
+      entry = entry->next;
+  }
+  if (entry == nullptr) {
+    entry = MA_new<RndJobList>(__LINE__, kUnit);
+    if (entry == nullptr) return nullptr;
+    entry->job = job;
+    entry->picked = 0;
+    append_job_entry(dev, entry);
+  }
+  if (mirror != nullptr) {
+    entry->mirror = mirror;
+    mirror->mirror = entry;
+  }
+  return entry;
+}
+
+Job* RndJobList_del(Dev* dev, Job* job) {
+  if (dev == nullptr) return nullptr;
+  RndJobList* entry = dev->jobs;
+  while (entry != nullptr && entry->job != job) entry = entry->next;
+  if (entry == nullptr) return nullptr;
+
+  RndJobList* after = entry->next;
+  RndJobList* before = entry->prev;
+  RndDevList* mirror = entry->mirror;
+  drop_job_entry(dev, entry);
+  if (mirror != nullptr && job != nullptr) drop_dev_entry(job, mirror);
+  if (after != nullptr) return after->job;
+  if (before != nullptr) return before->job;
+  return nullptr;
+}
+
+void RndJobList_pick(Dev* dev, Job* job) {
+  if (dev == nullptr) return;
+  for (RndJobList* e = dev->jobs; e != nullptr; e = e->next) e->picked = e->job == job ? 1 : 0;
+}
+
+Job* RndJobList_picked(Dev* dev) {
+  if (dev == nullptr) return nullptr;
+  for (RndJobList* e = dev->jobs; e != nullptr; e = e->next)
+    if (e->picked != 0) return e->job;
+  return nullptr;
+}
+
+RndPathList* RndPathList_add(Job* job, const char* path) {
+  if (job == nullptr) return nullptr;
+  RndPathList* entry = MA_new<RndPathList>(__LINE__, kUnit);
+  if (entry == nullptr) return nullptr;
+  entry->path.set(path);
+  append(job->searchpath, entry);
+  return entry;
+}
+
+void RndPathList_del(Job* job, const char* path) {
+  if (job == nullptr) return;
+  for (RndPathList* e = job->searchpath; e != nullptr; e = e->next) {
+    if (rj_strcmp(e->path.c_str(), path) == 0) {
+      unlink(job->searchpath, e);
+      MA_delete(e, __LINE__, kUnit);
+      return;
+    }
+  }
+}

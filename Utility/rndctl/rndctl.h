@@ -25,6 +25,7 @@
 #include <cstdint>
 #include <cstdio>
 #include <ctime>
+#include <string>
 #include <unordered_map>
 
 #include "Utility/rndctl/rj_text.h"
@@ -237,6 +238,7 @@ struct RndCtl {
   int stream_counter = 0;  // names the task log streams
   RecordIndex<Job, int> job_index;
   RecordIndex<Dev, int> dev_index;
+  RecordIndex<Dev, std::string> dev_name_index;  // names as set by Dev_new/Dev_set_name
 };
 
 extern RndCtl rndctl;
@@ -380,6 +382,8 @@ int Dev_get_lockstate(const char* word);
 void Dev_field_check();
 void reset_autoadd_dev();
 void setcurrent_dev(Dev* dev);
+/// Renames a resource; renames must go through here so Dev_by_name stays right.
+void Dev_set_name(Dev* dev, const char* name);
 int Dev_processes_available(Dev* dev);  // rj_select
 
 RndDevList* RndDevList_add(Job* job, Dev* dev);
