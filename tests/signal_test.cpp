@@ -1,0 +1,131 @@
+// Signal handling: reaping render programs, the liveness probe, the texts.
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <string>
+
+#include "tests/support/test_support.h"
+
+namespace {
+
+class SignalTest : public ControlDirTest {
+ protected:
+  void SetUp() override {
+    ControlDirTest::SetUp();
+    sigset_t set;
+    sigemptyset(&set);
+    sigaddset(&set, SIGCHLD);
+    sigprocmask(SIG_BLOCK, &set, &saved_);
+  }
+  void TearDown() override {
+    sigprocmask(SIG_SETMASK, &saved_, nullptr);
+    rndctl.tasks = nullptr;  // the entries below live on the stack
+    ControlDirTest::TearDown();
+  }
+  // A child that ends as `how` says; returns once it is a zombie.
+  pid_t ended_child(int how) {
+    pid_t pid = fork();
+    if (pid == 0) {
+      if (how < 0) raise(-how);
+      _exit(how);
+    }
+    siginfo_t info;
+    waitid(P_PID, pid, &info, WEXITED | WNOWAIT);
+    return pid;
+  }
+  sigset_t saved_;
+};
+
+TEST_F(SignalTest, OneHandlerCallJudgesEveryChildThatEnded) {
+  TASK entries[3];
+  TaskRec recs[3];
+  int hows[3] = {0, 3, -SIGKILL};
+  for (int i = 0; i < 3; ++i) {
+    recs[i].id = i;
+    entries[i].rec = &recs[i];
+    entries[i].pid = ended_child(hows[i]);
+    entries[i].waitstatus = 77;
+    entries[i].next = i < 2 ? &entries[i + 1] : nullptr;
+    entries[i].prev = i > 0 ? &entries[i - 1] : nullptr;
+  }
+  rndctl.tasks = &entries[0];
+  pid_t stranger = ended_child(5);  // not a task of ours: reaped all the same
+  rndctl.running = 4;
+
+  sig_handler(SIGCHLD);
+
+  EXPECT_EQ(rndctl.running, 0);
+  EXPECT_EQ(rndctl.signal_seen, 1);
+  EXPECT_EQ(last_signal, SIGCHLD);
+  int expected[3] = {0, 3, SIGKILL};
+  for (int i = 0; i < 3; ++i) {
+    EXPECT_EQ(entries[i].pid, 0) << i;
+    EXPECT_EQ(entries[i].waitstatus, expected[i]) << i;
+  }
+  EXPECT_EQ(waitpid(stranger, nullptr, WNOHANG), -1);  // no zombie left
+}
+
+TEST_F(SignalTest, AChildEndingTouchesTheHostUpdateTime) {
+  std::string pid_file = path("testhost.pid");
+  write_file("testhost.pid", "abcd");
+  struct timespec old_times[2] = {{1000, 0}, {1000, 0}};
+  ASSERT_EQ(utimensat(AT_FDCWD, pid_file.c_str(), old_times, 0), 0);
+  int64_t before = daemon_updatetime_get("testhost");
+  ended_child(0);
+  rndctl.running = 1;
+  sig_handler(SIGCHLD);
+  EXPECT_GT(daemon_updatetime_get("testhost"), before);
+}
+
+TEST_F(SignalTest, SignalsGoToLocalProcessesOnlyAndProbesTellLiveFromDead) {
+  pid_t sleeper = fork();
+  if (sleeper == 0) {
+    pause();
+    _exit(0);
+  }
+  // A signal for another host is never sent, yet reported as sent.
+  EXPECT_EQ(RJ_signal("otherhost", sleeper, SIGKILL), 0);
+  EXPECT_EQ(waitpid(sleeper, nullptr, WNOHANG), 0);
+
+  EXPECT_EQ(RJ_signal(nullptr, 0, 0), 0);
+  EXPECT_EQ(RJ_signal("testhost", sleeper, 0), 0);
+  pid_t gone = ended_child(0);
+  waitpid(gone, nullptr, 0);
+  EXPECT_NE(RJ_signal("testhost", gone, 0), 0);
+
+  EXPECT_EQ(RJ_signal("testhost", sleeper, SIGKILL), 0);
+  int status = 0;
+  ASSERT_EQ(waitpid(sleeper, &status, 0), sleeper);
+  EXPECT_TRUE(WIFSIGNALED(status));
+}
+
+TEST_F(SignalTest, RemoteProbeRunsTheRemoteShellWithoutALocalShell) {
+  // A stand-in remote shell: runs the command it was given locally.
+  std::string rsh = path("fake_rsh");
+  write_file("fake_rsh", "#!/bin/sh\nshift; shift\nexec /bin/sh -c \"$1\"\n");
+  chmod(rsh.c_str(), 0755);
+  setenv("ZARNO_RSH", rsh.c_str(), 1);
+  EXPECT_EQ(RJ_signal("farhost", getpid(), 0), 0);
+  // A host name is one argument, never shell text.
+  std::string marker = path("owned");
+  std::string evil = "x;touch " + marker;
+  RJ_signal(evil.c_str(), getpid(), 0);
+  EXPECT_NE(access(marker.c_str(), F_OK), 0);
+  unsetenv("ZARNO_RSH");
+}
+
+TEST(SignalDescriptions, TableAndFallback) {
+  EXPECT_STREQ(RGget_sig_desc(1), "recieved SIGHUP (Hangup)");
+  EXPECT_STREQ(RGget_sig_desc(9), "SIGKILL (Killed)");
+  EXPECT_STREQ(RGget_sig_desc(16), "SIGUSR1 (out of vertual mem)");
+  EXPECT_STREQ(RGget_sig_desc(31), "SIGXFSZ File size limit exceeded Core Dumped");
+  for (int sig : {0, 5, 20, 22, 25, 30, 32, 40, -1}) {
+    EXPECT_STREQ(RGget_sig_desc(sig), "Unrecognized SIGNAL") << sig;
+  }
+}
+
+}  // namespace
