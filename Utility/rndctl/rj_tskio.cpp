@@ -1,29 +1,818 @@
-// Stub bodies: replaced by the real implementation.
+// Task groups and task records, the Render_Tasks file and the per-host
+// status files under TSKSTAT.
+//
+// Render_Tasks is shared by every daemon and editor and is rewritten whole on
+// each pick, so it is read and written in one piece: the whole file is read
+// into memory and scanned there, and each group is formatted into a buffer
+// and written with one call.  The text is the same as field-by-field stdio
+// would give ("%d", "%f" of a float), only cheaper for files of many
+// thousand records.
+//
+// A damaged file (cut short, garbled, hand-edited) must never take a daemon
+// down: every field is checked as it is scanned, scanning stops where the
+// text stops making sense, and the next rewrite writes what was understood.
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <climits>
+#include <cmath>
+#include <cstdint>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <string>
+#include <vector>
+
+#include "Shared/memory/MA_rtns.h"
 #include "Utility/rndctl/rndctl.h"
 
-const char* GetTaskStatusStr(int /*code*/) { return {}; }
-int ISA_task_status(const char* /*text*/, int* /*code*/) { return {}; }
-TaskGroup* TaskGroup_alloc(Job* /*job*/, int /*next_task_id*/) { return {}; }
-TaskRec* TaskRec_alloc(TaskGroup* /*group*/, float /*start*/, float /*end*/, float /*current*/, Dev* /*dev*/, int /*status*/, const char* /*status_text*/, int /*id*/) { return {}; }
-void TaskRec_free(TaskRec* /*rec*/) {}
-void TaskRec_freeOnly(TaskRec* /*rec*/) {}
-void TaskGroup_free(TaskGroup** /*list*/, TaskGroup* /*group*/) {}
-void TaskGroup_free_all(TaskGroup** /*list*/) {}
-int TaskGroup_find(TaskGroup* /*group*/, const char* /*host*/) { return {}; }
-int Task_find(TaskGroup* /*groups*/, const char* /*host*/) { return {}; }
-TaskGroup* TaskGroup_by_job(TaskGroup* /*groups*/, Job* /*job*/) { return {}; }
-TaskGroup* Task_read(FILE* /*fp*/) { return {}; }
-TaskGroup* TaskGroup_read(FILE* /*fp*/) { return {}; }
-int Task_write(FILE* /*fp*/, TaskGroup* /*groups*/) { return {}; }
-int TaskGroup_write(FILE* /*fp*/, TaskGroup* /*group*/) { return {}; }
-int Task_write_dump(TaskGroup* /*groups*/) { return {}; }
-int TaskGroup_write_dump(TaskGroup* /*group*/) { return {}; }
-void Task_file_dump() {}
-int Task_file_search(const char* /*host*/) { return {}; }
-void Task_file_update(Job* /*job*/) {}
-int Task_file_check(Job* /*job*/) { return {}; }
-void Editor_load_Tasks() {}
-void Task_update_status() {}
-void Task_sfile_dump(Dev* /*dev*/) {}
-char* Task_current_filenames(Job* /*job*/, Dev* /*dev*/) { return {}; }
-const char* const task_status_table[] = {"PENDING", "CRASHED", "RUNNING", "FINISHED", "ABORTED", "FAILED", "STARTED", "STOPPED", nullptr};
+namespace {
+
+constexpr const char* kUnit = "Utility/rndctl/rj_tskio";
+constexpr int kStatusCount = 8;
+
+// Debug lines print record addresses with "%x", as the log readers expect.
+unsigned px(const void* p) { return static_cast<unsigned>(reinterpret_cast<uintptr_t>(p)); }
+
+bool is_space(int c) {
+  return c == ' ' || c == '\t' || c == '\n' || c == '\v' || c == '\f' || c == '\r';
+}
+
+// Whitespace-separated tokens, either from a buffer that the source may
+// write into (each token is NUL-terminated in place) or straight from a
+// stream (only as far as needed, so that a caller may go on reading the
+// stream after one group).  Over-long tokens in stream mode are consumed
+// whole but kept only up to kMaxToken characters: no field of these files is
+// legitimately longer.
+class TokenSource {
+ public:
+  static constexpr size_t kMaxToken = 4096;
+
+  explicit TokenSource(FILE* fp) : fp_(fp) {}
+  TokenSource(char* text, size_t length) : p_(text), end_(text + length) {}
+
+  /// The first character of the next token, or EOF; consumes only whitespace.
+  int peek() {
+    if (fp_ != nullptr) {
+      int c;
+      do c = getc_unlocked(fp_);
+      while (c != EOF && is_space(c));
+      if (c != EOF) ungetc(c, fp_);
+      return c;
+    }
+    while (p_ < end_ && is_space(static_cast<unsigned char>(*p_))) ++p_;
+    return p_ < end_ ? static_cast<unsigned char>(*p_) : EOF;
+  }
+
+  /// The next token, NUL-terminated, or null at the end of the input.
+  const char* next() {
+    if (peek() == EOF) return nullptr;
+    if (fp_ != nullptr) {
+      token_.clear();
+      int c;
+      while ((c = getc_unlocked(fp_)) != EOF && !is_space(c)) {
+        if (token_.size() < kMaxToken) token_.push_back(static_cast<char>(c));
+      }
+      return token_.c_str();
+    }
+    char* start = p_;
+    while (p_ < end_ && !is_space(static_cast<unsigned char>(*p_))) ++p_;
+    // The buffer has one spare byte past its end, so the last token can be
+    // terminated too.
+    *p_ = '\0';
+    if (p_ < end_) ++p_;
+    return start;
+  }
+
+  bool next_int(int* out) {
+    const char* t = next();
+    if (t == nullptr) return false;
+    char* stop = nullptr;
+    errno = 0;
+    long v = strtol(t, &stop, 10);
+    if (stop == t || *stop != '\0' || errno != 0 || v < INT_MIN || v > INT_MAX) return false;
+    *out = static_cast<int>(v);
+    return true;
+  }
+
+  bool next_float(float* out) {
+    const char* t = next();
+    if (t == nullptr) return false;
+    if (fast_decimal(t, out)) return true;
+    char* stop = nullptr;
+    errno = 0;
+    float v = strtof(t, &stop);
+    // Infinities and NaNs are not frame numbers; a file holding them is
+    // damaged, and letting them through would poison every later division.
+    if (stop == t || *stop != '\0' || !std::isfinite(v)) return false;
+    *out = v;
+    return true;
+  }
+
+ private:
+  // "[-]d{1,7}[.d{0,6}]" is all the writer ever produces for sensible frame
+  // numbers.  Such a value is m / 10^k with m < 10^13: both are exact
+  // doubles, so the quotient is correctly rounded, and it lies too far from
+  // any float rounding midpoint for the second rounding to float to differ
+  // from strtof's.
+  static bool fast_decimal(const char* t, float* out) {
+    const char* s = t;
+    bool negative = false;
+    if (*s == '-') {
+      negative = true;
+      ++s;
+    }
+    int64_t m = 0;
+    int int_digits = 0;
+    while (*s >= '0' && *s <= '9') {
+      if (++int_digits > 7) return false;
+      m = m * 10 + (*s++ - '0');
+    }
+    if (int_digits == 0) return false;
+    int frac_digits = 0;
+    if (*s == '.') {
+      ++s;
+      while (*s >= '0' && *s <= '9') {
+        if (++frac_digits > 6) return false;
+        m = m * 10 + (*s++ - '0');
+      }
+    }
+    if (*s != '\0') return false;
+    static const double kPow10[] = {1e0, 1e1, 1e2, 1e3, 1e4, 1e5, 1e6};
+    double v = static_cast<double>(m) / kPow10[frac_digits];
+    *out = static_cast<float>(negative ? -v : v);
+    return true;
+  }
+
+  FILE* fp_ = nullptr;
+  std::string token_;
+  char* p_ = nullptr;
+  char* end_ = nullptr;
+};
+
+// ---------------------------------------------------------------------------
+// Formatting into a buffer, with the exact output of "%d" and of "%f" of a
+// float promoted to double.
+
+void append_int(std::string& out, int value) {
+  char digits[16];
+  int n = 0;
+  unsigned u = value < 0 ? 0u - static_cast<unsigned>(value) : static_cast<unsigned>(value);
+  do {
+    digits[n++] = static_cast<char>('0' + u % 10);
+    u /= 10;
+  } while (u != 0);
+  if (value < 0) out.push_back('-');
+  while (n > 0) out.push_back(digits[--n]);
+}
+
+void append_fixed6(std::string& out, double value) {
+  // Exact when value * 10^6 is a whole number below 2^50: the product is
+  // then computed exactly (or within a rounding error far below the last
+  // printed digit), which covers every frame number with at most six
+  // decimals.  Anything else goes through the C library.
+  double scaled = value * 1e6;
+  if (std::isfinite(scaled) && std::fabs(scaled) < 1125899906842624.0 &&
+      scaled == std::floor(scaled)) {
+    int64_t s = static_cast<int64_t>(std::fabs(scaled));
+    if (std::signbit(value)) out.push_back('-');
+    int64_t whole = s / 1000000;
+    int64_t frac = s % 1000000;
+    char digits[24];
+    int n = 0;
+    do {
+      digits[n++] = static_cast<char>('0' + whole % 10);
+      whole /= 10;
+    } while (whole != 0);
+    while (n > 0) out.push_back(digits[--n]);
+    out.push_back('.');
+    char f[6];
+    for (int i = 5; i >= 0; --i) {
+      f[i] = static_cast<char>('0' + frac % 10);
+      frac /= 10;
+    }
+    out.append(f, 6);
+    return;
+  }
+  char buffer[512];
+  int n = snprintf(buffer, sizeof buffer, "%f", value);
+  if (n > 0) out.append(buffer, static_cast<size_t>(n) < sizeof buffer ? n : sizeof buffer - 1);
+}
+
+// ---------------------------------------------------------------------------
+// Reading groups.
+
+enum class GroupRead { kGroup, kSkipped, kEnd };
+
+// Reads one group.  kGroup: *out is the new group (it may have fewer records
+// than its line claimed when the file stops early).  kSkipped: the group's job
+// is gone; its records were read and dropped.  kEnd: nothing more can be
+// read; *out may still hold a group that was read before the end was found.
+GroupRead read_group(TokenSource& in, TaskGroup** out, bool* more) {
+  *out = nullptr;
+  *more = false;
+  int c = in.peek();
+  if (c == EOF) return GroupRead::kEnd;
+  const char* name = in.next();
+  char name_copy[1024];
+  snprintf(name_copy, sizeof name_copy, "%s", name);
+  int index = 0, numrecs = 0, next_id = 0;
+  if (!in.next_int(&index) || !in.next_int(&numrecs) || !in.next_int(&next_id)) {
+    return GroupRead::kEnd;
+  }
+  dbgpnt("%d   name(%s) id(%d) numrecs(%d) next_task_id(%d)\n", 4, name_copy, index, numrecs,
+         next_id);
+
+  Job* job = Job_by_index(index);
+  TaskGroup* group = nullptr;
+  if (job != nullptr) {
+    group = TaskGroup_alloc(job, next_id);
+    if (group == nullptr) return GroupRead::kEnd;
+  }
+
+  for (int i = 0; i < numrecs; ++i) {
+    // A record begins with its id.  Anything else means the group line
+    // claimed more records than there are: the next group starts here.
+    c = in.peek();
+    if (c == EOF) {
+      *out = group;
+      return GroupRead::kEnd;
+    }
+    if (!(c == '-' || c == '+' || (c >= '0' && c <= '9'))) break;
+    int id = 0, dev_index = 0, retries = 0;
+    float start = 0, end = 0, current = 0;
+    const char* status = nullptr;
+    if (!in.next_int(&id) || !in.next_float(&start) || !in.next_float(&end) ||
+        !in.next_float(&current) || !in.next_int(&dev_index) || !in.next_int(&retries) ||
+        (status = in.next()) == nullptr) {
+      *out = group;
+      return GroupRead::kEnd;
+    }
+    if (group == nullptr) continue;
+    TaskRec* rec = TaskRec_alloc(group, start, end, current, Dev_by_index(dev_index), TASK_PENDING,
+                                 status, id);
+    if (rec == nullptr) {
+      *out = group;
+      return GroupRead::kEnd;
+    }
+    rec->retries = retries;
+  }
+  *out = group;
+  *more = true;
+  return group != nullptr ? GroupRead::kGroup : GroupRead::kSkipped;
+}
+
+TaskGroup* read_all(TokenSource& in) {
+  dbgpnt("Task_read--------------------------------------\n");
+  TaskGroup* list = nullptr;
+  for (;;) {
+    TaskGroup* group = nullptr;
+    bool more = false;
+    GroupRead r = read_group(in, &group, &more);
+    // Each group goes on the front: every read-and-rewrite cycle reverses the
+    // order of the groups in the file, and the readers of the file live with
+    // that.
+    if (group != nullptr) {
+      group->next = list;
+      list = group;
+    }
+    if (r == GroupRead::kEnd) break;
+  }
+  dbgpnt("Task_read---------------------------------done\n\n");
+  return list;
+}
+
+// ---------------------------------------------------------------------------
+// Writing groups.
+
+void format_group(std::string& out, const TaskGroup* group, int numrecs) {
+  out.push_back('\n');
+  out.append(group->job->name.or_else("(null)"));
+  out.append("\t ");
+  append_int(out, group->job->index);
+  out.append("\t ");
+  append_int(out, numrecs);
+  out.append("\t ");
+  append_int(out, group->next_task_id);
+  out.push_back('\n');
+}
+
+void format_record(std::string& out, const TaskRec* rec) {
+  out.push_back('\t');
+  append_int(out, rec->id);
+  out.append("\t ");
+  append_fixed6(out, rec->start);
+  out.append("\t ");
+  append_fixed6(out, rec->end);
+  out.append("\t ");
+  append_fixed6(out, rec->current);
+  out.append("  ");
+  append_int(out, rec->dev != nullptr ? rec->dev->index : 0);
+  out.append("\t ");
+  append_int(out, rec->retries);
+  out.push_back('\t');
+  out.append(GetTaskStatusStr(rec->status));
+  out.push_back('\n');
+}
+
+// The daemon-alive test: the pid file names the daemon of a host.
+int daemon_alive(const char* host) {
+  char path[4096];
+  snprintf(path, sizeof path, "%s/%s.pid", rndctl.location.or_else("."), host);
+  int fd = open(path, O_RDONLY | O_CLOEXEC);
+  if (fd < 0) return 0;
+  int pid = 0;
+  ssize_t n;
+  do n = read(fd, &pid, sizeof pid);
+  while (n < 0 && errno == EINTR);
+  if (n != static_cast<ssize_t>(sizeof pid)) {
+    dbgpnt("%s\n", strerror(n < 0 ? errno : EIO));
+    if (n < 0) pid = 0;
+  }
+  close(fd);
+  if (pid == 0) return 0;
+  if (RJ_signal(host, pid, 0) == 0) {
+    dbgpnt("process is alive --> %s:%d\n", host, pid);
+    return 1;
+  }
+  dbgpnt("process is DEAD --> %s:%d\n", host, pid);
+  return 0;
+}
+
+bool on_this_host(const Dev* dev) {
+  return dev != nullptr && dev->host_name.c_str() != nullptr && rndctl.host.c_str() != nullptr &&
+         strcmp(dev->host_name.c_str(), rndctl.host.c_str()) == 0;
+}
+
+void status_file_path(char* out, size_t size, const char* host) {
+  snprintf(out, size, "%s/TSKSTAT/%s", rndctl.location.or_else("."), host);
+}
+
+// Reads a status file whole: lines "%s %d %d %s" (job name, job index,
+// status code, output).  Stops at the first line that does not scan.
+struct StatusLine {
+  std::string job;
+  int index;
+  int status;
+  std::string output;
+};
+
+bool read_status_file(const char* host, std::vector<StatusLine>* lines) {
+  char path[4096];
+  status_file_path(path, sizeof path, host);
+  int fd = open(path, O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
+  if (fd < 0) return false;
+  std::string text;
+  char chunk[65536];
+  for (;;) {
+    ssize_t n = read(fd, chunk, sizeof chunk);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) break;
+    text.append(chunk, static_cast<size_t>(n));
+  }
+  close(fd);
+  text.push_back('\0');
+  TokenSource in(text.data(), text.size() - 1);
+  for (;;) {
+    const char* job = in.next();
+    if (job == nullptr) break;
+    StatusLine line{job, 0, 0, {}};
+    if (!in.next_int(&line.index) || !in.next_int(&line.status)) break;
+    const char* output = in.next();
+    if (output == nullptr) break;
+    line.output = output;
+    lines->push_back(std::move(line));
+  }
+  return true;
+}
+
+}  // namespace
+
+// ---------------------------------------------------------------------------
+// Status names.
+
+const char* const task_status_table[] = {"PENDING", "CRASHED", "RUNNING", "FINISHED", "ABORTED",
+                                         "FAILED",  "STARTED", "STOPPED", nullptr};
+
+const char* GetTaskStatusStr(int code) {
+  // A code out of the table can only come from a damaged status file; it
+  // reads as PENDING, as an unknown name does.
+  if (code < 0 || code >= kStatusCount) return task_status_table[TASK_PENDING];
+  return task_status_table[code];
+}
+
+int ISA_task_status(const char* text, int* code) {
+  if (text == nullptr || code == nullptr) return 0;
+  for (int i = 0; task_status_table[i] != nullptr; ++i) {
+    if (strcmp(text, task_status_table[i]) == 0) {
+      *code = i;
+      return 1;
+    }
+  }
+  return 0;
+}
+
+// ---------------------------------------------------------------------------
+// Groups and records.
+
+TaskGroup* TaskGroup_alloc(Job* job, int next_task_id) {
+  TaskGroup* group = MA_new<TaskGroup>(__LINE__, kUnit);
+  if (group == nullptr) return nullptr;
+  group->job = job;
+  group->next_task_id = next_task_id;
+  dbgpnt("TaskGroup_alloc 0x%x for \"%s\"\n", px(group),
+         job != nullptr ? job->name.or_else("null") : "null");
+  return group;
+}
+
+TaskRec* TaskRec_alloc(TaskGroup* group, float start, float end, float current, Dev* dev,
+                       int status, const char* status_text, int id) {
+  TaskRec* rec = MA_new<TaskRec>(__LINE__, kUnit);
+  if (rec == nullptr) return nullptr;
+  rec->group = group;
+  rec->start = start;
+  rec->end = end;
+  rec->current = current;
+  rec->dev = dev;
+  rec->status = status;
+  rec->id = id;
+  if (status_text != nullptr) ISA_task_status(status_text, &rec->status);
+  if (group != nullptr) {
+    TaskRec** tail = &group->tasks;
+    while (*tail != nullptr) tail = &(*tail)->next;
+    *tail = rec;
+  }
+  return rec;
+}
+
+void TaskRec_free(TaskRec* rec) {
+  if (rec == nullptr) return;
+  if (rec->group != nullptr) {
+    for (TaskRec** p = &rec->group->tasks; *p != nullptr; p = &(*p)->next) {
+      if (*p == rec) {
+        *p = rec->next;
+        break;
+      }
+    }
+  }
+  // Only the entry that owns the record points back at it; an entry that
+  // has since taken another record keeps that one.
+  if (rec->task != nullptr && rec->task->rec == rec) rec->task->rec = nullptr;
+  dbgpnt("TaskRec_free 0x%x\n", px(rec));
+  rec->id = -1;
+  rec->status = TASK_PENDING;
+  MA_delete(rec, __LINE__, kUnit);
+}
+
+void TaskRec_freeOnly(TaskRec* rec) {
+  if (rec == nullptr) return;
+  if (rec->keep == 2) {
+    rec->keep = 0;
+    return;
+  }
+  TaskRec_free(rec);
+}
+
+void TaskGroup_free(TaskGroup** list, TaskGroup* group) {
+  if (group == nullptr) return;
+  if (list != nullptr) {
+    for (TaskGroup** p = list; *p != nullptr; p = &(*p)->next) {
+      if (*p == group) {
+        *p = group->next;
+        break;
+      }
+    }
+  }
+  dbgpnt("TaskGroup_free 0x%x {\n", px(group));
+  TaskRec* rec = group->tasks;
+  while (rec != nullptr) {
+    TaskRec* next = rec->next;
+    if (rec->keep == 1) {
+      rec->group = nullptr;  // the group's list is being taken apart anyway
+      TaskRec_freeOnly(rec);
+    } else {
+      // Survives, owned by its running-task entry.
+      rec->group = nullptr;
+      rec->next = nullptr;
+    }
+    rec = next;
+  }
+  group->tasks = nullptr;
+  dbgpnt("}\n");
+  MA_delete(group, __LINE__, kUnit);
+}
+
+void TaskGroup_free_all(TaskGroup** list) {
+  if (list == nullptr) return;
+  while (*list != nullptr) {
+    TaskGroup* group = *list;
+    // A record that a running-task entry has taken over stays with it, and
+    // one marked 2 is released only by a second call: both survive.
+    // Everything else read from the file goes now.
+    TaskRec* rec = group->tasks;
+    while (rec != nullptr) {
+      TaskRec* next = rec->next;
+      bool owned = rec->task != nullptr && rec->task->rec == rec;
+      if (rec->keep == 2) {
+        TaskRec_freeOnly(rec);
+      } else if (!owned) {
+        rec->keep = 1;
+      }
+      rec = next;
+    }
+    TaskGroup_free(list, group);
+  }
+}
+
+int TaskGroup_find(TaskGroup* group, const char* host) {
+  if (group == nullptr || group->job == nullptr || host == nullptr) return 0;
+  for (TaskRec* rec = group->tasks; rec != nullptr; rec = rec->next) {
+    if (rec->dev != nullptr && rec->dev->host_name.is(host)) return 1;
+  }
+  return 0;
+}
+
+int Task_find(TaskGroup* groups, const char* host) {
+  for (TaskGroup* g = groups; g != nullptr; g = g->next) {
+    if (TaskGroup_find(g, host)) return 1;
+  }
+  return 0;
+}
+
+TaskGroup* TaskGroup_by_job(TaskGroup* groups, Job* job) {
+  for (TaskGroup* g = groups; g != nullptr; g = g->next) {
+    if (g->job == job) return g;
+  }
+  return nullptr;
+}
+
+// ---------------------------------------------------------------------------
+// Reading and writing the task file.
+
+TaskGroup* TaskGroup_read(FILE* fp) {
+  if (fp == nullptr) return nullptr;
+  TokenSource in(fp);
+  TaskGroup* group = nullptr;
+  bool more = false;
+  read_group(in, &group, &more);
+  return group;
+}
+
+TaskGroup* Task_read(FILE* fp) {
+  if (fp == nullptr) return nullptr;
+  std::string text;
+  char chunk[65536];
+  size_t n;
+  while ((n = fread(chunk, 1, sizeof chunk, fp)) > 0) text.append(chunk, n);
+  text.push_back('\0');
+  TokenSource in(text.data(), text.size() - 1);
+  return read_all(in);
+}
+
+int TaskGroup_write(FILE* fp, TaskGroup* group) {
+  if (fp == nullptr || group == nullptr || group->tasks == nullptr || group->job == nullptr) {
+    return 0;
+  }
+  int numrecs = 0;
+  for (TaskRec* rec = group->tasks; rec != nullptr; rec = rec->next) ++numrecs;
+  std::string out;
+  out.reserve(64 + 72 * static_cast<size_t>(numrecs));
+  format_group(out, group, numrecs);
+  for (TaskRec* rec = group->tasks; rec != nullptr; rec = rec->next) {
+    format_record(out, rec);
+    if (debug) {
+      dbgpnt("\t%d\t %.1f\t %.1f\t%.1f %d\t %d\t%s\n", rec->id, rec->start, rec->end, rec->current,
+             rec->dev != nullptr ? rec->dev->index : 0, rec->retries,
+             GetTaskStatusStr(rec->status));
+    }
+  }
+  if (fwrite(out.data(), 1, out.size(), fp) != out.size()) {
+    perror("in TaskGroup_write");
+    return -1;
+  }
+  return 1;
+}
+
+int Task_write(FILE* fp, TaskGroup* groups) {
+  dbgpnt("Task_write--------------------------------------\n");
+  for (TaskGroup* g = groups; g != nullptr; g = g->next) {
+    if (TaskGroup_write(fp, g) < 0) return -1;
+  }
+  dbgpnt("Task_write---------------------------------done\n\n");
+  return 0;
+}
+
+int TaskGroup_write_dump(TaskGroup* group) {
+  if (group == nullptr || group->tasks == nullptr || group->job == nullptr) return 0;
+  int numrecs = 0;
+  for (TaskRec* rec = group->tasks; rec != nullptr; rec = rec->next) ++numrecs;
+  if (printf("\n%s   %d  %d  %d\n", group->job->name.or_else("(null)"), group->job->index, numrecs,
+             group->next_task_id) < 0) {
+    perror("in TaskGroup_write_dump");
+    return -1;
+  }
+  for (TaskRec* rec = group->tasks; rec != nullptr; rec = rec->next) {
+    if (printf("\t%d   %f  %f  %f  %d  %d %s\n", rec->id, rec->start, rec->end, rec->current,
+               rec->dev != nullptr ? rec->dev->index : 0, rec->retries,
+               GetTaskStatusStr(rec->status)) < 0) {
+      perror("in TaskGroup_write_dump");
+      return -1;
+    }
+  }
+  return 1;
+}
+
+int Task_write_dump(TaskGroup* groups) {
+  for (TaskGroup* g = groups; g != nullptr; g = g->next) {
+    if (TaskGroup_write_dump(g) < 0) return -1;
+  }
+  fflush(stdout);
+  return 0;
+}
+
+void Task_file_dump() {
+  lock_fileop(FILE_TASKS, 1);
+  FILE* fp = read_fileop(FILE_TASKS);
+  if (fp != nullptr) {
+    TaskGroup* groups = Task_read(fp);
+    Task_write_dump(groups);
+    close_fileop(FILE_TASKS);
+    TaskGroup_free_all(&groups);
+  }
+  lock_fileop(FILE_TASKS, 0);
+}
+
+int Task_file_search(const char* host) {
+  int found = 0;
+  lock_fileop(FILE_TASKS, 1);
+  FILE* fp = read_fileop(FILE_TASKS);
+  if (fp != nullptr) {
+    TaskGroup* groups = Task_read(fp);
+    found = Task_find(groups, host);
+    close_fileop(FILE_TASKS);
+    TaskGroup_free_all(&groups);
+  }
+  lock_fileop(FILE_TASKS, 0);
+  return found;
+}
+
+void Task_file_update(Job* job) {
+  dbgpnt("\nTask_file_update-----------------------------\n");
+  lock_fileop(FILE_TASKS, 1);
+  FILE* fp = update_fileop(FILE_TASKS);
+  if (fp == nullptr) {
+    lock_fileop(FILE_TASKS, 0);
+    return;
+  }
+  TaskGroup* groups = Task_read(fp);
+  TaskGroup* g = groups;
+  while (g != nullptr) {
+    TaskGroup* next = g->next;
+    dbgpnt("\"%s\" -> %s\n", g->job->name.or_else("(null)"), g->job->status.or_else("(null)"));
+    if (job != nullptr && g->job == job) {
+      const Text& state = job->status;
+      if (state.is("aborted") || state.is("failed") || state.is("finished") ||
+          state.is("restarted")) {
+        dbgpnt("free up task info\n");
+        while (g->tasks != nullptr) TaskRec_freeOnly(g->tasks);
+        TaskGroup_free(&groups, g);
+      } else {
+        for (TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
+          if (rec->status == TASK_PENDING || rec->status == TASK_FAILED) continue;
+          if (!on_this_host(rec->dev)) continue;
+          for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
+            if (e->job == job && e->rec != nullptr && e->rec->id == rec->id) {
+              rec->status = e->rec->status;
+              rec->current = e->rec->current;
+              dbgpnt("%d) %s %.2f\n", rec->id, GetTaskStatusStr(rec->status), rec->current);
+              break;
+            }
+          }
+        }
+      }
+    }
+    g = next;
+  }
+  rewind_fileop(FILE_TASKS);
+  Task_write(fp, groups);
+  close_and_truncate_fileop(FILE_TASKS);
+  lock_fileop(FILE_TASKS, 0);
+  TaskGroup_free_all(&groups);
+  dbgpnt("Task_file_update-------------------------DONE\n");
+}
+
+int Task_file_check(Job* job) {
+  dbgpnt("\nTask_file_check-----------------------------\n");
+  int set_back = 0;
+  lock_fileop(FILE_TASKS, 1);
+  FILE* fp = update_fileop(FILE_TASKS);
+  if (fp == nullptr) {
+    lock_fileop(FILE_TASKS, 0);
+    return 0;
+  }
+  TaskGroup* groups = Task_read(fp);
+  TaskGroup* g = TaskGroup_by_job(groups, job);
+  if (g != nullptr) {
+    for (TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
+      rec->retries = 0;
+      if ((rec->status == TASK_RUNNING || rec->status == TASK_STARTED) && rec->dev != nullptr &&
+          rec->dev->host_name.c_str() != nullptr && !daemon_alive(rec->dev->host_name.c_str())) {
+        rec->status = TASK_PENDING;
+        set_back = 1;
+        dbgpnt("set job pending failed daemon on \"%s\"\n", rec->dev->host_name.c_str());
+      }
+    }
+  }
+  rewind_fileop(FILE_TASKS);
+  Task_write(fp, groups);
+  close_and_truncate_fileop(FILE_TASKS);
+  lock_fileop(FILE_TASKS, 0);
+  TaskGroup_free_all(&groups);
+  dbgpnt("Task_file_check-------------------------DONE\n");
+  return set_back;
+}
+
+void Editor_load_Tasks() {
+  while (rndctl.tasks != nullptr) TASK_free(rndctl.tasks);
+  lock_fileop(FILE_TASKS, 1);
+  FILE* fp = read_fileop(FILE_TASKS);
+  if (fp == nullptr) {
+    lock_fileop(FILE_TASKS, 0);
+    return;
+  }
+  TaskGroup* groups = Task_read(fp);
+  for (TaskGroup* g = groups; g != nullptr; g = g->next) {
+    for (TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) Task_add(g->job, rec);
+  }
+  close_fileop(FILE_TASKS);
+  lock_fileop(FILE_TASKS, 0);
+  TaskGroup_free_all(&groups);
+}
+
+// ---------------------------------------------------------------------------
+// Status files.
+
+void Task_update_status() {
+  const char* host = rndctl.host.c_str();
+  if (host == nullptr) return;
+  char dir[4096];
+  snprintf(dir, sizeof dir, "%s/TSKSTAT", rndctl.location.or_else("."));
+  if (mkdir(dir, 0775) != 0 && errno != EEXIST) {
+    perror("in Task_update_status");
+    return;
+  }
+  char path[4096];
+  status_file_path(path, sizeof path, host);
+  // The control directory is writable by every user of the farm: refuse to
+  // follow a link planted where the file should be.
+  int fd = open(path, O_RDWR | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0666);
+  if (fd < 0) {
+    perror("in Task_update_status");
+    return;
+  }
+  FILE* fp = fdopen(fd, "w+");
+  if (fp == nullptr) {
+    close(fd);
+    return;
+  }
+  for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
+    if (e->job == nullptr || e->rec == nullptr || e->stale) continue;
+    if (!on_this_host(e->rec->dev)) continue;
+    fprintf(fp, "%s %d %d %s\n", e->job->name.or_else("(null)"), e->job->index, e->rec->status,
+            e->output.or_else("-"));
+  }
+  if (fclose(fp) != 0) perror("in Task_update_status");
+}
+
+void Task_sfile_dump(Dev* dev) {
+  if (dev == nullptr || dev->host_name.c_str() == nullptr) return;
+  std::vector<StatusLine> lines;
+  if (!read_status_file(dev->host_name.c_str(), &lines)) return;
+  for (const StatusLine& line : lines) {
+    printf("\"%s\" is %s on %s, output: %s\n", line.job.c_str(), GetTaskStatusStr(line.status),
+           dev->host_name.c_str(), line.output.c_str());
+  }
+  fflush(stdout);
+}
+
+char* Task_current_filenames(Job* job, Dev* dev) {
+  static char names[1025];
+  if (job == nullptr || dev == nullptr) return nullptr;
+  names[0] = '\0';
+  if (dev->host_name.c_str() == nullptr) return names;
+  std::vector<StatusLine> lines;
+  if (!read_status_file(dev->host_name.c_str(), &lines)) return names;
+  size_t used = 0;
+  for (const StatusLine& line : lines) {
+    if (line.index != job->index || line.output == "-") continue;
+    size_t add = line.output.size() + 1;
+    if (used + add > sizeof names - 1) break;
+    memcpy(names + used, line.output.data(), line.output.size());
+    used += line.output.size();
+    names[used++] = ' ';
+    names[used] = '\0';
+  }
+  return names;
+}
