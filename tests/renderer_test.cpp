@@ -404,3 +404,18 @@ TEST_F(RendererTest, ShippedDemoSceneRendersFromItsProjectDirectory) {
 }
 
 }  // namespace
+
+// The queue reads the same scene by searching lines for its keys: a comment
+// or a drawing key that happens to hold one of them would change the job.
+TEST(DemoScene, QueueReadsTheAnimationTheRendererDraws) {
+  Job job;
+  job.sdl.set(DEMO_DIR "/project/sdl/bouncing_ball.sdl");
+  EXPECT_EQ(Job_set_frame_range(&job), 24);
+  EXPECT_EQ(job.animate, 1);
+  EXPECT_EQ(job.frames[0], 1.0f);
+  EXPECT_EQ(job.frames[1], 24.0f);
+  EXPECT_EQ(job.frames[2], 1.0f);
+  EXPECT_EQ(job.ext_size, 4);
+  job.fields = 3;
+  EXPECT_EQ(Job_check_sdlfields(&job), 0);
+}
