@@ -10,7 +10,14 @@
 ///     NAME "value text"
 /// NAME is a run of letters, digits and '_'; the value is everything between
 /// the first and the last double quote of the line.  A later line for the
-/// same NAME overrides an earlier one.
+/// same NAME overrides an earlier one.  Lines longer than 4095 characters and
+/// lines without a quoted value are skipped.
+///
+/// Where the preferences file is: a site file ".ZarnoPrefs" (under
+/// ZARNO_LOCATION, else under the install directory, else under the home of
+/// the distribution account) when this process may write it; else the user's
+/// own "$HOME/.ZarnoPrefs" when it exists; else the site file even read-only.
+/// The path is found once per process.
 #pragma once
 
 /// Looks a variable up; null when it is not set, or set to blanks only.
@@ -32,5 +39,8 @@ struct TpstTable;
 TpstTable* Tpst_read(const char* path);
 /// The text value of a named variable, or null.  Valid while the table lives.
 const char* Tpst_get_value(TpstTable* table, const char* name, int flags);
+/// Frees a table; null does nothing.
 void Tpst_delete(TpstTable* table);
+/// Names the directory of the master files that a profile is merged with.  The
+/// line format above has no master files: the name is only kept.
 void Tpst_set_automerge(const char* directory);

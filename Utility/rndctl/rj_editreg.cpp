@@ -176,6 +176,8 @@ int Editor_process_validate(int pid) {
 }
 
 const char* Editor_process_getuser(int pid) {
+  // Pid 0 is the end mark of the table, not an editor.
+  if (pid <= 0) return nullptr;
   for (const EditSlot& slot : edit_table) {
     if (slot.pid == pid) return slot.user;
   }
