@@ -1,5 +1,6 @@
 #include "tests/e2e/e2e_support.h"
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/wait.h>
@@ -17,9 +18,17 @@ std::string this_host_name() {
   return host;
 }
 
+int Daemon::daemon_pid() const {
+  if (!wrapped) return pid;
+  std::vector<int> kids = children_of(pid);
+  return kids.empty() ? -1 : kids[0];
+}
+
 bool Daemon::in_loop() const {
   if (pid <= 0 || reaped) return false;
-  std::string status = read_text_file("/proc/" + std::to_string(pid) + "/status");
+  int target = daemon_pid();
+  if (target <= 0) return false;
+  std::string status = read_text_file("/proc/" + std::to_string(target) + "/status");
   size_t at = status.find("SigCgt:");
   if (at == std::string::npos) return false;
   unsigned long long caught = strtoull(status.c_str() + at + 7, nullptr, 16);
@@ -27,7 +36,9 @@ bool Daemon::in_loop() const {
 }
 
 void Daemon::wake() const {
-  if (pid > 0 && !reaped) kill(pid, SIGALRM);
+  if (pid <= 0 || reaped) return;
+  int target = daemon_pid();
+  if (target > 0) kill(target, SIGALRM);
 }
 
 bool Daemon::ended() {
@@ -47,14 +58,35 @@ int Daemon::exit_code() const {
   return WEXITSTATUS(status);
 }
 
+namespace {
+// Kills a process and everything below it (render programs run in process
+// groups of their own, and a wrapper such as faketime forks the daemon).
+void kill_tree(int pid, std::vector<int>* killed) {
+  for (int child : children_of(pid)) kill_tree(child, killed);
+  kill(pid, SIGKILL);
+  killed->push_back(pid);
+}
+}  // namespace
+
 void Daemon::stop() {
   if (pid <= 0 || reaped) return;
-  kill(pid, SIGKILL);
+  std::vector<int> killed;
+  kill_tree(pid, &killed);
   int st = 0;
   if (waitpid(pid, &st, 0) == pid) {
     status = st;
     reaped = true;
   }
+  // Orphans are reaped by someone else: wait until they are really gone, so
+  // that a probe of their pid no longer finds them.
+  wait_for(
+      [&] {
+        for (int p : killed) {
+          if (access(("/proc/" + std::to_string(p)).c_str(), F_OK) == 0) return false;
+        }
+        return true;
+      },
+      10);
 }
 
 Farm::Farm() {
@@ -96,7 +128,9 @@ Daemon& Farm::start(const std::vector<std::string>& args, const std::string& hos
     argv = {"/usr/bin/unshare", "-u", "/bin/sh", "-c", "hostname \"$0\" && exec \"$@\"", host,
             DAEMON_PATH};
   } else {
-    argv = {DAEMON_PATH};
+    argv = wrapper_;
+    argv.push_back(DAEMON_PATH);
+    d->wrapped = !wrapper_.empty();
   }
   for (const auto& a : args) argv.push_back(a);
 
@@ -170,4 +204,27 @@ int dead_pid() {
   int st;
   waitpid(child, &st, 0);
   return child;
+}
+
+std::vector<int> children_of(int pid, int* zombies) {
+  std::vector<int> kids;
+  int z = 0;
+  DIR* proc = opendir("/proc");
+  if (proc == nullptr) return kids;
+  while (struct dirent* e = readdir(proc)) {
+    int child = atoi(e->d_name);
+    if (child <= 0) continue;
+    std::string stat = read_text_file("/proc/" + std::string(e->d_name) + "/stat");
+    size_t close = stat.rfind(')');
+    if (close == std::string::npos) continue;
+    char state = 0;
+    int ppid = 0;
+    if (sscanf(stat.c_str() + close + 1, " %c %d", &state, &ppid) != 2) continue;
+    if (ppid != pid) continue;
+    kids.push_back(child);
+    if (state == 'Z') ++z;
+  }
+  closedir(proc);
+  if (zombies != nullptr) *zombies = z;
+  return kids;
 }

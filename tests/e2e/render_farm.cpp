@@ -1,0 +1,108 @@
+#include "tests/e2e/render_farm.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <cstring>
+#include <thread>
+
+std::string resource_file(const std::vector<ResourceSpec>& resources) {
+  std::string out = "RenderResourceControl\n";
+  char line[512];
+  for (const auto& r : resources) {
+    snprintf(line, sizeof line, "%s %d {\n\tlock_pid \t= 0;\n\thost_name\t\t= %s;\n",
+             r.name.c_str(), r.index, r.name.c_str());
+    out += line;
+    snprintf(line, sizeof line,
+             "\tstatus \t\t\t= %s;\n\tmax_frames \t\t= %d;\n\tnum_processors \t= %d;\n",
+             r.status.c_str(), r.max_frames, r.num_processors);
+    out += line;
+    out += "  default_dev     = 0;\n";
+    if (!r.locks.empty()) out += "\tlocks =" + r.locks + ";\n";
+    out += "\t}\n\n";
+  }
+  return out + "End\n";
+}
+
+std::string job_file(const std::vector<JobSpec>& jobs, const std::string& scene) {
+  std::string out = "RenderJobControl 0 0\n";
+  char line[1024];
+  for (const auto& j : jobs) {
+    snprintf(line, sizeof line,
+             "%s %d {\n\tuser\t \t= tester;\n\tstatus \t\t= \"%s\";\n\tpriority \t= %d;\n"
+             "\texecutable \t= frame_painter;\n\tsdl \t\t= \"%s\";\n\tpix \t\t= \"pix/%s\";\n"
+             "\tuse_sdl_paths = FALSE;\n\toutput_mask = FALSE;\n\tanimate\t\t= TRUE;\n"
+             "\tframes\t\t= %f, %f, %f;\n",
+             j.name.c_str(), j.index, j.status.c_str(), j.priority, scene.c_str(), j.name.c_str(),
+             j.start, j.end, j.by);
+    out += line;
+    if (j.save_out) out += "\tsave_out\t= TRUE;\n";
+    if (!j.ctrl.empty()) out += "\tctrl\t\t= " + j.ctrl + ";\n";
+    if (!j.opts.empty()) out += "\trnd_opts\t= \"" + j.opts + "\";\n";
+    int total = static_cast<int>((j.end - j.start) / j.by) + 1;
+    snprintf(line, sizeof line, "\ttotalframes\t= %d;\n\tdoneframes\t= 0;\n", total);
+    out += line;
+    if (!j.hosts.empty()) {
+      out += "\tresources\t=";
+      for (size_t i = 0; i < j.hosts.size(); ++i) out += (i ? ", " : " ") + j.hosts[i];
+      out += ";\n";
+    }
+    if (!j.runs.empty()) out += "\truns\t\t=" + j.runs + ";\n";
+    out += "}\n\n";
+  }
+  return out + "End\n";
+}
+
+std::string make_project(Farm& farm) {
+  std::string project = farm.path("project");
+  mkdir(project.c_str(), 0777);
+  mkdir((project + "/sdl").c_str(), 0777);
+  mkdir((project + "/pix").c_str(), 0777);
+  std::string scene = project + "/sdl/scene.sdl";
+  write_text_file(scene,
+                  "animation = ON;\nstartframe = 1;\nendframe = 6;\nbyframe = 1;\n"
+                  "extensionsize = 4;\nsize = 16x12;\n");
+  return scene;
+}
+
+std::vector<std::string> render_env() {
+  std::string bin = FRAME_PAINTER_PATH;
+  bin = bin.substr(0, bin.rfind('/'));
+  const char* path = getenv("PATH");
+  return {"PATH=" + bin + ":" + (path != nullptr ? path : "/usr/bin:/bin")};
+}
+
+std::string job_block(Farm& farm, const std::string& job) {
+  std::string text = farm.read("Render_Job_Control");
+  size_t at = text.find("\n" + job + " ");
+  if (at == std::string::npos) return "";
+  size_t end = text.find("\n}\n", at);
+  return text.substr(at + 1, end == std::string::npos ? std::string::npos : end - at);
+}
+
+std::string job_status(Farm& farm, const std::string& job) {
+  std::string block = job_block(farm, job);
+  size_t at = block.find("\tstatus \t\t= \"");
+  if (at == std::string::npos) return "";
+  at += strlen("\tstatus \t\t= \"");
+  return block.substr(at, block.find('"', at) - at);
+}
+
+bool edit_job_file(Farm& farm, const std::string& from, const std::string& to,
+                   const std::string& host) {
+  std::string lock = farm.path("Render_Job_Control.lock");
+  while (mkdir(lock.c_str(), 0777) != 0) std::this_thread::sleep_for(std::chrono::milliseconds(5));
+  std::string text = farm.read("Render_Job_Control");
+  size_t at = text.find(from);
+  bool found = at != std::string::npos;
+  if (found) {
+    text.replace(at, from.size(), to);
+    farm.write("Render_Job_Control", text);
+  }
+  rmdir(lock.c_str());
+  std::string pid_file = farm.path(host + ".pid");
+  utimensat(AT_FDCWD, pid_file.c_str(), nullptr, 0);
+  return found;
+}

@@ -1,0 +1,226 @@
+// Rendering from end to end: the real daemon, real control files and the demo
+// render program.
+#include <signal.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <regex>
+
+#include "tests/e2e/render_farm.h"
+
+namespace {
+
+bool exists(const std::string& path) { return access(path.c_str(), F_OK) == 0; }
+
+class RenderTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    host_ = this_host_name();
+    scene_ = make_project(farm_);
+  }
+  // Writes both control files and starts this host's daemon.
+  Daemon& start(const std::vector<ResourceSpec>& resources, const std::vector<JobSpec>& jobs,
+                const std::vector<std::string>& wrapper_env = {}) {
+    farm_.write("Render_Resource_Control", resource_file(resources));
+    farm_.write("Render_Job_Control", job_file(jobs, scene_));
+    std::vector<std::string> env = render_env();
+    for (const auto& e : wrapper_env) env.push_back(e);
+    return farm_.start_on_farm({}, "", env);
+  }
+  ResourceSpec here(int max_frames, int processors) {
+    ResourceSpec r;
+    r.name = host_;
+    r.max_frames = max_frames;
+    r.num_processors = processors;
+    return r;
+  }
+  JobSpec job(const std::string& name, int index, float start, float end) {
+    JobSpec j;
+    j.name = name;
+    j.index = index;
+    j.start = start;
+    j.end = end;
+    j.hosts = {host_};
+    return j;
+  }
+  bool status_becomes(Daemon& d, const std::string& job, const std::string& status,
+                      double seconds = 60) {
+    return wait_for([&] { return job_status(farm_, job) == status || d.ended(); }, seconds, &d) &&
+           job_status(farm_, job) == status;
+  }
+  std::string image(const std::string& job, int frame) {
+    char name[64];
+    snprintf(name, sizeof name, "/project/pix/%s.%d", job.c_str(), frame);
+    return farm_.dir() + name;
+  }
+
+  Farm farm_;
+  std::string host_;
+  std::string scene_;
+};
+
+TEST_F(RenderTest, AJobIsRenderedInHostSizedTasksToFinished) {
+  JobSpec spin = job("spin", 1, 1, 7);
+  Daemon& d = start({here(3, 2)}, {spin});
+  ASSERT_TRUE(status_becomes(d, "spin", "finished")) << d.log();
+
+  for (int frame = 1; frame <= 7; ++frame) EXPECT_TRUE(exists(image("spin", frame))) << frame;
+  EXPECT_FALSE(exists(image("spin", 8)));
+
+  std::string log = farm_.read("JOBLOG/spin");
+  EXPECT_EQ(log.rfind("spin 1 using the frame_painter\n", 0), 0u) << log;
+  EXPECT_NE(log.find("\tframes = 1.000000 to 7.000000 by 1.000000\n"), std::string::npos) << log;
+  // Cut at three frames a task: 1-3, 4-6, 7.
+  EXPECT_NE(log.find(" 1.000000 - 3.000000\t"), std::string::npos) << log;
+  EXPECT_NE(log.find(" 4.000000 - 6.000000\t"), std::string::npos) << log;
+  EXPECT_NE(log.find(" 7.000000 - 7.000000\t"), std::string::npos) << log;
+  EXPECT_EQ(count_of(log, "FINISHED"), 3) << log;
+
+  // The finished job's group has left the task file.
+  EXPECT_EQ(farm_.read("Render_Tasks").find("spin"), std::string::npos)
+      << farm_.read("Render_Tasks");
+  EXPECT_NE(job_block(farm_, "spin").find("\tdoneframes\t= 7;\n"), std::string::npos)
+      << job_block(farm_, "spin");
+}
+
+TEST_F(RenderTest, AFailedTaskIsCutAtTheFrameItReachedAndFinishedOnRetry) {
+  JobSpec spin = job("spin", 1, 1, 6);
+  spin.opts = "fail_at=4 fail_once=" + farm_.path("failed_once");
+  Daemon& d = start({here(6, 1)}, {spin});
+  ASSERT_TRUE(status_becomes(d, "spin", "finished")) << d.log();
+
+  for (int frame = 1; frame <= 6; ++frame) EXPECT_TRUE(exists(image("spin", frame))) << frame;
+  std::string block = job_block(farm_, "spin");
+  EXPECT_NE(block.find("/*ERROR: " + host_ + " (" + host_ + ") frame 1.0\n"), std::string::npos)
+      << block;
+  EXPECT_NE(block.find("Error"), std::string::npos) << block;
+
+  std::string log = farm_.read("JOBLOG/spin");
+  // The first try rendered 1-3 and failed in frame 4: 1-3 counts as done,
+  // 4-6 was rendered again by the retry.
+  EXPECT_NE(log.find(" 1.000000 - 3.000000\t"), std::string::npos) << log;
+  EXPECT_NE(log.find(" 4.000000 - 6.000000\t"), std::string::npos) << log;
+}
+
+TEST_F(RenderTest, ATaskThatAlwaysFailsGivesUpAfterTenRetries) {
+  JobSpec spin = job("spin", 1, 1, 1);
+  spin.opts = "fail_at=1";
+  Daemon& d = start({here(3, 1)}, {spin});
+  ASSERT_TRUE(status_becomes(d, "spin", "failed", 120)) << d.log();
+  std::string log = farm_.read("JOBLOG/spin");
+  EXPECT_NE(log.find("FAILED  10\n"), std::string::npos) << log;
+  EXPECT_EQ(count_of(job_block(farm_, "spin"), "ERROR: "), 11) << job_block(farm_, "spin");
+}
+
+TEST_F(RenderTest, RenderProgramsEndingTogetherAreAllJudged) {
+  JobSpec spin = job("spin", 1, 1, 4);
+  spin.opts = "slow=1";
+  Daemon& d = start({here(1, 2)}, {spin});
+  // Two render programs at work; stop the daemon so that both end while it
+  // cannot react, and their two SIGCHLDs arrive as one.
+  ASSERT_TRUE(wait_for([&] { return children_of(d.pid).size() == 2; }, 30)) << d.log();
+  kill(d.pid, SIGSTOP);
+  int zombies = 0;
+  bool both_ended = wait_for(
+      [&] {
+        children_of(d.pid, &zombies);
+        return zombies == 2;
+      },
+      30);
+  kill(d.pid, SIGCONT);
+  ASSERT_TRUE(both_ended);
+  ASSERT_TRUE(status_becomes(d, "spin", "finished")) << d.log();
+  EXPECT_TRUE(children_of(d.pid).empty());
+  EXPECT_EQ(count_of(d.log(), "UNKNOWN"), 0) << d.log();
+  for (int frame = 1; frame <= 4; ++frame) EXPECT_TRUE(exists(image("spin", frame))) << frame;
+}
+
+TEST_F(RenderTest, AnAbortedJobHasItsRenderProgramKilled) {
+  JobSpec spin = job("spin", 1, 1, 6);
+  spin.opts = "slow=20";
+  Daemon& d = start({here(6, 1)}, {spin});
+  ASSERT_TRUE(wait_for([&] { return children_of(d.pid).size() == 1; }, 30)) << d.log();
+  int renderer = children_of(d.pid)[0];
+  ASSERT_TRUE(edit_job_file(farm_, "status \t\t= \"started\"", "status \t\t= \"aborted\"", host_) ||
+              edit_job_file(farm_, "status \t\t= \"pending\"", "status \t\t= \"aborted\"", host_))
+      << farm_.read("Render_Job_Control");
+  ASSERT_TRUE(wait_for([&] { return !exists("/proc/" + std::to_string(renderer)); }, 30, &d))
+      << d.log();
+  EXPECT_NE(d.log().find("kill( " + std::to_string(renderer) + ", 9 )"), std::string::npos)
+      << d.log();
+  EXPECT_NE(d.log().find("task status = ABORTED"), std::string::npos) << d.log();
+  EXPECT_FALSE(exists(image("spin", 6)));
+  EXPECT_EQ(job_status(farm_, "spin"), "aborted");
+}
+
+TEST_F(RenderTest, AnImmediateJobRunsBesideARunningOneWhileOthersWait) {
+  JobSpec busy = job("busy", 1, 1, 3);
+  busy.priority = 1;
+  busy.opts = "slow=4";
+  Daemon& d = start({here(3, 2)}, {busy});
+  ASSERT_TRUE(wait_for([&] { return children_of(d.pid).size() == 1; }, 30)) << d.log();
+
+  // An editor adds an immediate job and an ordinary one.
+  JobSpec now = job("now", 2, 1, 2);
+  now.priority = 0;
+  now.opts = "slow=1";
+  JobSpec later = job("later", 3, 1, 2);
+  later.priority = 1;
+  std::string more = job_file({now, later}, scene_);
+  more = more.substr(more.find('\n') + 1);
+  ASSERT_TRUE(edit_job_file(farm_, "End\n", more, host_));
+
+  ASSERT_TRUE(status_becomes(d, "now", "finished")) << d.log();
+  // "busy" still renders: "later" may not start beside it.
+  EXPECT_FALSE(exists(image("busy", 3)));
+  EXPECT_FALSE(exists(image("later", 1)));
+  EXPECT_NE(job_status(farm_, "later"), "finished");
+  ASSERT_TRUE(status_becomes(d, "later", "finished")) << d.log();
+  EXPECT_TRUE(exists(image("busy", 3)));
+}
+
+TEST_F(RenderTest, ProgressShowsAsAPercentageWhileRendering) {
+  JobSpec spin = job("spin", 1, 1, 4);
+  spin.opts = "slow=2";
+  Daemon& d = start({here(4, 1)}, {spin});
+  std::regex progress("[0-9]+\\.[0-9][0-9]% ");
+  ASSERT_TRUE(
+      wait_for([&] { return std::regex_match(job_status(farm_, "spin"), progress); }, 30, &d))
+      << job_status(farm_, "spin") << "\n"
+      << d.log();
+  ASSERT_TRUE(status_becomes(d, "spin", "finished")) << d.log();
+}
+
+TEST_F(RenderTest, AScheduledJobStartsOnlyInItsHours) {
+  if (system("command -v faketime >/dev/null 2>&1") != 0)
+    GTEST_SKIP() << "faketime is not installed";
+  JobSpec nightly = job("nightly", 1, 1, 2);
+  nightly.ctrl = "SCHEDULE";
+  nightly.runs = "\t{ 800 to 900 Monday }";
+  JobSpec ordinary = job("ordinary", 2, 1, 2);
+  ordinary.priority = 1;
+  std::vector<std::string> env = {"TZ=UTC", "ASAN_OPTIONS=verify_asan_link_order=0:detect_leaks=0"};
+
+  // Sunday noon: outside the job's hours; the ordinary job shows that the
+  // daemon does work.
+  farm_.set_wrapper({"/usr/bin/faketime", "2026-11-22 12:00:00"});
+  Daemon& sunday = start({here(3, 1)}, {nightly, ordinary}, env);
+  ASSERT_TRUE(status_becomes(sunday, "ordinary", "finished")) << sunday.log();
+  for (int i = 0; i < 3; ++i) {
+    sunday.wake();
+    usleep(50000);
+  }
+  EXPECT_FALSE(exists(image("nightly", 1)));
+  EXPECT_EQ(job_status(farm_, "nightly"), "pending");
+  sunday.stop();
+
+  // Monday 8:15: inside them.
+  farm_.set_wrapper({"/usr/bin/faketime", "2026-11-23 08:15:00"});
+  std::vector<std::string> all = render_env();
+  for (const auto& e : env) all.push_back(e);
+  Daemon& monday = farm_.start_on_farm({}, "", all);
+  ASSERT_TRUE(status_becomes(monday, "nightly", "finished")) << monday.log();
+  EXPECT_TRUE(exists(image("nightly", 2)));
+}
+
+}  // namespace
