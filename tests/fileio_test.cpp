@@ -208,4 +208,13 @@ TEST_F(FileopTest, EmptyControlDirectoryMeansTheCurrentOne) {
   EXPECT_EQ(std::string(fileop_path(FILE_STATUS)), path("Render_Status"));
 }
 
+TEST_F(FileopTest, OriginalUmaskSurvivesReinitialisation) {
+  umask(022);
+  ASSERT_EQ(init_fileop(), 1);
+  fileop_reset();
+  ASSERT_EQ(init_fileop(), 1);
+  EXPECT_EQ(get_original_umask(), static_cast<mode_t>(022));
+  EXPECT_EQ(umask(0), static_cast<mode_t>(1));
+}
+
 }  // namespace

@@ -47,7 +47,7 @@ struct FileRecord {
 
 FileRecord files[FILE_COUNT];
 mode_t saved_umask = 0;
-int current_index = -1;
+bool umask_saved = false;
 
 bool valid_index(int index) { return index >= 0 && index < FILE_COUNT; }
 
@@ -103,7 +103,6 @@ FILE* open_record(int index, const char* first_mode, const char* second_mode) {
 
 void after_open(int index, FILE* fp) {
   setvbuf(fp, nullptr, _IOLBF, BUFSIZ);
-  current_index = index;
   if (index == FILE_JOBS || index == FILE_RESOURCES) {
     RJCin = fp;
     RJCreadfile = files[index].path;
@@ -122,7 +121,13 @@ int init_fileop() {
     files[i].path = make_path(dir, control_names[i], "", __LINE__);
     files[i].lock_path = make_path(dir, control_names[i], ".lock", __LINE__);
   }
-  saved_umask = umask(1);
+  // Only the first initialisation sees the umask the process started with;
+  // a later one (after fileop_reset) would see our own.
+  mode_t previous = umask(1);
+  if (!umask_saved) {
+    saved_umask = previous;
+    umask_saved = true;
+  }
 
   FileRecord& log = files[FILE_ACCESS];
   if (log.stream == nullptr) {
@@ -321,5 +326,4 @@ void fileop_reset() {
     rec.path = nullptr;
     rec.lock_path = nullptr;
   }
-  current_index = -1;
 }
