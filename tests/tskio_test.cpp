@@ -1,0 +1,440 @@
+// The task file: its exact text, reading damaged files, the locked
+// read-modify-write cycles, the daemon-alive test and the status files.
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cmath>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <random>
+#include <string>
+
+#include "Shared/memory/MA_rtns.h"
+#include "tests/support/test_support.h"
+
+namespace {
+
+std::string group_line(const std::string& name, int index, int numrecs, int next_id) {
+  char b[256];
+  snprintf(b, sizeof b, "\t %d\t %d\t %d\n", index, numrecs, next_id);
+  return "\n" + name + b;
+}
+
+std::string rec_line(int id, float start, float end, float current, int dev, int retries,
+                     const std::string& status) {
+  char b[512];
+  snprintf(b, sizeof b, "\t%d\t %f\t %f\t %f  %d\t %d\t", id, start, end, current, dev, retries);
+  return b + status + "\n";
+}
+
+class TaskFileTest : public ControlDirTest {
+ protected:
+  void SetUp() override {
+    ControlDirTest::SetUp();
+    alpha_ = Add_a_job(nullptr, "alpha.sdl", 1);
+    beta_ = Add_a_job(nullptr, "beta.sdl", 2);
+    ASSERT_NE(alpha_, nullptr);
+    ASSERT_NE(beta_, nullptr);
+    here_ = Add_a_dev(nullptr, "render1", 1);
+    there_ = Add_a_dev(nullptr, "render2", 2);
+    ASSERT_NE(here_, nullptr);
+    ASSERT_NE(there_, nullptr);
+    here_->host_name.set("testhost");
+    there_->host_name.set("otherhost");
+  }
+
+  /// Reads `text` as a task file and writes back what was understood.
+  static std::string rewrite(const std::string& text) {
+    FILE* in = tmpfile();
+    EXPECT_NE(in, nullptr);
+    fwrite(text.data(), 1, text.size(), in);
+    rewind(in);
+    TaskGroup* groups = Task_read(in);
+    fclose(in);
+    std::string out = write_groups(groups);
+    TaskGroup_free_all(&groups);
+    return out;
+  }
+
+  static std::string write_groups(TaskGroup* groups) {
+    char* buf = nullptr;
+    size_t len = 0;
+    FILE* out = open_memstream(&buf, &len);
+    EXPECT_EQ(Task_write(out, groups), 0);
+    fclose(out);
+    std::string s(buf, len);
+    free(buf);
+    return s;
+  }
+
+  /// An entry of `job` owning a fresh record (not in any group).
+  static TASK* entry(Job* job, int id, Dev* dev, int status, float start = 1, float end = 10) {
+    TaskRec* rec = TaskRec_alloc(nullptr, start, end, start, dev, status, nullptr, id);
+    return Task_add(job, rec);
+  }
+
+  Job* alpha_ = nullptr;
+  Job* beta_ = nullptr;
+  Dev* here_ = nullptr;
+  Dev* there_ = nullptr;
+};
+
+// --- The exact text ---------------------------------------------------------
+
+TEST_F(TaskFileTest, WritesGroupsAndRecordsInTheFileFormat) {
+  TaskGroup* groups = nullptr;
+  ASSERT_NE(insert_task(&groups, alpha_, 1, 3, TASK_STARTED), nullptr);
+  TaskRec* r = insert_task(&groups, alpha_, 4, 10, TASK_PENDING);
+  r->dev = there_;
+  r->retries = 3;
+  r->current = 6.5f;
+  // A group without records is not written at all.
+  TaskGroup* empty = TaskGroup_alloc(beta_, 7);
+  empty->next = groups;
+  groups = empty;
+
+  EXPECT_EQ(write_groups(groups),
+            "\nalpha.sdl\t 1\t 2\t 2\n"
+            "\t0\t 1.000000\t 3.000000\t 1.000000  0\t 0\tSTARTED\n"
+            "\t1\t 4.000000\t 10.000000\t 6.500000  2\t 3\tPENDING\n");
+  TaskGroup_free_all(&groups);
+}
+
+TEST_F(TaskFileTest, FrameNumbersReadAndPrintLikeTheCLibrary) {
+  // The writer and reader format and scan numbers themselves; any float must
+  // come out as "%f" prints it and come back as strtof reads that text.
+  std::mt19937 rng(12345);
+  std::uniform_int_distribution<uint32_t> bits;
+  const float fixed[] = {0.0f,       -0.0f,      1.0f,        2.5f,    0.1f,         -3.25f,
+                         999999.5f,  1e7f,       12345678.0f, 1e30f,   1.0e-7f,      4.0000005f,
+                         0.0000005f, 0.0000015f, 8388607.5f,  -1e-30f, 3.4028235e38f};
+  std::vector<float> values(std::begin(fixed), std::end(fixed));
+  while (values.size() < 3000) {
+    uint32_t b = bits(rng);
+    float f;
+    memcpy(&f, &b, sizeof f);
+    if (std::isfinite(f)) values.push_back(f);
+    // Plenty of ordinary frame numbers too.
+    values.push_back(static_cast<float>(static_cast<int>(b % 200000) - 100000) / 8.0f);
+  }
+
+  TaskGroup* groups = nullptr;
+  std::string expected =
+      group_line("alpha.sdl", 1, static_cast<int>(values.size()), static_cast<int>(values.size()));
+  for (size_t i = 0; i < values.size(); ++i) {
+    insert_task(&groups, alpha_, values[i], values[i], TASK_PENDING);
+    expected += rec_line(static_cast<int>(i), values[i], values[i], values[i], 0, 0, "PENDING");
+  }
+  std::string text = write_groups(groups);
+  ASSERT_EQ(text, expected);
+  TaskGroup_free_all(&groups);
+
+  FILE* in = fmemopen(text.data(), text.size(), "r");
+  groups = Task_read(in);
+  fclose(in);
+  ASSERT_NE(groups, nullptr);
+  size_t i = 0;
+  for (TaskRec* rec = groups->tasks; rec != nullptr; rec = rec->next, ++i) {
+    char printed[512];
+    snprintf(printed, sizeof printed, "%f", values[i]);
+    float want = strtof(printed, nullptr);
+    ASSERT_EQ(memcmp(&rec->start, &want, sizeof want), 0) << printed;
+  }
+  EXPECT_EQ(i, values.size());
+  TaskGroup_free_all(&groups);
+}
+
+// --- Reading damaged files --------------------------------------------------
+
+struct ReadCase {
+  const char* label;
+  std::string input;
+  std::string output;  // what the next rewrite writes
+};
+
+void PrintTo(const ReadCase& c, std::ostream* os) { *os << c.label; }
+
+class ReadDamaged : public TaskFileTest, public testing::WithParamInterface<ReadCase> {};
+
+TEST_P(ReadDamaged, KeepsWhatItUnderstood) {
+  EXPECT_EQ(rewrite(GetParam().input), GetParam().output);
+}
+
+const std::string kAlpha = group_line("alpha.sdl", 1, 2, 2) +
+                           rec_line(0, 1, 3, 2, 1, 0, "STARTED") +
+                           rec_line(1, 4, 10, 4, 0, 0, "PENDING");
+const std::string kBeta = group_line("beta.sdl", 2, 1, 1) + rec_line(0, 1, 5, 1, 2, 3, "FAILED");
+// The same group, claiming two records and a next id of 2.
+const std::string kBetaOf2 = group_line("beta.sdl", 2, 2, 2) + rec_line(0, 1, 5, 1, 2, 3, "FAILED");
+const std::string kBetaAs1 = group_line("beta.sdl", 2, 1, 2) + rec_line(0, 1, 5, 1, 2, 3, "FAILED");
+
+INSTANTIATE_TEST_SUITE_P(
+    Files, ReadDamaged,
+    testing::Values(
+        // Each read puts the groups in reverse order.
+        ReadCase{"well_formed", kAlpha + kBeta, kBeta + kAlpha}, ReadCase{"empty", "", ""},
+        ReadCase{"layout_does_not_matter",
+                 "alpha.sdl 1 2 2 0 1 3 2 1 0 STARTED 1 4.0 10 4 0 0 PENDING", kAlpha},
+        ReadCase{"unknown_status_and_resource",
+                 group_line("alpha.sdl", 1, 1, 1) + rec_line(0, 1, 3, 1, 77, 0, "BOGUS"),
+                 group_line("alpha.sdl", 1, 1, 1) + rec_line(0, 1, 3, 1, 0, 0, "PENDING")},
+        ReadCase{"job_gone_others_kept",
+                 kAlpha + group_line("gone.sdl", 99, 2, 2) + rec_line(0, 1, 2, 1, 1, 0, "RUNNING") +
+                     rec_line(1, 3, 4, 3, 0, 0, "PENDING") + kBeta,
+                 kBeta + kAlpha},
+        ReadCase{"fewer_records_than_claimed",
+                 group_line("alpha.sdl", 1, 5, 2) + rec_line(0, 1, 3, 2, 1, 0, "STARTED") +
+                     rec_line(1, 4, 10, 4, 0, 0, "PENDING") + kBeta,
+                 kBeta + kAlpha},
+        ReadCase{"cut_in_a_record", kAlpha + kBetaOf2 + "\t1\t 6.000000\t 9.0", kBetaAs1 + kAlpha},
+        ReadCase{"not_a_number",
+                 kAlpha + kBetaOf2 + "\t1\t six\t 9.0\t 6  0\t 0\tPENDING\n" + kAlpha,
+                 kBetaAs1 + kAlpha},
+        ReadCase{"not_finite",
+                 kAlpha + group_line("beta.sdl", 2, 1, 1) + "\t0\t nan\t 9.0\t 6  0\t 0\tPENDING\n",
+                 kAlpha},
+        ReadCase{"garbled_group_line", "alpha.sdl\t x\t 1\t 1\n" + kBeta, ""},
+        ReadCase{"over_long_names",
+                 group_line(std::string(5000, 'n'), 1, 1, 1) +
+                     rec_line(0, 1, 3, 1, 1, 0, std::string(3000, 'S')) + kBeta,
+                 kBeta + group_line("alpha.sdl", 1, 1, 1) + rec_line(0, 1, 3, 1, 1, 0, "PENDING")},
+        ReadCase{"group_without_records", group_line("alpha.sdl", 1, 0, 3) + kBeta, kBeta}),
+    [](const testing::TestParamInfo<ReadCase>& info) { return std::string(info.param.label); });
+
+// --- Locked cycles on the shared file ---------------------------------------
+
+TEST_F(TaskFileTest, EachRewriteReversesTheGroupsSoTwoGiveThemBack) {
+  write_file("Render_Tasks", kAlpha + kBeta);
+  Task_file_update(nullptr);
+  EXPECT_EQ(read_file("Render_Tasks"), kBeta + kAlpha);
+  Task_file_update(nullptr);
+  EXPECT_EQ(read_file("Render_Tasks"), kAlpha + kBeta);
+  EXPECT_EQ(Task_file_search("otherhost"), 1);
+  EXPECT_EQ(Task_file_search("nohost"), 0);
+}
+
+class FileUpdateEndState : public TaskFileTest, public testing::WithParamInterface<const char*> {};
+
+TEST_P(FileUpdateEndState, DropsTheGroupOfAJobThatIsOver) {
+  write_file("Render_Tasks", kAlpha + kBeta);
+  alpha_->status.set(GetParam());
+  Task_file_update(alpha_);
+  EXPECT_EQ(read_file("Render_Tasks"), kBeta);
+}
+
+INSTANTIATE_TEST_SUITE_P(States, FileUpdateEndState,
+                         testing::Values("aborted", "failed", "finished", "restarted"));
+
+TEST_F(TaskFileTest, FileUpdateTakesThisHostsProgressFromItsEntries) {
+  write_file("Render_Tasks", group_line("alpha.sdl", 1, 4, 4) +
+                                 rec_line(0, 1, 3, 1, 1, 0, "STARTED") +   // here: follows entry
+                                 rec_line(1, 4, 6, 4, 2, 0, "RUNNING") +   // other host
+                                 rec_line(2, 7, 8, 7, 1, 0, "PENDING") +   // pending: left alone
+                                 rec_line(3, 9, 10, 9, 1, 0, "RUNNING"));  // no entry
+  alpha_->status.set("started");
+  for (int id = 0; id < 3; ++id) {
+    TASK* e = entry(alpha_, id, id == 1 ? there_ : here_, TASK_RUNNING);
+    e->rec->current = 50.0f + static_cast<float>(id);
+  }
+  entry(beta_, 3, here_, TASK_FINISHED);  // same id, other job
+  Task_file_update(alpha_);
+  EXPECT_EQ(read_file("Render_Tasks"),
+            group_line("alpha.sdl", 1, 4, 4) + rec_line(0, 1, 3, 50, 1, 0, "RUNNING") +
+                rec_line(1, 4, 6, 4, 2, 0, "RUNNING") + rec_line(2, 7, 8, 7, 1, 0, "PENDING") +
+                rec_line(3, 9, 10, 9, 1, 0, "RUNNING"));
+}
+
+struct PidCase {
+  const char* label;
+  int pid_file;  // 0: none, 1: this process, 2: a process that has ended
+  int set_back;
+};
+
+void PrintTo(const PidCase& c, std::ostream* os) { *os << c.label; }
+
+class DaemonAlive : public TaskFileTest, public testing::WithParamInterface<PidCase> {};
+
+TEST_P(DaemonAlive, TasksOfADeadDaemonGoBackToPending) {
+  const PidCase& c = GetParam();
+  if (c.pid_file != 0) {
+    int pid = getpid();
+    if (c.pid_file == 2) {
+      pid = fork();
+      ASSERT_GE(pid, 0);
+      if (pid == 0) _exit(0);
+      ASSERT_EQ(waitpid(pid, nullptr, 0), pid);
+    }
+    write_file("testhost.pid", std::string(reinterpret_cast<const char*>(&pid), sizeof pid));
+  }
+  write_file("Render_Tasks",
+             kBeta + group_line("alpha.sdl", 1, 3, 3) + rec_line(0, 1, 3, 2, 1, 4, "RUNNING") +
+                 rec_line(1, 4, 6, 4, 1, 0, "STARTED") + rec_line(2, 7, 10, 7, 1, 2, "FINISHED"));
+  EXPECT_EQ(Task_file_check(alpha_), c.set_back);
+  const char* active0 = c.set_back ? "PENDING" : "RUNNING";
+  const char* active1 = c.set_back ? "PENDING" : "STARTED";
+  // Retries are cleared in the checked job's group only.
+  EXPECT_EQ(read_file("Render_Tasks"), group_line("alpha.sdl", 1, 3, 3) +
+                                           rec_line(0, 1, 3, 2, 1, 0, active0) +
+                                           rec_line(1, 4, 6, 4, 1, 0, active1) +
+                                           rec_line(2, 7, 10, 7, 1, 0, "FINISHED") + kBeta);
+}
+
+INSTANTIATE_TEST_SUITE_P(PidFiles, DaemonAlive,
+                         testing::Values(PidCase{"no_pid_file", 0, 1}, PidCase{"alive", 1, 0},
+                                         PidCase{"ended", 2, 1}),
+                         [](const testing::TestParamInfo<PidCase>& info) {
+                           return std::string(info.param.label);
+                         });
+
+TEST_F(TaskFileTest, EditorLoadMirrorsEveryRecordInEntries) {
+  entry(alpha_, 9, here_, TASK_RUNNING);  // an old entry: replaced
+  write_file("Render_Tasks", kAlpha + kBeta);
+  Editor_load_Tasks();
+  int n = 0;
+  for (TASK* e = rndctl.tasks; e != nullptr; e = e->next, ++n) {
+    ASSERT_NE(e->rec, nullptr);
+    EXPECT_EQ(e->rec->task, e);
+    EXPECT_EQ(e->rec->group, nullptr);
+  }
+  EXPECT_EQ(n, 3);
+  // In reverse file order: beta's record first.
+  EXPECT_EQ(rndctl.tasks->job, beta_);
+  EXPECT_EQ(rndctl.tasks->rec->status, TASK_FAILED);
+  EXPECT_EQ(rndctl.tasks->rec->retries, 3);
+  EXPECT_EQ(rndctl.tasks->rec->dev, there_);
+}
+
+// --- Records, groups and entries --------------------------------------------
+
+TEST_F(TaskFileTest, KeepMarksDecideWhichRecordsOutliveTheirGroup) {
+  TaskGroup* groups = nullptr;
+  TaskRec* owned = insert_task(&groups, alpha_, 1, 2, TASK_PENDING);
+  TaskRec* twice = insert_task(&groups, alpha_, 3, 4, TASK_PENDING);
+  insert_task(&groups, alpha_, 5, 6, TASK_PENDING);  // unowned: goes with the group
+  TASK* e1 = Task_add(alpha_, owned);
+  TASK* e2 = Task_add(alpha_, twice);
+  twice->keep = 2;
+
+  // The first release of a record marked 2 only clears the mark.
+  TaskRec_freeOnly(twice);
+  EXPECT_EQ(twice->keep, 0);
+  EXPECT_EQ(groups->tasks->next, twice);
+  twice->keep = 2;
+
+  TaskGroup_free_all(&groups);
+  EXPECT_EQ(groups, nullptr);
+  EXPECT_EQ(e1->rec, owned);
+  EXPECT_EQ(owned->group, nullptr);
+  EXPECT_EQ(e2->rec, twice);
+  EXPECT_EQ(twice->keep, 0);
+  EXPECT_EQ(twice->group, nullptr);
+}
+
+TEST_F(TaskFileTest, EntriesLeaveTheListWithTheirRecords) {
+  TASK* a = entry(alpha_, 0, here_, TASK_RUNNING);
+  TASK* b = entry(alpha_, 1, here_, TASK_RUNNING);
+  TASK* c = entry(beta_, 0, here_, TASK_RUNNING);
+  a->pid = 101;
+  b->pid = 102;
+  c->pid = 102;
+  EXPECT_EQ(Task_by_pid(102), b);
+  EXPECT_EQ(Task_by_pid(0), nullptr);
+  TASK_free(b);
+  EXPECT_EQ(rndctl.tasks, a);
+  EXPECT_EQ(a->next, c);
+  EXPECT_EQ(c->prev, a);
+  EXPECT_EQ(Task_by_pid(102), c);
+  TASK* d = entry(beta_, 1, here_, TASK_RUNNING);
+  EXPECT_EQ(c->next, d);
+  TASK_free(d);
+  TASK_free(a);
+  TASK* e = entry(beta_, 2, here_, TASK_RUNNING);
+  EXPECT_EQ(rndctl.tasks, c);
+  EXPECT_EQ(c->next, e);
+  EXPECT_EQ(e->prev, c);
+
+  // An entry whose record still sits in a group takes it out of the group.
+  TaskGroup* groups = nullptr;
+  TaskRec* first = insert_task(&groups, alpha_, 1, 2, TASK_PENDING);
+  TaskRec* second = insert_task(&groups, alpha_, 3, 4, TASK_PENDING);
+  TASK_free(Task_add(alpha_, first));
+  EXPECT_EQ(groups->tasks, second);
+  TaskGroup_free_all(&groups);
+}
+
+TEST(TaskStatus, NamesAndCodes) {
+  const char* names[] = {"PENDING", "CRASHED", "RUNNING", "FINISHED",
+                         "ABORTED", "FAILED",  "STARTED", "STOPPED"};
+  for (int i = 0; i < 8; ++i) {
+    int code = -1;
+    EXPECT_EQ(ISA_task_status(names[i], &code), 1);
+    EXPECT_EQ(code, i);
+    EXPECT_STREQ(GetTaskStatusStr(i), names[i]);
+  }
+  int code = 4;
+  EXPECT_EQ(ISA_task_status("pending", &code), 0);
+  EXPECT_EQ(code, 4);
+  EXPECT_EQ(ISA_task_status(nullptr, &code), 0);
+  EXPECT_EQ(task_status_table[8], nullptr);
+}
+
+// --- Status files -----------------------------------------------------------
+
+TEST_F(TaskFileTest, StatusFileListsThisHostsLiveEntries) {
+  TASK* a = entry(alpha_, 0, here_, TASK_RUNNING);
+  a->output.set("/pix/alpha.0001");
+  entry(alpha_, 1, here_, TASK_STARTED);
+  entry(beta_, 0, there_, TASK_RUNNING)->output.set("/pix/beta.0001");
+  entry(beta_, 1, here_, TASK_RUNNING)->stale = 1;
+  TASK* b = entry(beta_, 2, here_, TASK_FINISHED);
+  b->output.set("/pix/beta.0009");
+  Task_update_status();
+  EXPECT_EQ(read_file("TSKSTAT/testhost"),
+            "alpha.sdl 1 2 /pix/alpha.0001\nalpha.sdl 1 6 -\nbeta.sdl 2 3 /pix/beta.0009\n");
+
+  EXPECT_STREQ(Task_current_filenames(alpha_, here_), "/pix/alpha.0001 ");
+  EXPECT_STREQ(Task_current_filenames(beta_, here_), "/pix/beta.0009 ");
+  EXPECT_STREQ(Task_current_filenames(beta_, there_), "");  // no file for that host
+  EXPECT_EQ(Task_current_filenames(nullptr, here_), nullptr);
+
+  testing::internal::CaptureStdout();
+  Task_sfile_dump(here_);
+  EXPECT_EQ(testing::internal::GetCapturedStdout(),
+            "\"alpha.sdl\" is RUNNING on testhost, output: /pix/alpha.0001\n"
+            "\"alpha.sdl\" is STARTED on testhost, output: -\n"
+            "\"beta.sdl\" is FINISHED on testhost, output: /pix/beta.0009\n");
+
+  // With no entries the file is emptied.
+  while (rndctl.tasks != nullptr) TASK_free(rndctl.tasks);
+  Task_update_status();
+  EXPECT_EQ(read_file("TSKSTAT/testhost"), "");
+}
+
+TEST_F(TaskFileTest, CurrentFileNamesStayWithin1024Characters) {
+  std::string text;
+  for (int i = 0; i < 40; ++i) {
+    text += "alpha.sdl 1 2 /pix/" + std::string(40, 'a' + i % 26) + "." + std::to_string(i) + "\n";
+  }
+  text += "alpha.sdl 1 99 " + std::string(3000, 'z') + "\nalpha.sdl x\n";
+  ASSERT_EQ(mkdir(path("TSKSTAT").c_str(), 0775), 0);
+  ASSERT_TRUE(write_text_file(path("TSKSTAT/testhost"), text));
+  const char* names = Task_current_filenames(alpha_, here_);
+  ASSERT_NE(names, nullptr);
+  size_t len = strlen(names);
+  EXPECT_LE(len, 1024u);
+  // Whole names only, each followed by a space, as many as fit.
+  EXPECT_EQ(names[len - 1], ' ');
+  EXPECT_EQ(std::string(names).find("/pix/aaaa"), 0u);
+  EXPECT_GT(len + 47, 1024u);
+
+  // A damaged code reads as pending; the dump stops where the file breaks.
+  ASSERT_TRUE(write_text_file(path("TSKSTAT/testhost"), "alpha.sdl 1 99 out\nalpha.sdl x\n"));
+  testing::internal::CaptureStdout();
+  Task_sfile_dump(here_);
+  EXPECT_EQ(testing::internal::GetCapturedStdout(),
+            "\"alpha.sdl\" is PENDING on testhost, output: out\n");
+}
+
+}  // namespace
