@@ -1,0 +1,234 @@
+// Starting render programs: real children, real files.  The "render
+// programs" are small shell scripts on PATH that report what they were given.
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <climits>
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <ostream>
+#include <sstream>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "tests/support/task_fixture.h"
+
+namespace {
+
+constexpr const char* kReporter =
+    "#!/bin/sh\n"
+    "echo \"prog=$(basename \"$0\")\"\n"
+    "echo \"cwd=$(pwd -P)\"\n"
+    "for a in \"$@\"; do echo \"arg=$a\"; done\n"
+    "echo \"search=[$ZARNO_PIX_SEARCHPATH]\"\n"
+    "echo \"pid=$$ pgid=$(cut -d' ' -f5 /proc/$$/stat)\"\n"
+    "grep -E '^Sig(Blk|Ign)' /proc/$$/status\n"
+    "echo 'pix.0001 r 5 of 10' >&2\n";
+
+struct Report {
+  std::string prog;
+  std::string cwd;
+  std::vector<std::string> args;
+  std::string search;
+  std::string text;
+};
+
+Report parse_report(const std::string& text) {
+  Report r;
+  r.text = text;
+  std::istringstream in(text);
+  std::string line;
+  while (std::getline(in, line)) {
+    if (line.rfind("prog=", 0) == 0) r.prog = line.substr(5);
+    if (line.rfind("cwd=", 0) == 0) r.cwd = line.substr(4);
+    if (line.rfind("arg=", 0) == 0) r.args.push_back(line.substr(4));
+    if (line.rfind("search=", 0) == 0) r.search = line.substr(7);
+  }
+  return r;
+}
+
+std::string real(const std::string& p) { return std::filesystem::canonical(p).string(); }
+
+class PerformTest : public TaskFixture {
+ protected:
+  void SetUp() override {
+    TaskFixture::SetUp();
+    mkdir_p("bin");
+    for (const char* name : {"shadepass", "glintcast", "glintwalk", "myrender"}) {
+      std::string script = path(std::string("bin/") + name);
+      write_file(std::string("bin/") + name, kReporter);
+      chmod(script.c_str(), 0755);
+    }
+    const char* old = getenv("PATH");
+    old_path_ = old != nullptr ? old : "";
+    setenv("PATH", (path("bin") + ":" + old_path_).c_str(), 1);
+    dev_->num_processors = 4;
+  }
+  void TearDown() override {
+    setenv("PATH", old_path_.c_str(), 1);
+    TaskFixture::TearDown();
+  }
+
+  /// Starts the entry's render program, waits for it and reads its stdout.
+  Report perform(TASK* entry) {
+    entry->stream_path.set(path("stream").c_str());
+    EXPECT_EQ(Perform_a_Task(entry), 1);
+    EXPECT_GE(entry->pid, 2);
+    int status = wait_for(entry->pid);
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+    return parse_report(read_text_file(entry->out_path.c_str()));
+  }
+
+  std::string old_path_;
+};
+
+struct ArgCase {
+  const char* label;
+  const char* executable;
+  float by;
+  int extension;  // 0: none; else ext_start 100, ext_by 10, ext_size 4
+  int output_mask;
+  int animate;
+  const char* rnd_opts;
+  float start, end;
+  const char* argv;  // joined by '|'; $PIX, $MATTE, $SDL stand for the job's paths
+};
+void PrintTo(const ArgCase& c, std::ostream* os) { *os << c.label; }
+
+class PerformArgs : public PerformTest, public testing::WithParamInterface<ArgCase> {};
+
+TEST_P(PerformArgs, BuildsTheProgramsArgumentList) {
+  const ArgCase& c = GetParam();
+  job_->executable.set(c.executable);
+  job_->frames[2] = c.by;
+  job_->output_mask = c.output_mask;
+  job_->animate = c.animate;
+  job_->rnd_opts.set(c.rnd_opts);
+  if (c.extension != 0) {
+    job_->extension = 291;
+    job_->ext_start = 100;
+    job_->ext_by = 10;
+    job_->ext_size = 4;
+  }
+  Report r = perform(add_entry(job_, dev_, c.start, c.end, TASK_STARTED));
+
+  std::string expected = c.argv;
+  for (auto [key, value] : {std::pair{"$PIX", job_->pix.c_str()},
+                            {"$MATTE", job_->matte.c_str()},
+                            {"$SDL", job_->sdl.c_str()}}) {
+    size_t at = expected.find(key);
+    if (at != std::string::npos) expected.replace(at, strlen(key), value);
+  }
+  std::string got = r.prog;
+  for (const std::string& a : r.args) got += "|" + a;
+  EXPECT_EQ(got, expected) << r.text;
+}
+
+// clang-format off
+INSTANTIATE_TEST_SUITE_P(Programs, PerformArgs, testing::Values(
+    ArgCase{"edgepass_runs_shadepass_verbose", "edgepass", 1, 0, 0, 1, nullptr, 1, 3,
+            "shadepass|-V|-p|$PIX|-A|-s|1.000000|-e|3.000000|-b|1.000000|-E|1|$SDL"},
+    ArgCase{"glintcast_gets_processors", "glintcast", 1, 0, 0, 1, nullptr, 4, 4,
+            "glintcast|-n4|-p|$PIX|-A|-s|4.000000|-e|4.000000|-b|1.000000|-E|1|$SDL"},
+    ArgCase{"glintwalk_gets_processors", "glintwalk", 1, 0, 0, 0, nullptr, 1, 1,
+            "glintwalk|-n4|-p|$PIX|-A|$SDL"},
+    ArgCase{"mask_and_options_as_one_argument", "myrender", 1, 0, 1, 0, "-q  high", 1, 1,
+            "myrender|-p|$PIX|-m|$MATTE|-A|-q  high|$SDL"},
+    ArgCase{"options_of_blanks_only_are_dropped", "myrender", 1, 0, 0, 0, "   ", 1, 1,
+            "myrender|-p|$PIX|-A|$SDL"},
+    ArgCase{"half_step_numbers_the_frames", "myrender", 0.5f, 0, 0, 1, nullptr, 2, 3,
+            "myrender|-p|$PIX|-A|-s|2.000000|-e|3.000000|-b|0.500000|-S|3|-B|1|-E|1|$SDL"},
+    ArgCase{"whole_step_keeps_frame_numbers", "myrender", 2, 0, 0, 1, nullptr, 3, 7,
+            "myrender|-p|$PIX|-A|-s|3.000000|-e|7.000000|-b|2.000000|-E|1|$SDL"},
+    ArgCase{"job_extension_numbers", "myrender", 1, 1, 0, 1, nullptr, 4, 6,
+            "myrender|-p|$PIX|-A|-s|4.000000|-e|6.000000|-b|1.000000|-S|130|-B|10|-E|4|$SDL"}),
+    [](const testing::TestParamInfo<ArgCase>& info) { return std::string(info.param.label); });
+// clang-format on
+
+TEST_F(PerformTest, RenderProgramRunsInProjectDirWithItsOwnStreamsGroupAndSignals) {
+  RndPathList_add(job_, "/maps/a");
+  RndPathList_add(job_, "/maps/b");
+  TASK* entry = add_entry(job_, dev_, 1, 1, TASK_STARTED);
+
+  // The daemon keeps these blocked and may ignore others: none of it may
+  // reach the render program.
+  sigset_t block, saved;
+  sigemptyset(&block);
+  sigaddset(&block, SIGALRM);
+  sigaddset(&block, SIGCHLD);
+  sigprocmask(SIG_BLOCK, &block, &saved);
+  struct sigaction ignore {
+  }, saved_hup{};
+  ignore.sa_handler = SIG_IGN;
+  sigaction(SIGHUP, &ignore, &saved_hup);
+  std::string cwd_before = std::filesystem::current_path().string();
+
+  entry->stream_path.set(path("stream").c_str());
+  int running_before = rndctl.running;
+  ASSERT_EQ(Perform_a_Task(entry), 1);
+  int pid = entry->pid;
+  int status = wait_for(pid);
+  sigprocmask(SIG_SETMASK, &saved, nullptr);
+  sigaction(SIGHUP, &saved_hup, nullptr);
+
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+  EXPECT_EQ(rndctl.running, running_before + 1);
+  EXPECT_EQ(std::filesystem::current_path().string(), cwd_before);
+  EXPECT_EQ(dev_->last_task, entry);
+  EXPECT_STREQ(entry->out_path.c_str(), path("pix/out.img.testhost.render1.0").c_str());
+
+  Report r = parse_report(read_text_file(entry->out_path.c_str()));
+  EXPECT_EQ(r.cwd, real(path("proj")));
+  EXPECT_EQ(r.search, "[ /maps/a /maps/b]");
+  std::string group = "pid=" + std::to_string(pid) + " pgid=" + std::to_string(pid) + "\n";
+  EXPECT_NE(r.text.find(group), std::string::npos) << r.text;
+  EXPECT_NE(r.text.find("SigBlk:\t0000000000000000"), std::string::npos) << r.text;
+  EXPECT_NE(r.text.find("SigIgn:\t0000000000000000"), std::string::npos) << r.text;
+  EXPECT_EQ(read_file("stream"), "pix.0001 r 5 of 10\n");
+}
+
+TEST_F(PerformTest, PixWithoutDirectoryWritesOutputBesideTheProgramAndCountsUp) {
+  job_->pix.set("img");
+  job_->animate = 0;
+  TASK* entry = add_entry(job_, dev_, 1, 1, TASK_STARTED);
+  entry->stream_path.set(path("stream").c_str());
+  rndctl.out_counter = INT_MAX;
+  ASSERT_EQ(Perform_a_Task(entry), 1);
+  wait_for(entry->pid);
+  EXPECT_STREQ(entry->out_path.c_str(), "./out.img.testhost.render1.2147483647");
+  EXPECT_EQ(rndctl.out_counter, 0);
+  // Relative to the program's working directory, the project directory.
+  Report r = parse_report(read_file("proj/out.img.testhost.render1.2147483647"));
+  EXPECT_EQ(r.prog, "myrender");
+}
+
+TEST_F(PerformTest, ExecFailureIsReportedInBothFilesAndEndsWith255) {
+  char prog[] = "no_such_render_program";
+  char* argv[] = {prog, nullptr};
+  int pid = rj_system(argv, path("stream").c_str(), path("out").c_str(), job_);
+  ASSERT_GT(pid, 0);
+  int status = wait_for(pid);
+  ASSERT_TRUE(WIFEXITED(status));
+  EXPECT_EQ(WEXITSTATUS(status), 255);
+  const char* message =
+      "system(\"no_such_render_program\") failed at exec <No such file or directory>\n";
+  EXPECT_EQ(read_file("out"), message);
+  EXPECT_EQ(read_file("stream"), message);
+}
+
+TEST_F(PerformTest, PlantedLinkDoesNotRedirectTheStream) {
+  write_file("victim", "untouched");
+  ASSERT_EQ(symlink(path("victim").c_str(), path("stream").c_str()), 0);
+  char prog[] = "myrender";
+  char* argv[] = {prog, nullptr};
+  int pid = rj_system(argv, path("stream").c_str(), path("out").c_str(), job_);
+  ASSERT_GT(pid, 0);
+  wait_for(pid);
+  EXPECT_EQ(read_file("victim"), "untouched");
+}
+
+}  // namespace

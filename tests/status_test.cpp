@@ -1,0 +1,362 @@
+// Task status, render progress, job state and the job's error record.
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <filesystem>
+#include <ostream>
+#include <string>
+
+#include "tests/support/task_fixture.h"
+
+namespace {
+
+bool exists(const std::string& p) { return std::filesystem::exists(p); }
+
+class StatusTest : public TaskFixture {
+ protected:
+  /// An entry whose stream reads the file "stream" of the control directory.
+  TASK* entry_with_stream(float start, float end, int status = TASK_RUNNING) {
+    TASK* entry = add_entry(job_, dev_, start, end, status);
+    write_file("stream", "");
+    entry->stream_path.set(path("stream").c_str());
+    entry->stream = fopen(entry->stream_path.c_str(), "r");
+    return entry;
+  }
+  void append_stream(const std::string& text) {
+    FILE* fp = fopen(path("stream").c_str(), "a");
+    ASSERT_NE(fp, nullptr);
+    fputs(text.c_str(), fp);
+    fclose(fp);
+  }
+  /// A child that waits to be killed.
+  static int sleeper() {
+    int pid = fork();
+    if (pid == 0) {
+      for (;;) pause();
+    }
+    return pid;
+  }
+};
+
+// --- Progress reading --------------------------------------------------------
+
+struct ProgressCase {
+  const char* label;
+  const char* stream;
+  float by;
+  int extension;  // 0: none; else ext_start 100, ext_by 10
+  float start, end;
+  int changed;
+  float current;
+  float progress;
+  const char* output;  // null: none
+};
+void PrintTo(const ProgressCase& c, std::ostream* os) { *os << c.label; }
+
+class Progress : public StatusTest, public testing::WithParamInterface<ProgressCase> {};
+
+TEST_P(Progress, LastProgressLineSetsFrameAndPercentage) {
+  const ProgressCase& c = GetParam();
+  job_->frames[2] = c.by;
+  if (c.extension != 0) {
+    job_->extension = 291;
+    job_->ext_start = 100;
+    job_->ext_by = 10;
+  }
+  TASK* entry = entry_with_stream(c.start, c.end);
+  append_stream(c.stream);
+  EXPECT_EQ(set_image_percentage_done(entry), c.changed);
+  EXPECT_FLOAT_EQ(entry->rec->current, c.current);
+  EXPECT_NEAR(entry->progress, c.progress, 1e-3);
+  EXPECT_STREQ(entry->output.c_str(), c.output);
+  // Nothing new on the stream: nothing changes.
+  EXPECT_EQ(set_image_percentage_done(entry), 0);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Lines, Progress,
+    testing::Values(
+        // Frame 3 of 1..10 in progress: current is that frame, not the next.
+        ProgressCase{"third_frame", "pix.0003 r 10 of 100\n", 1, 0, 1, 10, 1, 3, 30.8f, "pix.0003"},
+        ProgressCase{"first_frame_stays_at_start", "pix.0001 r 50 of 100\n", 1, 0, 1, 10, 1, 1,
+                     14.8f, "pix.0001"},
+        ProgressCase{"line_zero_is_the_frames_last", "pix.0003 r 0 of 100\n", 1, 0, 1, 10, 1, 3,
+                     39.8f, "pix.0003"},
+        ProgressCase{"only_the_last_line_counts",
+                     "pix.0002 r 10 of 100\npix.0004 r 20 of 100\nnoblanks\n", 1, 0, 1, 10, 1, 4,
+                     41.8f, "pix.0004"},
+        ProgressCase{"other_text_last_changes_nothing", "pix.0003 r 10 of 100\nshader warning x\n",
+                     1, 0, 1, 10, 0, 1, 0, nullptr},
+        ProgressCase{"step_two_counts_frames", "pix.0005 r 10 of 100\n", 2, 0, 1, 9, 1, 5, 61.6f,
+                     "pix.0005"},
+        ProgressCase{"job_extension_numbers", "pix.0140 r 10 of 100\n", 1, 1, 4, 6, 1, 5, 69.33333f,
+                     "pix.0140"}),
+    [](const testing::TestParamInfo<ProgressCase>& info) { return std::string(info.param.label); });
+
+TEST_F(StatusTest, HalfWrittenProgressLineWaitsForItsEnd) {
+  TASK* entry = entry_with_stream(1, 10);
+  append_stream("pix.0002 r 10 of 100\npix.0005 r 1");
+  EXPECT_EQ(set_image_percentage_done(entry), 1);
+  EXPECT_FLOAT_EQ(entry->rec->current, 2);
+  append_stream("0 of 100\n");
+  EXPECT_EQ(set_image_percentage_done(entry), 1);
+  EXPECT_FLOAT_EQ(entry->rec->current, 5);
+  EXPECT_STREQ(entry->output.c_str(), "pix.0005");
+}
+
+// --- Status changes ----------------------------------------------------------
+
+TEST_F(StatusTest, AbortingARunningTaskKillsItsProcessAndDropsTheStream) {
+  TASK* entry = entry_with_stream(1, 10);
+  entry->output.set("pix.0001");
+  int pid = sleeper();
+  entry->pid = pid;
+  EXPECT_EQ(SetTaskStatus(entry, TASK_ABORTED), 1);
+  int status = wait_for(pid);
+  EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL);
+  EXPECT_EQ(entry->rec->status, TASK_ABORTED);
+  EXPECT_EQ(entry->pid, 0);
+  EXPECT_EQ(entry->stream, nullptr);
+  EXPECT_TRUE(entry->stream_path.none());
+  EXPECT_TRUE(entry->output.none());
+  EXPECT_FALSE(exists(path("stream")));
+}
+
+TEST_F(StatusTest, SameStatusAgainRewritesTheTaskFileAndReportsNoChange) {
+  write_file("Render_Tasks",
+             "\nscene.sdl\t 1\t 1\t 1\n\t0\t 1.000000\t 10.000000\t 1.000000  1\t 0\tRUNNING\n");
+  TASK* entry = add_entry(job_, dev_, 1, 10, TASK_RUNNING);
+  entry->rec->current = 4;
+  EXPECT_EQ(SetTaskStatus(entry, TASK_RUNNING), 0);
+  EXPECT_EQ(read_file("Render_Tasks"),
+            "\nscene.sdl\t 1\t 1\t 1\n\t0\t 1.000000\t 10.000000\t 4.000000  1\t 0\tRUNNING\n");
+  EXPECT_EQ(SetTaskStatus(entry, TASK_FAILED), 1);
+  EXPECT_NE(read_file("Render_Tasks").find("4.000000  1\t 0\tFAILED\n"), std::string::npos);
+}
+
+TEST_F(StatusTest, StartedTaskTurnsRunningOnlyOnItsOwnHost) {
+  Dev* other = Dev_new(nullptr, nullptr, "render2", 2);
+  other->host_name.set("otherhost");
+  TASK* mine = add_entry(job_, dev_, 1, 3, TASK_STARTED, 0);
+  TASK* theirs = add_entry(job_, other, 4, 6, TASK_STARTED, 1);
+  TASK* waiting = add_entry(job_, dev_, 7, 9, TASK_STARTED, 2);
+  mine->pid = 4242;  // any pid of 2 or more counts as a process
+  TaskRec* mine_rec = mine->rec;
+  TaskRec* theirs_rec = theirs->rec;
+  TaskRec* waiting_rec = waiting->rec;
+
+  EXPECT_EQ(ISA_task_running(theirs), 1);
+  EXPECT_EQ(ISA_task_running(waiting), 0);
+  EXPECT_EQ(UpdateRunningTasks(), 1);
+  EXPECT_EQ(mine_rec->status, TASK_RUNNING);
+  EXPECT_EQ(theirs_rec->status, TASK_STARTED);
+  EXPECT_EQ(waiting_rec->status, TASK_STARTED);
+  mine->pid = 0;  // no process to be killed by the fixture's cleanup
+}
+
+TEST_F(StatusTest, AbortedJobStopsThisHostsTasksAndOthersPendingOnes) {
+  Dev* other = Dev_new(nullptr, nullptr, "render2", 2);
+  other->host_name.set("otherhost");
+  job_->status.set("aborted");
+  TASK* running = add_entry(job_, dev_, 1, 3, TASK_RUNNING, 0);
+  TASK* pending = add_entry(job_, other, 4, 6, TASK_PENDING, 1);
+  TASK* started = add_entry(job_, other, 7, 9, TASK_STARTED, 2);
+  int pid = sleeper();
+  running->pid = pid;
+  TaskRec* recs[3] = {running->rec, pending->rec, started->rec};
+
+  EXPECT_EQ(UpdateRunningTasks(), 1);  // the other host's STARTED task
+  int status = wait_for(pid);
+  EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL);
+  EXPECT_EQ(recs[0]->status, TASK_ABORTED);
+  EXPECT_EQ(recs[1]->status, TASK_ABORTED);
+  EXPECT_EQ(recs[2]->status, TASK_STARTED);
+}
+
+// --- Judging ended processes -------------------------------------------------
+
+struct EndCase {
+  const char* label;
+  int waitstatus;
+  int save_out;
+  int status;
+  bool out_kept;
+};
+void PrintTo(const EndCase& c, std::ostream* os) { *os << c.label; }
+
+class EndOfProcess : public StatusTest, public testing::WithParamInterface<EndCase> {};
+
+TEST_P(EndOfProcess, ExitValueDecidesAndOutputGoesUnlessKept) {
+  const EndCase& c = GetParam();
+  job_->save_out = c.save_out;
+  TASK* entry = entry_with_stream(1, 10);
+  write_file("out", "rendering\n");
+  entry->out_path.set(path("out").c_str());
+  entry->rec->current = 4;
+  entry->pid = 0;  // reaped
+  entry->waitstatus = c.waitstatus;
+  TaskRec* rec = entry->rec;
+
+  EXPECT_EQ(UpdateRunningTasks(), 0);
+  EXPECT_EQ(rec->status, c.status);
+  EXPECT_FLOAT_EQ(rec->current, c.status == TASK_FINISHED ? 10.0f : 4.0f);
+  EXPECT_EQ(exists(path("out")), c.out_kept);
+  EXPECT_TRUE(entry->out_path.none());
+  EXPECT_FALSE(exists(path("stream")));
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Outcomes, EndOfProcess,
+    testing::Values(EndCase{"clean_exit_finishes", 0, 0, TASK_FINISHED, false},
+                    EndCase{"clean_exit_keeps_saved_output", 0, 1, TASK_FINISHED, true},
+                    EndCase{"exit_one_fails", 1, 0, TASK_FAILED, false},
+                    EndCase{"killed_fails_keeping_saved_output", 9, 1, TASK_FAILED, true}),
+    [](const testing::TestParamInfo<EndCase>& info) { return std::string(info.param.label); });
+
+TEST_F(StatusTest, FailedTaskOfThisHostsJobEndsInTheJobFileWithItsError) {
+  // The resource is named after the host, as the reload matches them.
+  Dev* host_dev = Dev_new(nullptr, nullptr, "testhost", 3);
+  host_dev->host_name.set("testhost");
+  RndDevList_add(job_, host_dev);
+  RJC_out();
+  TASK* entry = entry_with_stream(1, 10);
+  entry->rec->dev = host_dev;
+  entry->rec->retries = 10;  // no more retries: it stays failed
+  write_file("out", "loading scene\nshader did not build\nexiting\n");
+  entry->out_path.set(path("out").c_str());
+  entry->waitstatus = 1;
+
+  EXPECT_EQ(UpdateRunningTasks(), 0);
+  Job* job = Job_by_index(1);
+  ASSERT_NE(job, nullptr);
+  EXPECT_STREQ(job->status.c_str(), "failed");
+  EXPECT_STREQ(job->comment.c_str(),
+               "ERROR: testhost (testhost) frame 1.0\nshader did not build\n\n \n");
+  EXPECT_EQ(rndctl.tasks, nullptr);  // all tasks ended: cleared
+  EXPECT_NE(read_file("JOBLOG/scene.sdl").find("\t FAILED  10\n"), std::string::npos);
+}
+
+// --- Error record ------------------------------------------------------------
+
+struct ErrorCase {
+  const char* label;
+  int waitstatus;
+  const char* log;
+  const char* old_comment;
+  const char* comment;
+};
+void PrintTo(const ErrorCase& c, std::ostream* os) { *os << c.label; }
+
+class ErrorRecord : public StatusTest, public testing::WithParamInterface<ErrorCase> {};
+
+TEST_P(ErrorRecord, ReasonPilesUpInTheComment) {
+  const ErrorCase& c = GetParam();
+  TASK* entry = add_entry(job_, dev_, 2.5f, 10, TASK_FAILED);
+  write_file("out", c.log);
+  entry->out_path.set(path("out").c_str());
+  entry->waitstatus = c.waitstatus;
+  job_->comment.set(c.old_comment);
+  Job_Error_Update(entry);
+  EXPECT_STREQ(job_->comment.c_str(), c.comment);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Reasons, ErrorRecord,
+    testing::Values(ErrorCase{"first_error_line_wins", 1, "a\nparse error at 3\nb Error\n", nullptr,
+                              "ERROR: render1 (testhost) frame 2.5\nparse error at 3\n\n \n"},
+                    ErrorCase{"last_line_when_nothing_matches", 0, "one\ntwo\n", "old\n",
+                              "old\nERROR: render1 (testhost) frame 2.5\ntwo\n\n \n"},
+                    ErrorCase{"empty_log_unknown_reason", 1, "", nullptr,
+                              "ERROR: render1 (testhost) frame 2.5\nQuit for Unknown reasons\n \n"},
+                    ErrorCase{"signal_reason_skips_the_log", 9, "parse error\n", nullptr,
+                              "ERROR: render1 (testhost) frame 2.5\nSIGKILL (Killed)\n\n \n"}),
+    [](const testing::TestParamInfo<ErrorCase>& info) { return std::string(info.param.label); });
+
+// --- Job state -----------------------------------------------------------------
+
+struct StateCase {
+  const char* label;
+  std::vector<int> statuses;  // one task of frames i*2+1 .. i*2+2 each
+  const char* job_status;
+  int ctrl;
+  const char* expected;
+};
+void PrintTo(const StateCase& c, std::ostream* os) { *os << c.label; }
+
+class JobState : public StatusTest, public testing::WithParamInterface<StateCase> {};
+
+TEST_P(JobState, TasksDecideTheJobsStatusText) {
+  const StateCase& c = GetParam();
+  job_->status.set(c.job_status);
+  job_->ctrl = c.ctrl;
+  job_->frames[1] = static_cast<float>(c.statuses.size() * 2);
+  job_->totalframes = static_cast<int>(c.statuses.size() * 2);
+  for (size_t i = 0; i < c.statuses.size(); ++i) {
+    TASK* entry = add_entry(job_, dev_, static_cast<float>(i * 2 + 1),
+                            static_cast<float>(i * 2 + 2), c.statuses[i], static_cast<int>(i));
+    entry->rec->retries = 10;
+    if (c.statuses[i] == TASK_RUNNING) {
+      entry->rec->current = entry->rec->start;
+      entry->progress = 50.0f;
+    }
+  }
+  UpdateJobState(job_);
+  EXPECT_STREQ(job_->status.c_str(), c.expected);
+}
+
+// Frames 1-2 finished and frame 3 under way count 3 of 4 frames; half of a
+// task spread over the job's 4 frames adds 12.5.
+// clang-format off
+INSTANTIATE_TEST_SUITE_P(Masks, JobState, testing::Values(
+    StateCase{"only_pending", {TASK_PENDING, TASK_PENDING}, "none", RUN_AVAILABLE, "pending"},
+    StateCase{"only_started", {TASK_STARTED}, "pending", RUN_AVAILABLE, "started"},
+    StateCase{"only_failed", {TASK_FAILED, TASK_FAILED}, "started", RUN_AVAILABLE, "failed"},
+    StateCase{"mixed_shows_progress", {TASK_FINISHED, TASK_RUNNING}, "started", RUN_AVAILABLE, "87.50% "},
+    StateCase{"paused_job_says_so", {TASK_FINISHED, TASK_RUNNING}, "started", RUN_PAUSED, "87.50% Paused"},
+    StateCase{"restarted_keeps_its_text", {TASK_FINISHED, TASK_PENDING}, "restarted", RUN_AVAILABLE, "restarted"},
+    StateCase{"restarted_with_pending_only", {TASK_PENDING}, "restarted", RUN_AVAILABLE, "pending"},
+    StateCase{"no_tasks_restarted_job", {}, "restarted", RUN_AVAILABLE, "pending"}),
+    [](const testing::TestParamInfo<StateCase>& info) { return std::string(info.param.label); });
+// clang-format on
+
+TEST_F(StatusTest, FinishedJobWritesItsLogAndClearsItsTasks) {
+  job_->executable.set("shadepass");
+  job_->del_when_done = 1;
+  write_file("testhost.pid", "");
+  struct timespec long_ago[2] = {{1000, 0}, {1000, 0}};
+  utimensat(AT_FDCWD, path("testhost.pid").c_str(), long_ago, 0);
+  int64_t before = daemon_updatetime_get("testhost");
+  RndDevList_add(job_, dev_);
+  TASK* a = add_entry(job_, dev_, 1, 5, TASK_FINISHED, 0);
+  TASK* b = add_entry(job_, nullptr, 6, 10, TASK_FINISHED, 1);
+  b->rec->retries = 2;
+  ASSERT_NE(a, nullptr);
+
+  UpdateJobState(job_);
+  EXPECT_STREQ(job_->status.c_str(), "finished");
+  EXPECT_EQ(job_->doneframes, 10);
+  EXPECT_EQ(rndctl.tasks, nullptr);
+  EXPECT_EQ(job_->deleted, 1);
+  EXPECT_NE(daemon_updatetime_get("testhost"), before);
+  const std::string sdl = path("proj/sdl/scene.sdl");
+  EXPECT_EQ(read_file("JOBLOG/scene.sdl"),
+            "scene.sdl 1 using the shadepass\n\tsdl = \"" + sdl +
+                "\"\n"
+                "\tframes = 1.000000 to 10.000000 by 1.000000\n"
+                "  no extension set\n"
+                "\t0\t 1.000000 - 5.000000\t1 - 5\t render1\t FINISHED  0\n"
+                "\t1\t 6.000000 - 10.000000\t6 - 10\t nodev\t FINISHED  2\n");
+
+  FILE* log = Logfile_open(job_);
+  ASSERT_NE(log, nullptr);
+  char line[120];
+  ASSERT_NE(fgets(line, sizeof line, log), nullptr);
+  EXPECT_STREQ(line, "\t0\t 1.000000 - 5.000000\t1 - 5\t render1\t FINISHED  0\n");
+  fclose(log);
+}
+
+}  // namespace

@@ -1,0 +1,58 @@
+// A control directory with one job, one resource on this host and helpers
+// to make running-task entries and to start and wait for real children.
+#pragma once
+
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <filesystem>
+#include <string>
+
+#include "Shared/memory/MA_rtns.h"
+#include "tests/support/test_support.h"
+
+class TaskFixture : public ControlDirTest {
+ protected:
+  void SetUp() override {
+    ControlDirTest::SetUp();
+    job_ = Job_new(nullptr, nullptr, path("proj/sdl/scene.sdl").c_str(), 1);
+    ASSERT_NE(job_, nullptr);
+    job_->executable.set("myrender");
+    job_->pix.set(path("pix/img").c_str());
+    job_->animate = 1;
+    job_->frames[0] = 1.0f;
+    job_->frames[1] = 10.0f;
+    job_->frames[2] = 1.0f;
+    job_->totalframes = 10;
+    dev_ = Dev_new(nullptr, nullptr, "render1", 1);
+    ASSERT_NE(dev_, nullptr);
+    dev_->host_name.set("testhost");
+    mkdir_p("proj/sdl");
+    mkdir_p("pix");
+  }
+
+  void mkdir_p(const std::string& rel) const { std::filesystem::create_directories(path(rel)); }
+
+  /// A running-task entry of `job` for start..end on `dev`, in `status`.
+  TASK* add_entry(Job* job, Dev* dev, float start, float end, int status, int id = 0) {
+    auto* rec = MA_new<TaskRec>(__LINE__, "tests/task_fixture");
+    rec->start = start;
+    rec->end = end;
+    rec->current = start;
+    rec->status = status;
+    rec->id = id;
+    rec->dev = dev;
+    return Task_add(job, rec);
+  }
+
+  /// Waits for `pid` and returns its raw wait status.
+  static int wait_for(int pid) {
+    int status = 0;
+    EXPECT_EQ(waitpid(pid, &status, 0), pid);
+    return status;
+  }
+
+  Job* job_ = nullptr;  // owned by the control block's list
+  Dev* dev_ = nullptr;  // owned by the control block's list
+};
