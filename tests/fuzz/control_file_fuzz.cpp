@@ -1,0 +1,97 @@
+// Feeds arbitrary bytes to the control-file reader.  Nothing may crash or
+// overrun; a syntax error abandons the parse (the product would end the
+// process).  What reads without error is written, read back and written
+// again: the writer's output must always be readable, and after one rewrite
+// (which settles unknown states to their defaults and drops the resource
+// comments) the text must not change any more.
+#include <unistd.h>
+
+#include <cstdint>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <string>
+
+#include "Utility/rndctl/rndctl.h"
+
+namespace {
+
+// Resources for the job files to name; read before every input.
+const char kResources[] =
+    "RenderResourceControl\n"
+    "alpha 1 {\n\thost_name\t\t= alpha;\n\tstatus \t\t\t= SCHEDULE;\n"
+    "\tlocks =\t{ 800 to 1700 Monday to Friday };\n\t}\n\n"
+    "beta 2 {\n\tstatus \t\t\t= LOCKED;\n\t}\n\n"
+    "End\n";
+
+bool failed = false;
+
+void note_failure(int) { failed = true; }
+
+void clear_lists() {
+  while (rndctl.jobs != nullptr) Job_del(rndctl.jobs);
+  while (rndctl.devs != nullptr) Dev_del(rndctl.devs);
+}
+
+bool parse(const std::string& text, const char* file) {
+  failed = false;
+  int result = RJC_parse_string(text.data(), text.size(), file);
+  return result == 0 && !failed;
+}
+
+std::string written(void (*writer)(FILE*)) {
+  char* buf = nullptr;
+  size_t size = 0;
+  FILE* fp = open_memstream(&buf, &size);
+  if (fp == nullptr) abort();
+  writer(fp);
+  fclose(fp);
+  std::string text(buf, size);
+  free(buf);
+  return text;
+}
+
+// Reads both texts into empty lists and writes them again.
+bool reread(std::string& devs, std::string& jobs) {
+  clear_lists();
+  if (!parse(devs, "Render_Resource_Control") || !parse(jobs, "Render_Job_Control")) return false;
+  devs = written(Resource_control_write_dev);
+  jobs = written(Job_control_write_dev);
+  return true;
+}
+
+void setup() {
+  // Blocks with index 0 ask for a fresh index, which lives in a file of the
+  // control directory.
+  static char dir[] = "/tmp/rjc_fuzz_XXXXXX";
+  if (mkdtemp(dir) == nullptr) abort();
+  rndctl.location.set(dir);
+  rndctl.host.set("fuzzhost");
+  rndctl.user.set("fuzzer");
+  rndctl.pid = getpid();
+  RJC_fatal_exit = note_failure;
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
+  static bool ready = (setup(), true);
+  (void)ready;
+
+  clear_lists();
+  if (!parse(kResources, "Render_Resource_Control")) abort();
+  if (!parse(std::string(reinterpret_cast<const char*>(data), size), "Render_Job_Control")) {
+    clear_lists();
+    return 0;
+  }
+
+  std::string devs = written(Resource_control_write_dev);
+  std::string jobs = written(Job_control_write_dev);
+  if (!reread(devs, jobs)) abort();  // the writer wrote what the reader refuses
+  std::string devs_once = devs;
+  std::string jobs_once = jobs;
+  if (!reread(devs, jobs)) abort();
+  if (devs != devs_once || jobs != jobs_once) abort();  // the rewrite did not settle
+  clear_lists();
+  return 0;
+}
