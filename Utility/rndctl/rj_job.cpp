@@ -18,12 +18,6 @@ auto index_is(int index) {
   return [index](const Job* j) { return j->index == index; };
 }
 
-// The file part of a path: what follows the last '/', or the whole path.
-const char* file_part(const char* path) {
-  const char* slash = strrchr(path, '/');
-  return slash != nullptr ? slash + 1 : path;
-}
-
 // The reader appends ten thousand jobs; walking to the tail for each would
 // be quadratic.  The last appended job is remembered together with the head
 // of its list, and only used while that list is the current one (a reload
@@ -47,7 +41,14 @@ Job* Job_new(Job* before, void* listitem, const char* path, int index) {
 
   job->pick_level = 0;
   job->listitem = listitem;
-  if (path != nullptr) job->name.set(file_part(path));
+  char* base = nullptr;
+  char* dir = nullptr;
+  rj_splitpath(path, &base, &dir, nullptr);
+  MA_free(dir, __LINE__, kUnit);
+  if (base != nullptr)
+    job->name.adopt(base);
+  else
+    job->name.set(path);
   job->status.set("none");
   job->priority = 0;
   job->index = index != 0 ? index : RJCget_next_index(FILE_JOB_INDEX);

@@ -1,0 +1,311 @@
+// Index files, scene-file settings, frame counts, field checks and record
+// comparison.
+#include <functional>
+#include <ostream>
+#include <string>
+
+#include "tests/support/test_support.h"
+
+namespace {
+
+class JobCheckTest : public ControlDirTest {
+ protected:
+  Job* scene_job(const std::string& scene) {
+    write_file("scene.sdl", scene);
+    Job* job = Job_new(nullptr, nullptr, path("scene.sdl").c_str(), 1);
+    return job;
+  }
+};
+
+}  // namespace
+
+TEST_F(JobCheckTest, NextIndexReadsAndAdvancesTheFile) {
+  write_file("Render_Job_next_index", "41l\n");
+  EXPECT_EQ(RJCget_next_index(FILE_JOB_INDEX), 41);
+  EXPECT_EQ(read_file("Render_Job_next_index"), "42l\n");
+  EXPECT_EQ(RJCget_next_index(FILE_JOB_INDEX), 42);
+
+  // A missing file starts at 1; the two counters are separate files.
+  EXPECT_EQ(RJCget_next_index(FILE_DEV_INDEX), 1);
+  EXPECT_EQ(read_file("Render_Dev_next_index"), "2l\n");
+  EXPECT_EQ(read_file("Render_Job_next_index"), "43l\n");
+
+  // The lock is released: no lock directory is left behind.
+  EXPECT_EQ(read_file("Render_Job_next_index.lock/testhost"), "");
+
+  // Wrapping past the top never stores 0, which would ask for a fresh index.
+  write_file("Render_Dev_next_index", "-1l\n");
+  EXPECT_EQ(RJCget_next_index(FILE_DEV_INDEX), -1);
+  EXPECT_EQ(read_file("Render_Dev_next_index"), "1l\n");
+}
+
+TEST_F(JobCheckTest, RecordsTakeFreshIndexesFromTheFiles) {
+  write_file("Render_Job_next_index", "500l\n");
+  write_file("Render_Dev_next_index", "70l\n");
+  EXPECT_EQ(Job_new(nullptr, nullptr, "a", 0)->index, 500);
+  EXPECT_EQ(Dev_new(nullptr, nullptr, "new_resource", 0)->name.c_str(),
+            std::string("new_resource_70"));
+}
+
+TEST(GetStrstr, ValueAfterTheKeyUpToTheSemicolon) {
+  char line[] = "\tstartframe =  12.5; endframe = 3;\n";
+  char* value = get_strstr("startframe", line);
+  ASSERT_NE(value, nullptr);
+  EXPECT_STREQ(value, "  12.5");
+  char no_equals[] = "startframe 12;";
+  EXPECT_EQ(get_strstr("startframe", no_equals), nullptr);
+  char other[] = "byframe = 2;";
+  EXPECT_EQ(get_strstr("startframe", other), nullptr);
+  char open[] = "fields = TRUE\n";
+  EXPECT_STREQ(get_strstr("fields", open), " TRUE\n");
+}
+
+TEST(RjStrcmp, AcceptsNone) {
+  EXPECT_EQ(rj_strcmp(nullptr, nullptr), 0);
+  EXPECT_EQ(rj_strcmp("a", nullptr), 1);
+  EXPECT_EQ(rj_strcmp(nullptr, ""), -1);
+  EXPECT_EQ(rj_strcmp("a", "a"), 0);
+  EXPECT_LT(rj_strcmp("a", "b"), 0);
+}
+
+struct FrameRange {
+  float start, end, step;
+  int count;
+};
+
+void PrintTo(const FrameRange& r, std::ostream* os) {
+  *os << r.start << " to " << r.end << " by " << r.step;
+}
+
+class FrameCount : public testing::TestWithParam<FrameRange> {};
+
+TEST_P(FrameCount, CountsFramesLandingOnTheEnd) {
+  const FrameRange& r = GetParam();
+  EXPECT_EQ(Calc_frame_range(r.start, r.end, r.step), r.count)
+      << r.start << " to " << r.end << " by " << r.step;
+}
+
+INSTANTIATE_TEST_SUITE_P(Ranges, FrameCount,
+                         testing::Values(FrameRange{1, 10, 1, 10}, FrameRange{1, 10, 2, 5},
+                                         FrameRange{1, 10, 3, 4}, FrameRange{10, 1, 1, 1},
+                                         FrameRange{5, 5, 1, 1}, FrameRange{1, 10, 0, 1},
+                                         FrameRange{0, 1, 0.25f, 5},
+                                         // 0.1 accumulates past 2.0 by rounding, within tolerance
+                                         FrameRange{1, 2, 0.1f, 11}, FrameRange{1, 10, 20, 1}));
+
+TEST_F(JobCheckTest, FieldSettingsFromTheScene) {
+  Job* job = scene_job("fields = TRUE;\nodd = TRUE;\neven = FALSE;\n");
+  EXPECT_EQ(Job_check_sdlfields(job), 1);
+
+  // FALSE ends the scan: the odd and even lines after it are not read.
+  job = scene_job("fields = FALSE;\nodd = TRUE;\neven = TRUE;\n");
+  job->fields = 3;
+  EXPECT_EQ(Job_check_sdlfields(job), 0);
+  EXPECT_EQ(job->fields, 0);
+
+  // A line holding ENVIRONMENT with its newline does not stop the scan.
+  job = scene_job("ENVIRONMENT\nfields = TRUE;\nodd = ON;\neven = TRUE;\n");
+  EXPECT_EQ(Job_check_sdlfields(job), 3);
+
+  // A scene without the keys, or no scene at all, leaves fields alone.
+  job = scene_job("camera = persp;\n");
+  job->fields = 2;
+  EXPECT_EQ(Job_check_sdlfields(job), 2);
+  job->sdl.set(path("missing.sdl").c_str());
+  EXPECT_EQ(Job_check_sdlfields(job), 0);
+  EXPECT_EQ(job->fields, 2);
+  EXPECT_EQ(Job_check_sdlfields(nullptr), 0);
+}
+
+TEST_F(JobCheckTest, AnimationSettingsFromTheScene) {
+  Job* job = scene_job(
+      "DEFINITION\n  animation = ON;\n  startframe = 1;\n  endframe = 10.0;\n  byframe = 2;\n"
+      "  start_extension = 100;\n  by_extension = 5;\n  extensionsize = 4;\n");
+  EXPECT_EQ(Job_set_frame_range(job), 5);
+  EXPECT_EQ(job->animate, 1);
+  EXPECT_FLOAT_EQ(job->frames[0], 1.0f);
+  EXPECT_FLOAT_EQ(job->frames[1], 10.0f);
+  EXPECT_FLOAT_EQ(job->frames[2], 2.0f);
+  EXPECT_EQ(job->ext_start, 100);
+  EXPECT_EQ(job->ext_by, 5);
+  EXPECT_EQ(job->ext_size, 4);
+  EXPECT_EQ(job->extension, 0);  // the flag word belongs to the job file
+
+  // animation OFF stops reading: the frames after it are not taken.
+  job = scene_job("animation = OFF;\nstartframe = 7;\n");
+  EXPECT_EQ(Job_set_frame_range(job), 1);
+  EXPECT_EQ(job->animate, 0);
+  EXPECT_FLOAT_EQ(job->frames[0], 0.0f);
+
+  job->sdl.reset();
+  EXPECT_EQ(Job_set_frame_range(job), 0);
+}
+
+TEST_F(JobCheckTest, SceneCheckKeepsFramesAndHonoursTheExtensionFlag) {
+  const char* scene =
+      "animation = ON;\nstartframe = 50;\nstart_extension = 9;\nby_extension = 3;\n";
+  Job* job = scene_job(scene);
+  job->frames[0] = 4.7f;
+  job->frames[1] = 8.0f;
+  job->frames[2] = 1.0f;
+  EXPECT_EQ(Job_check_sdl(job), 4);  // 4.7 5.7 6.7 7.7 from the job, not the scene
+  EXPECT_FLOAT_EQ(job->frames[0], 4.7f);
+  EXPECT_EQ(job->ext_start, 9);
+  EXPECT_EQ(job->ext_by, 3);
+
+  // Without extension lines the defaults come from the start frame.
+  job = scene_job("animation = ON;\n");
+  job->frames[0] = 4.7f;
+  job->ext_by = 8;
+  Job_check_sdl(job);
+  EXPECT_EQ(job->ext_start, 4);
+  EXPECT_EQ(job->ext_by, 1);
+
+  // With the job file's extension set, the scene's values are not read.
+  job = scene_job(scene);
+  job->extension = 291;
+  job->ext_start = 20;
+  job->ext_by = 2;
+  Job_check_sdl(job);
+  EXPECT_EQ(job->ext_start, 20);
+  EXPECT_EQ(job->ext_by, 2);
+  EXPECT_EQ(job->animate, 1);
+}
+
+TEST_F(JobCheckTest, FieldChecksFillOwnersAndDropDeadLocks) {
+  Job* mine = Job_new(nullptr, nullptr, "mine", 1);
+  Job* stale = Job_new(nullptr, nullptr, "stale", 2);
+  mine->lock_pid = rndctl.pid;
+  stale->lock_pid = 999999;  // no editor registered under it
+  stale->user.set("alice");
+  Job_field_check();
+  EXPECT_STREQ(mine->user.c_str(), "tester");
+  EXPECT_STREQ(stale->user.c_str(), "alice");
+  EXPECT_EQ(mine->lock_pid, rndctl.pid);
+  EXPECT_EQ(stale->lock_pid, 0);
+
+  Dev* dev = Dev_new(nullptr, nullptr, "d", 1);
+  dev->lock_pid = 999999;
+  Dev_field_check();
+  EXPECT_EQ(dev->lock_pid, 0);
+}
+
+TEST_F(JobCheckTest, LiveJobsOnAHost) {
+  Dev* here = Dev_new(nullptr, nullptr, "here", 1);
+  Dev* there = Dev_new(nullptr, nullptr, "there", 2);
+  there->host_name.set("elsewhere");
+  Job* job = Job_new(nullptr, nullptr, "j", 1);
+  RndDevList_add(job, there);
+  RndDevList_add(job, here);
+  for (const char* dead : {"none", "failed", "aborted", "finished"}) {
+    job->status.set(dead);
+    EXPECT_EQ(Job_file_search("testhost"), 0) << dead;
+  }
+  job->status.set("pending");
+  EXPECT_EQ(Job_file_search("testhost"), 1);
+  EXPECT_EQ(Job_file_search("elsewhere"), 1);
+  EXPECT_EQ(Job_file_search("nowhere"), 0);
+}
+
+namespace {
+
+struct JobChange {
+  const char* what;
+  std::function<void(Job*, Dev*)> change;
+  const char* message;
+};
+
+void PrintTo(const JobChange& c, std::ostream* os) { *os << c.what; }
+
+class JobDifference : public ControlDirTest, public testing::WithParamInterface<JobChange> {};
+
+}  // namespace
+
+TEST_P(JobDifference, IsReportedWithItsMessage) {
+  Dev* dev = Dev_new(nullptr, nullptr, "host", 1);
+  Dev* other_dev = Dev_new(nullptr, nullptr, "host", 2);
+  Job* a = Job_new(nullptr, nullptr, "shot", 1);
+  Job* b = Job_new(nullptr, nullptr, "shot", 1);
+  for (Job* j : {a, b}) {
+    RndDevList_add(j, dev);
+    RndPathList_add(j, "/maps");
+    j->runs[100] = 1;
+  }
+  a->fields = 3;  // fields and pick level take no part
+  a->pick_level = 1;
+  EXPECT_EQ(ISA_jobdif(a, b), 0);
+
+  GetParam().change(b, other_dev);
+  debug = 1;
+  testing::internal::CaptureStderr();
+  int differs = ISA_jobdif(a, b);
+  std::string trace = testing::internal::GetCapturedStderr();
+  debug = 0;
+  EXPECT_EQ(differs, 1);
+  EXPECT_EQ(trace, std::string("testhost:\t") + GetParam().message);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Fields, JobDifference,
+    testing::Values(JobChange{"name", [](Job* j, Dev*) { j->name.reset(); },
+                              "\"shot\" is differnt from \"noname\"\n"},
+                    JobChange{"status", [](Job* j, Dev*) { j->status.set("pending"); },
+                              "\"shot\" is differnt from \"shot\"\n"},
+                    JobChange{"frame", [](Job* j, Dev*) { j->frames[2] = 1e-9f; },
+                              "\"shot\" is differnt from \"shot\"\n"},
+                    JobChange{"extension", [](Job* j, Dev*) { j->ext_size = 2; },
+                              "\"shot\" is differnt from \"shot\"\n"},
+                    JobChange{"user", [](Job* j, Dev*) { j->user.set("bob"); },
+                              "\"shot\" is differnt from \"shot\"\n"},
+                    JobChange{"mark", [](Job* j, Dev*) { j->deleted = 1; },
+                              "\"shot\" is differnt from \"shot\"\n"},
+                    JobChange{"run slot", [](Job* j, Dev*) { j->runs[335] = 1; },
+                              "\"shot\" is differnt from \"shot\"\n"},
+                    JobChange{"path", [](Job* j, Dev*) { j->searchpath->path.set("/other"); },
+                              "\"shot\" pathlist is differnt from \"shot\"\n"},
+                    JobChange{"extra path", [](Job* j, Dev*) { RndPathList_add(j, "/more"); },
+                              "\"shot\" pathlist is differnt from \"shot\"\n"},
+                    JobChange{"resource", [](Job* j, Dev* d) { RndDevList_add(j, d); },
+                              "\"shot\" devlist is differnt from \"shot\"\n"}),
+    [](const testing::TestParamInfo<JobChange>& info) {
+      std::string n = info.param.what;
+      for (char& c : n)
+        if (c == ' ') c = '_';
+      return n;
+    });
+
+TEST_F(JobCheckTest, ResourceDifferences) {
+  // Copies of records come from different lists: each resource copy gets
+  // its own copies of the jobs, linked in the other order.
+  auto copy_of_a = [](int first, int second) {
+    Dev* d = Dev_new(nullptr, nullptr, "a", 1);
+    RndDevList_add(Job_new(nullptr, nullptr, "j", first), d);
+    RndDevList_add(Job_new(nullptr, nullptr, "j", second), d);
+    return d;
+  };
+  Dev* a = copy_of_a(1, 2);
+  EXPECT_EQ(ISA_devdif(a, copy_of_a(2, 1)), 0);
+
+  const std::function<void(Dev*)> changes[] = {
+      [](Dev* d) { d->max_frames = 8; },
+      [](Dev* d) { d->num_processors = 2; },
+      [](Dev* d) { d->status = LOCK_LOCKED; },
+      [](Dev* d) { d->host_name.reset(); },
+      [](Dev* d) { d->comment.set("x"); },
+      [](Dev* d) { d->remote_location.set("/r"); },
+      [](Dev* d) { d->locks[0] = 1; },
+      [](Dev* d) { d->lock_pid = 4; },
+      [](Dev* d) { RndJobList_del(d, d->jobs->job); },
+      [](Dev* d) { RndDevList_add(Job_new(nullptr, nullptr, "j", 3), d); },
+  };
+  for (size_t i = 0; i < std::size(changes); i++) {
+    Dev* copy = copy_of_a(2, 1);
+    changes[i](copy);
+    debug = 1;
+    testing::internal::CaptureStderr();
+    EXPECT_EQ(ISA_devdif(a, copy), 1) << i;
+    std::string trace = testing::internal::GetCapturedStderr();
+    debug = 0;
+    EXPECT_EQ(trace, "testhost:\t\"a\" is differnt from \"a\"\n") << i;
+  }
+}

@@ -1,0 +1,298 @@
+// Job and resource records and the pick lists between them.
+#include <cstdlib>
+#include <ostream>
+#include <string>
+#include <vector>
+
+#include "tests/support/test_support.h"
+
+namespace {
+
+std::vector<int> job_order() {
+  std::vector<int> v;
+  for (Job* j = rndctl.jobs; j != nullptr; j = j->next) v.push_back(j->index);
+  return v;
+}
+
+std::vector<int> dev_order() {
+  std::vector<int> v;
+  for (Dev* d = rndctl.devs; d != nullptr; d = d->next) v.push_back(d->index);
+  return v;
+}
+
+// Back links must mirror forward links, or deletes corrupt the list.
+void expect_links_consistent() {
+  Job* prev = nullptr;
+  for (Job* j = rndctl.jobs; j != nullptr; prev = j, j = j->next) EXPECT_EQ(j->prev, prev);
+  Dev* dprev = nullptr;
+  for (Dev* d = rndctl.devs; d != nullptr; dprev = d, d = d->next) EXPECT_EQ(d->prev, dprev);
+}
+
+class RecordsTest : public ControlDirTest {};
+
+}  // namespace
+
+TEST_F(RecordsTest, NewJobDefaults) {
+  Job* job = Job_new(nullptr, nullptr, "/proj/sdl/ball.sdl", 12);
+  ASSERT_NE(job, nullptr);
+  EXPECT_STREQ(job->name.c_str(), "ball.sdl");
+  EXPECT_STREQ(job->sdl.c_str(), "/proj/sdl/ball.sdl");
+  EXPECT_STREQ(job->status.c_str(), "none");
+  EXPECT_STREQ(job->pix.c_str(), "./pix_file");
+  EXPECT_STREQ(job->matte.c_str(), "./matte_file");
+  EXPECT_EQ(job->index, 12);
+  EXPECT_EQ(job->use_sdl_paths, 1);
+  EXPECT_EQ(job->ctrl, RUN_AVAILABLE);
+  EXPECT_EQ(job->totalframes, 1);
+  EXPECT_EQ(job->ext_by, 1);
+  EXPECT_EQ(job->ext_size, 1);
+  for (int n = 0; n < RJ_WEEK_SCAN; n++) ASSERT_EQ(job->runs[n], 0) << n;
+
+  // Without a path: no name, no scene, still taking paths from the scene.
+  Job* bare = Job_new(nullptr, nullptr, nullptr, 13);
+  ASSERT_NE(bare, nullptr);
+  EXPECT_TRUE(bare->name.none());
+  EXPECT_TRUE(bare->sdl.none());
+  EXPECT_EQ(bare->use_sdl_paths, 1);
+
+  Job* plain = Job_new(nullptr, nullptr, "shot", 14);
+  EXPECT_STREQ(plain->name.c_str(), "shot");
+}
+
+TEST_F(RecordsTest, JobListOrderInsertAndDelete) {
+  Job* a = Job_new(nullptr, nullptr, "a", 1);
+  Job* b = Job_new(nullptr, nullptr, "b", 2);
+  Job_new(a, nullptr, "head", 3);  // before the head: becomes the head
+  Job_new(b, nullptr, "mid", 4);   // before an inner job
+  EXPECT_EQ(job_order(), (std::vector<int>{3, 1, 4, 2}));
+  expect_links_consistent();
+
+  // Deleting returns the job before, else the one after.
+  EXPECT_EQ(Job_del(b)->index, 4);
+  EXPECT_EQ(Job_del(rndctl.jobs)->index, 1);  // the head: its successor
+  EXPECT_EQ(job_order(), (std::vector<int>{1, 4}));
+  expect_links_consistent();
+  // Appending after deletes lands at the real tail.
+  Job_new(nullptr, nullptr, "c", 5);
+  EXPECT_EQ(job_order(), (std::vector<int>{1, 4, 5}));
+  Job_del(Job_by_index(5));
+  Job_del(Job_by_index(4));
+  EXPECT_EQ(Job_del(rndctl.jobs), nullptr);  // the only job
+  EXPECT_EQ(rndctl.jobs, nullptr);
+  EXPECT_EQ(Job_del(nullptr), nullptr);
+}
+
+TEST_F(RecordsTest, AddFindsByIndexAndLookupsReturnFirstMatch) {
+  Job* a = Add_a_job(nullptr, "shot", 7);
+  a->priority = 5;
+  // Rereading the same index updates the record in memory: same job back.
+  EXPECT_EQ(Add_a_job(nullptr, "other", 7), a);
+  EXPECT_STREQ(a->name.c_str(), "shot");
+  EXPECT_EQ(Insert_a_job(nullptr, nullptr, "x", 7), a);
+
+  // Duplicate indexes and names can be made by hand; lookups give the first
+  // in list order, also after the first one goes.
+  Job* second = Job_new(nullptr, nullptr, "shot", 7);
+  Job* third = Job_new(a, nullptr, "shot", 7);  // now first in the list
+  EXPECT_EQ(Job_by_index(7), third);
+  EXPECT_EQ(Job_by_name("shot"), third);
+  Job_del(third);
+  EXPECT_EQ(Job_by_index(7), a);
+  Job_del(a);
+  EXPECT_EQ(Job_by_index(7), second);
+  Job_del(second);
+  EXPECT_EQ(Job_by_index(7), nullptr);
+  EXPECT_EQ(Job_by_name(nullptr), nullptr);
+
+  int item[4] = {};
+  Job* listed = Job_new(nullptr, item, "listed", 8);
+  EXPECT_EQ(Job_by_listitem(item), listed);
+}
+
+TEST_F(RecordsTest, IndexLookupsSurviveManyRecords) {
+  for (int i = 1; i <= 3000; i++) ASSERT_NE(Add_a_job(nullptr, "j", i), nullptr);
+  for (int i = 1; i <= 300; i++)
+    ASSERT_NE(Add_a_dev(nullptr, ("d" + std::to_string(i)).c_str(), i), nullptr);
+  EXPECT_EQ(job_order().size(), 3000u);
+  EXPECT_EQ(job_order().back(), 3000);
+  for (int i = 1; i <= 3000; i += 37) ASSERT_EQ(Job_by_index(i)->index, i);
+  for (int i = 1; i <= 300; i += 7) {
+    ASSERT_EQ(Dev_by_index(i)->index, i);
+    ASSERT_EQ(Dev_by_name(("d" + std::to_string(i)).c_str())->index, i);
+  }
+  EXPECT_EQ(Job_by_index(3001), nullptr);
+  EXPECT_EQ(Dev_by_name("d301"), nullptr);
+}
+
+TEST_F(RecordsTest, NewResourceDefaultsAndNumbering) {
+  setenv("DRCTMPDIR", "/scratch/tmp", 1);
+  Dev* dev = Dev_new(nullptr, nullptr, "new_resource", 7);
+  unsetenv("DRCTMPDIR");
+  ASSERT_NE(dev, nullptr);
+  EXPECT_STREQ(dev->name.c_str(), "new_resource_7");
+  EXPECT_EQ(Dev_by_name("new_resource_7"), dev);
+  EXPECT_STREQ(dev->host_name.c_str(), "testhost");
+  EXPECT_STREQ(dev->remote_location.c_str(), "/scratch/tmp");
+  EXPECT_EQ(dev->status, LOCK_SCHEDULE);
+  EXPECT_EQ(dev->max_frames, 4);
+  EXPECT_EQ(dev->num_processors, 0);
+
+  Dev* other = Dev_new(nullptr, nullptr, "new_resourceX", 8);
+  EXPECT_STREQ(other->name.c_str(), "new_resourceX");
+  EXPECT_STREQ(other->remote_location.c_str(), "/usr/tmp");
+  EXPECT_TRUE(Dev_new(nullptr, nullptr, nullptr, 9)->name.none());
+}
+
+TEST_F(RecordsTest, ResourceListAndRename) {
+  Dev* a = Add_a_dev(nullptr, "a", 1);
+  Dev* b = Add_a_dev(nullptr, "b", 2);
+  EXPECT_EQ(Add_a_dev(nullptr, "zz", 1), a);
+  Dev* head = Insert_a_dev(a, nullptr, "head", 3);
+  EXPECT_EQ(dev_order(), (std::vector<int>{3, 1, 2}));
+  expect_links_consistent();
+
+  Dev_set_name(b, "a");  // two resources called a: the first wins
+  EXPECT_EQ(Dev_by_name("a"), a);
+  EXPECT_EQ(Dev_by_name("b"), nullptr);
+  Dev_del(a);
+  EXPECT_EQ(Dev_by_name("a"), b);
+  // A name set behind the table's back is still found.
+  head->name.set("renamed");
+  EXPECT_EQ(Dev_by_name("renamed"), head);
+  EXPECT_EQ(Dev_del(head), b);
+  EXPECT_EQ(rndctl.devs, b);
+}
+
+TEST_F(RecordsTest, PickListsStayMirrored) {
+  Job* job = Job_new(nullptr, nullptr, "job", 1);
+  Job* other = Job_new(nullptr, nullptr, "other", 2);
+  Dev* a = Dev_new(nullptr, nullptr, "a", 1);
+  Dev* b = Dev_new(nullptr, nullptr, "b", 2);
+
+  RndDevList* first = RndDevList_add(job, a);
+  ASSERT_NE(first, nullptr);
+  EXPECT_EQ(RndDevList_add(job, a), first);  // no second entry
+  RndDevList_add(job, b);
+  RndDevList_add(other, a);
+  EXPECT_EQ(first->mirror->mirror, first);
+  EXPECT_EQ(first->mirror->job, job);
+  EXPECT_EQ(ISA_resource_usedby(job, b), 1);
+  EXPECT_EQ(ISA_resource_usedby(other, b), 0);
+
+  EXPECT_EQ(RndDevList_picked(job), nullptr);
+  RndDevList_pick(job, b);
+  EXPECT_EQ(RndDevList_picked(job), b);
+  RndJobList_pick(a, other);
+  EXPECT_EQ(RndJobList_picked(a), other);
+
+  // Removing from the job's side removes the resource's mirror too.
+  EXPECT_EQ(RndDevList_del(job, a), b);
+  EXPECT_EQ(RndDevList_del(job, a), nullptr);
+  ASSERT_NE(a->jobs, nullptr);
+  EXPECT_EQ(a->jobs->job, other);
+  EXPECT_EQ(a->jobs->next, nullptr);
+
+  // Deleting a resource takes it out of every job; deleting a job takes it
+  // out of every resource.
+  RndDevList_add(job, a);
+  Dev_del(a);
+  EXPECT_EQ(ISA_resource_usedby(job, a), 0);
+  EXPECT_EQ(other->resources, nullptr);
+  ASSERT_NE(job->resources, nullptr);
+  EXPECT_EQ(job->resources->dev, b);
+  Job_del(job);
+  EXPECT_EQ(b->jobs, nullptr);
+}
+
+TEST_F(RecordsTest, ManyJobsOnOneResourceKeepOrder) {
+  Dev* host = Dev_new(nullptr, nullptr, "host", 1);
+  for (int i = 1; i <= 2000; i++) RndDevList_add(Job_new(nullptr, nullptr, "j", i), host);
+  // Delete from the middle and the tail, then append again.
+  Job_del(Job_by_index(2000));
+  Job_del(Job_by_index(1000));
+  RndDevList_add(Job_new(nullptr, nullptr, "j", 2001), host);
+  std::vector<int> seen;
+  RndJobList* prev = nullptr;
+  for (RndJobList* e = host->jobs; e != nullptr; prev = e, e = e->next) {
+    ASSERT_EQ(e->prev, prev);
+    seen.push_back(e->job->index);
+  }
+  ASSERT_EQ(seen.size(), 1999u);
+  EXPECT_EQ(seen[998], 999);
+  EXPECT_EQ(seen[999], 1001);
+  EXPECT_EQ(seen.back(), 2001);
+}
+
+TEST_F(RecordsTest, SearchPaths) {
+  Job* job = Job_new(nullptr, nullptr, "job", 1);
+  RndPathList_add(job, "/a");
+  RndPathList_add(job, "/b");
+  RndPathList_add(job, "/a");
+  RndPathList_del(job, "/a");  // the first of the two
+  ASSERT_NE(job->searchpath, nullptr);
+  EXPECT_STREQ(job->searchpath->path.c_str(), "/b");
+  EXPECT_STREQ(job->searchpath->next->path.c_str(), "/a");
+  RndPathList_del(job, "/missing");
+  EXPECT_NE(job->searchpath->next, nullptr);
+}
+
+struct StateWord {
+  const char* word;
+  int run;
+  int lock;
+};
+
+void PrintTo(const StateWord& w, std::ostream* os) {
+  *os << (w.word != nullptr ? w.word : "(none)");
+}
+
+class StateWords : public testing::TestWithParam<StateWord> {};
+
+TEST_P(StateWords, DecodeCaseSensitively) {
+  EXPECT_EQ(Job_get_runstate(GetParam().word), GetParam().run);
+  EXPECT_EQ(Dev_get_lockstate(GetParam().word), GetParam().lock);
+}
+
+INSTANTIATE_TEST_SUITE_P(Words, StateWords,
+                         testing::Values(StateWord{nullptr, 0, 0}, StateWord{"", 0, 0},
+                                         StateWord{"PAUSED", 1, 0}, StateWord{"paused", 0, 0},
+                                         StateWord{"AVAILABLE", 2, 2}, StateWord{"SCHEDULE", 3, 3},
+                                         StateWord{"NOW", 4, 0}, StateWord{"LOCKED", 0, 1},
+                                         StateWord{"Locked", 0, 0}, StateWord{"NOW ", 0, 0}));
+
+TEST_F(RecordsTest, CurrentRecordHoldsTheLockAndCloneCopies) {
+  Job* job = Job_new(nullptr, nullptr, "shot", 5);
+  Job* next = Job_new(nullptr, nullptr, "next", 6);
+  setcurrent_job(job);
+  EXPECT_EQ(rndctl.current_job, job);
+  EXPECT_EQ(job->lock_pid, rndctl.pid);
+  setcurrent_job(next);
+  EXPECT_EQ(job->lock_pid, 0);
+  EXPECT_EQ(next->lock_pid, rndctl.pid);
+  Job_del(next);
+  EXPECT_EQ(rndctl.current_job, nullptr);
+
+  Dev* dev = Dev_new(nullptr, nullptr, "host", 1);
+  RndDevList_add(job, dev);
+  RndPathList_add(job, "/maps");
+  job->runs[40] = 1;
+  Job* clone = Job_clone(job);
+  ASSERT_NE(clone, nullptr);
+  EXPECT_STREQ(clone->name.c_str(), "shot.clone");
+  EXPECT_NE(clone->index, job->index);
+  EXPECT_EQ(clone->runs[40], 1);
+  EXPECT_EQ(ISA_resource_usedby(clone, dev), 1);
+  ASSERT_NE(clone->searchpath, nullptr);
+  EXPECT_NE(clone->searchpath, job->searchpath);
+  EXPECT_EQ(rndctl.jobs->next, clone);
+}
+
+TEST_F(RecordsTest, AutoAddResourcesAreClearedInTurn) {
+  Dev* a = Dev_new(nullptr, nullptr, "a", 1);
+  Dev* b = Dev_new(nullptr, nullptr, "b", 2);
+  a->default_dev = b->default_dev = 1;
+  reset_autoadd_dev();
+  EXPECT_EQ(a->default_dev, 0);
+  EXPECT_EQ(b->default_dev, 0);
+  EXPECT_EQ(rndctl.current_dev, b);
+}

@@ -1,0 +1,265 @@
+// Week grids: filling them from entries, taking blocks back out, and the
+// checks against a clock that the tests set.
+#include <cstdlib>
+#include <ctime>
+#include <ostream>
+#include <string>
+#include <vector>
+
+#include "tests/support/test_support.h"
+
+namespace {
+
+time_t fake_now = 0;
+time_t fake_clock() { return fake_now; }
+
+// 2024-01-07 was a Sunday.
+time_t week_time(int day, int hour, int minute) {
+  return 1704585600 + day * 86400 + hour * 3600 + minute * 60;
+}
+
+class ScheduleTest : public ControlDirTest {
+ protected:
+  void SetUp() override {
+    ControlDirTest::SetUp();
+    setenv("TZ", "UTC", 1);
+    tzset();
+    rj_clock = fake_clock;
+  }
+  void at(int day, int hour, int minute) { fake_now = week_time(day, hour, minute); }
+};
+
+struct Entry {
+  int start, end;
+  const char* first;
+  const char* last;
+};
+
+// What the writer would print for a grid: the blocks in order.
+std::vector<std::string> blocks_of(const int* grid) {
+  int scratch[RJ_WEEK_SCAN];
+  std::copy(grid, grid + RJ_WEEK_SCAN, scratch);
+  std::vector<std::string> out;
+  int times[2];
+  const char* days[2];
+  while (Schedule_get_a_block(scratch, times, days) != 0) {
+    char text[80];
+    if (std::string(days[0]) != days[1])
+      snprintf(text, sizeof text, "{ %d to %d %s to %s }", times[0], times[1], days[0], days[1]);
+    else
+      snprintf(text, sizeof text, "{ %d to %d %s }", times[0], times[1], days[0]);
+    out.push_back(text);
+  }
+  return out;
+}
+
+int count_set(const int* grid) {
+  int n = 0;
+  for (int i = 0; i < RJ_WEEK_SCAN; i++) n += grid[i] != 0;
+  return n;
+}
+
+struct BlockCase {
+  const char* what;
+  std::vector<Entry> entries;
+  int slots_set;
+  std::vector<std::string> blocks;
+};
+
+void PrintTo(const BlockCase& c, std::ostream* os) { *os << c.what; }
+
+class BlockRoundTrip : public testing::TestWithParam<BlockCase> {};
+
+}  // namespace
+
+TEST_P(BlockRoundTrip, EntriesComeBackAsBlocks) {
+  Dev dev;
+  Job job;
+  for (const Entry& e : GetParam().entries) {
+    // The parser keeps only entries whose day words are days.
+    const char* first = Schedule_get_day(e.first);
+    const char* last = Schedule_get_day(e.last);
+    if (first == nullptr || last == nullptr) continue;
+    Schedule_dev_lock(&dev, e.start, e.end, first, last);
+    Schedule_job_runs(&job, e.start, e.end, first, last);
+  }
+  EXPECT_EQ(count_set(dev.locks), GetParam().slots_set);
+  EXPECT_EQ(dev.locks[RJ_WEEK], 0);
+  EXPECT_EQ(blocks_of(dev.locks), GetParam().blocks);
+  EXPECT_EQ(blocks_of(job.runs), GetParam().blocks);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Entries, BlockRoundTrip,
+    testing::Values(
+        BlockCase{"whole_week",
+                  {{0, 2400, "Sunday", "Saturday"}},
+                  336,
+                  {"{ 0 to 2400 Sunday to Saturday }"}},
+        BlockCase{"half_hours", {{800, 1745, "Monday", "Monday"}}, 19, {"{ 800 to 1730 Monday }"}},
+        BlockCase{"same_slot", {{830, 831, "Monday", "Monday"}}, 0, {}},
+        BlockCase{"over_midnight", {{2200, 600, "Monday", "Monday"}}, 0, {}},
+        BlockCase{"over_week_end", {{900, 1700, "Friday", "Monday"}}, 0, {}},
+        BlockCase{
+            "any_form", {{900, 1700, "mon", "Fri"}}, 80, {"{ 900 to 1700 Monday to Friday }"}},
+        BlockCase{"not_a_day", {{900, 1700, "MON", "MON"}, {900, 1700, "Sund", "Sund"}}, 0, {}},
+        BlockCase{"two_blocks",
+                  {{800, 1200, "monday", "friday"}, {1300, 1700, "monday", "monday"}},
+                  48,
+                  {"{ 800 to 1200 Monday to Friday }", "{ 1300 to 1700 Monday }"}},
+        BlockCase{"into_next_day",
+                  {{2300, 2500, "saturday", "saturday"}},
+                  2,
+                  {"{ 2300 to 2400 Saturday }"}},
+        BlockCase{"first_half_hour", {{0, 30, "sunday", "sunday"}}, 1, {"{ 0 to 30 Sunday }"}}),
+    [](const testing::TestParamInfo<BlockCase>& info) { return std::string(info.param.what); });
+
+TEST(ScheduleTables, DayNamesAndSlotLabels) {
+  EXPECT_STREQ(Schedule_get_day("Wed"), "wednesday");
+  EXPECT_STREQ(Schedule_get_day("thu"), "thursday");
+  EXPECT_EQ(Schedule_get_day("SUN"), nullptr);
+  EXPECT_EQ(Schedule_get_day(nullptr), nullptr);
+  EXPECT_EQ(get_abbreviated_day_index("Sat"), 6);
+  EXPECT_EQ(get_abbreviated_day_index(""), 0);
+  EXPECT_EQ(get_abbreviated_day_index("sat"), -1);
+  EXPECT_STREQ(time_table[0], "Midnight");
+  EXPECT_STREQ(time_table[1], "0:30");
+  EXPECT_STREQ(time_table[23], "11:30");
+  EXPECT_STREQ(time_table[24], "Noon");
+  EXPECT_STREQ(time_table[25], "12:30");
+  EXPECT_STREQ(time_table[47], "23:30");
+}
+
+TEST(ScheduleGrid, RectangleFillAndClear) {
+  int grid[RJ_WEEK_SCAN] = {};
+  const int a[2] = {20, 3};  // Wednesday 10:00
+  const int b[2] = {18, 1};  // Monday 9:00
+  EXPECT_EQ(set_in_betweens(grid, a, b, 1), 1);
+  EXPECT_EQ(count_set(grid), 9);
+  EXPECT_EQ(grid[1 * 48 + 18], 1);
+  EXPECT_EQ(grid[3 * 48 + 20], 1);
+  EXPECT_EQ(set_in_betweens(grid, a, b, 1), 0);  // nothing new
+  EXPECT_EQ(set_in_betweens(grid, a, a, 7), 0);  // not a mode
+  EXPECT_EQ(set_in_betweens(grid, b, b, -1), 1);
+  EXPECT_EQ(count_set(grid), 8);
+}
+
+TEST_F(ScheduleTest, ClockPosition) {
+  at(1, 8, 45);
+  EXPECT_EQ(get_current_schedule_index(), 65);
+  EXPECT_FLOAT_EQ(last_float_time_index, 65.5f);
+  at(6, 23, 59);
+  EXPECT_EQ(get_current_schedule_index(), 335);
+  at(0, 0, 0);
+  EXPECT_EQ(get_current_schedule_index(), 0);
+  EXPECT_FLOAT_EQ(last_float_time_index, 0.0f);
+}
+
+TEST_F(ScheduleTest, JobRunStates) {
+  Job* job = Job_new(nullptr, nullptr, "j", 1);
+  Schedule_job_runs(job, 800, 1200, "monday", "monday");
+  at(1, 9, 0);
+  const int expected[] = {0, 1, 2, 2, 2};  // unset, paused, available, schedule (in), now
+  for (int state = RUN_UNSET; state <= RUN_NOW; state++) {
+    job->ctrl = state;
+    EXPECT_EQ(Job_available(job), expected[state]) << state;
+  }
+  job->ctrl = RUN_SCHEDULE;
+  at(1, 12, 0);
+  EXPECT_EQ(Job_schedule_check(job), 0);
+  job->ctrl = 9;
+  EXPECT_EQ(Job_schedule_check(job), 0);
+}
+
+TEST_F(ScheduleTest, SaturdayNightLockWakesAtTheWeekBoundary) {
+  Dev* dev = Dev_new(nullptr, nullptr, "night", 1);
+  Schedule_dev_lock(dev, 2200, 2400, "saturday", "saturday");
+  Schedule_dev_lock(dev, 0, 600, "sunday", "sunday");
+  dev->status = LOCK_SCHEDULE;
+
+  at(6, 23, 10);
+  int now = Dev_schedule_check("testhost");
+  EXPECT_EQ(now, 334);
+  // 50 minutes to the end of the week, less the float rounding of 23:10.
+  EXPECT_EQ(get_next_available_time("testhost", now), 2999);
+
+  at(0, 0, 0);
+  now = Dev_schedule_check("testhost");
+  EXPECT_EQ(now, 0);
+  EXPECT_EQ(get_next_available_time("testhost", now), 6 * 3600);
+
+  at(0, 6, 0);
+  EXPECT_EQ(Dev_schedule_check("testhost"), -1);
+  EXPECT_EQ(Dev_schedule_check("otherhost"), -1);
+}
+
+TEST_F(ScheduleTest, LockedStateSleepsToTheNextHalfHour) {
+  Dev* dev = Dev_new(nullptr, nullptr, "locked", 1);
+  dev->status = LOCK_LOCKED;
+  at(2, 14, 0);
+  int now = Dev_schedule_check("testhost");
+  EXPECT_EQ(now, 2 * 48 + 28);
+  EXPECT_EQ(get_next_available_time("testhost", now), 1800);
+
+  // An available resource is never locked, whatever its grid says.
+  dev->status = LOCK_AVAILABLE;
+  Schedule_dev_lock(dev, 0, 2400, "sunday", "saturday");
+  EXPECT_EQ(Dev_schedule_check("testhost"), -1);
+}
+
+TEST_F(ScheduleTest, LockedAllWeekHasNoWakeUp) {
+  Dev* dev = Dev_new(nullptr, nullptr, "always", 1);
+  Schedule_dev_lock(dev, 0, 2400, "sunday", "saturday");
+  at(3, 10, 0);
+  int now = Dev_schedule_check("testhost");
+  ASSERT_GE(now, 0);
+  // The week's-end position is clear, so even a full grid wakes there...
+  EXPECT_EQ(get_next_available_time("testhost", now), (336 - now) * 1800);
+}
+
+TEST_F(ScheduleTest, JobRunBlockEnd) {
+  Job* job = Job_new(nullptr, nullptr, "j", 1);
+  Schedule_job_runs(job, 800, 1200, "monday", "monday");
+  at(1, 9, 0);
+  int now = get_current_schedule_index();
+  EXPECT_EQ(job_get_next_available_time(job, now), 3 * 3600);
+  at(1, 11, 30);
+  now = get_current_schedule_index();
+  EXPECT_EQ(job_get_next_available_time(job, now), 1800);
+}
+
+TEST_F(ScheduleTest, TwoResourcesForOneHost) {
+  Dev* a = Dev_new(nullptr, nullptr, "A", 1);
+  Dev* b = Dev_new(nullptr, nullptr, "B", 2);
+  Schedule_dev_lock(a, 800, 1200, "monday", "monday");
+  Schedule_dev_lock(b, 1200, 1400, "monday", "monday");
+
+  at(1, 9, 0);
+  int now = Dev_schedule_check("testhost");
+  EXPECT_EQ(now, 66);
+  EXPECT_EQ(get_next_available_time("testhost", now), 5 * 3600);
+
+  // With B first, the scan stops at B's clear slot before A is looked at,
+  // and stops short at noon; the check at noon finds B locked.
+  Dev_del(b);
+  b = Insert_a_dev(a, nullptr, "B", 2);
+  Schedule_dev_lock(b, 1200, 1400, "monday", "monday");
+  now = Dev_schedule_check("testhost");
+  EXPECT_EQ(get_next_available_time("testhost", now), 3 * 3600);
+  at(1, 12, 0);
+  now = Dev_schedule_check("testhost");
+  EXPECT_EQ(now, 72);
+  EXPECT_EQ(get_next_available_time("testhost", now), 2 * 3600);
+}
+
+TEST_F(ScheduleTest, UnknownWeekdayNameCountsAsUnlocked) {
+  Dev* dev = Dev_new(nullptr, nullptr, "d", 1);
+  Schedule_dev_lock(dev, 0, 2400, "sunday", "saturday");
+  at(1, 9, 0);
+  last_float_time_index = 12.0f;
+  // A clock beyond what localtime can express gives no weekday.
+  fake_now = static_cast<time_t>(1) << 62;
+  EXPECT_EQ(get_current_schedule_index(), -1);
+  EXPECT_FLOAT_EQ(last_float_time_index, 12.0f);
+  EXPECT_EQ(Dev_schedule_check("testhost"), -1);
+}
