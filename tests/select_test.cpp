@@ -1,0 +1,412 @@
+// Choosing, cutting and putting back tasks, against real task files.  A
+// second host is simulated by a resource whose host name is another host's.
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <climits>
+#include <cstdio>
+#include <cstdlib>
+#include <ctime>
+#include <initializer_list>
+#include <string>
+#include <vector>
+
+#include "tests/support/test_support.h"
+
+namespace {
+
+// Monday 2024-01-01 09:00 UTC.
+time_t monday_0900() { return 1704099600; }
+
+std::string group_line(const std::string& name, int index, int numrecs, int next_id) {
+  char b[256];
+  snprintf(b, sizeof b, "\t %d\t %d\t %d\n", index, numrecs, next_id);
+  return "\n" + name + b;
+}
+
+std::string rec_line(int id, float start, float end, float current, int dev, int retries,
+                     const std::string& status) {
+  char b[512];
+  snprintf(b, sizeof b, "\t%d\t %f\t %f\t %f  %d\t %d\t", id, start, end, current, dev, retries);
+  return b + status + "\n";
+}
+
+class SelectTest : public ControlDirTest {
+ protected:
+  void SetUp() override {
+    ControlDirTest::SetUp();
+    setenv("TZ", "UTC", 1);
+    tzset();
+    saved_clock_ = rj_clock;
+    rj_clock = monday_0900;
+    setenv("DRCTMPDIR", dir_.c_str(), 1);
+    here_ = Add_a_dev(nullptr, "render1", 1);
+    there_ = Add_a_dev(nullptr, "render2", 2);
+    ASSERT_NE(here_, nullptr);
+    ASSERT_NE(there_, nullptr);
+    here_->host_name.set("testhost");
+    there_->host_name.set("otherhost");
+    here_->max_frames = 3;
+    here_->num_processors = 4;
+  }
+  void TearDown() override {
+    alarm(0);
+    rj_clock = saved_clock_;
+    unsetenv("DRCTMPDIR");
+    ControlDirTest::TearDown();
+  }
+
+  /// A pending, animated job over frames 1..10 by 1 that the given hosts may render.
+  Job* make_job(int index, const char* name, int priority, std::initializer_list<Dev*> hosts) {
+    Job* job = Add_a_job(nullptr, name, index);
+    EXPECT_NE(job, nullptr);
+    job->status.set("pending");
+    job->priority = priority;
+    job->animate = 1;
+    job->frames[0] = 1;
+    job->frames[1] = 10;
+    job->frames[2] = 1;
+    for (Dev* d : hosts) RndDevList_add(job, d);
+    return job;
+  }
+
+  std::string tasks() const { return read_file("Render_Tasks"); }
+
+  static int count_entries() {
+    int n = 0;
+    for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) ++n;
+    return n;
+  }
+
+  static TASK* entry_of(Job* job, int id) {
+    for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
+      if (e->job == job && e->rec != nullptr && e->rec->id == id) return e;
+    }
+    return nullptr;
+  }
+
+  time_t (*saved_clock_)() = nullptr;
+  Dev* here_ = nullptr;
+  Dev* there_ = nullptr;
+};
+
+// --- Cutting a host-sized piece ---------------------------------------------
+
+struct CutCase {
+  const char* label;
+  int max_frames;
+  float start, end, by;
+  int animate;
+  std::string file;
+  int max_frames_after;
+};
+void PrintTo(const CutCase& c, std::ostream* os) { *os << c.label; }
+
+class Cutting : public SelectTest, public testing::WithParamInterface<CutCase> {};
+
+TEST_P(Cutting, FirstPickCutsTheHostsShareOffTheJob) {
+  const CutCase& c = GetParam();
+  here_->max_frames = c.max_frames;
+  Job* job = make_job(1, "scene.sdl", 0, {here_});
+  job->frames[0] = c.start;
+  job->frames[1] = c.end;
+  job->frames[2] = c.by;
+  job->animate = c.animate;
+
+  TASK* picked = Task_get();
+  ASSERT_NE(picked, nullptr);
+  EXPECT_EQ(picked->job, job);
+  EXPECT_EQ(picked->rec->status, TASK_STARTED);
+  EXPECT_EQ(picked->rec->dev, here_);
+  EXPECT_EQ(tasks(), c.file);
+  EXPECT_EQ(here_->max_frames, c.max_frames_after);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Ranges, Cutting,
+    testing::Values(
+        CutCase{"three_of_ten", 3, 1, 10, 1, 1,
+                group_line("scene.sdl", 1, 2, 2) + rec_line(0, 1, 3, 1, 1, 0, "STARTED") +
+                    rec_line(1, 4, 10, 4, 0, 0, "PENDING"),
+                3},
+        CutCase{"zero_means_one", 0, 1, 10, 1, 1,
+                group_line("scene.sdl", 1, 2, 2) + rec_line(0, 1, 1, 1, 1, 0, "STARTED") +
+                    rec_line(1, 2, 10, 2, 0, 0, "PENDING"),
+                1},
+        CutCase{"by_two", 3, 1, 10, 2, 1,
+                group_line("scene.sdl", 1, 2, 2) + rec_line(0, 1, 5, 1, 1, 0, "STARTED") +
+                    rec_line(1, 7, 10, 7, 0, 0, "PENDING"),
+                3},
+        CutCase{"fewer_steps_than_max", 3, 1, 3, 1, 1,
+                group_line("scene.sdl", 1, 1, 1) + rec_line(0, 1, 3, 1, 1, 0, "STARTED"), 3},
+        CutCase{"still_image_never_cut", 3, 1, 10, 1, 0,
+                group_line("scene.sdl", 1, 1, 1) + rec_line(0, 1, 10, 1, 1, 0, "STARTED"), 3},
+        CutCase{"zero_step_never_cut", 3, 1, 10, 0, 1,
+                group_line("scene.sdl", 1, 1, 1) + rec_line(0, 1, 10, 1, 1, 0, "STARTED"), 3}),
+    [](const testing::TestParamInfo<CutCase>& info) { return std::string(info.param.label); });
+
+TEST_F(SelectTest, EachTaskOnTheHostTakesAProcessSlot) {
+  here_->num_processors = 2;
+  Job* job = make_job(1, "scene.sdl", 0, {here_});
+  TASK* first = Task_get();
+  ASSERT_NE(first, nullptr);
+  // The job is being worked on here: only the last mode takes more of it.
+  TASK* second = Task_get();
+  ASSERT_NE(second, nullptr);
+  EXPECT_FLOAT_EQ(second->rec->start, 4);
+  EXPECT_FLOAT_EQ(second->rec->end, 6);
+  // Two tasks of one job fill both processors: nothing more.
+  EXPECT_EQ(Task_get(), nullptr);
+  EXPECT_EQ(Dev_processes_available(here_), 0);
+  EXPECT_EQ(tasks(), group_line("scene.sdl", 1, 3, 3) + rec_line(0, 1, 3, 1, 1, 0, "STARTED") +
+                         rec_line(1, 4, 6, 4, 1, 0, "STARTED") +
+                         rec_line(2, 7, 10, 7, 0, 0, "PENDING"));
+  // The running-task list mirrors the file.
+  EXPECT_EQ(count_entries(), 3);
+  EXPECT_EQ(entry_of(job, 0), first);
+  EXPECT_EQ(entry_of(job, 1), second);
+  ASSERT_NE(entry_of(job, 2), nullptr);
+  EXPECT_EQ(entry_of(job, 2)->rec->status, TASK_PENDING);
+
+  // A host that never set its processors runs one task.
+  there_->num_processors = 0;
+  EXPECT_EQ(Dev_processes_available(there_), 1);
+  EXPECT_EQ(there_->num_processors, 1);
+}
+
+// --- Which job ---------------------------------------------------------------
+
+struct PriorityCase {
+  const char* label;
+  int running;
+  // One job each, in job list order.  Their first tasks go on the front of
+  // the task groups, so the groups run the other way: "first" below means
+  // last in this list.
+  std::vector<int> priorities;
+  int chosen;  // position in this list, -1 for none
+};
+void PrintTo(const PriorityCase& c, std::ostream* os) { *os << c.label; }
+
+class Priority : public SelectTest, public testing::WithParamInterface<PriorityCase> {};
+
+TEST_P(Priority, ChoosesTheJob) {
+  const PriorityCase& c = GetParam();
+  std::vector<Job*> jobs;
+  for (size_t i = 0; i < c.priorities.size(); ++i) {
+    std::string name = "job" + std::to_string(i) + ".sdl";
+    jobs.push_back(make_job(static_cast<int>(i) + 1, name.c_str(), c.priorities[i], {here_}));
+  }
+  rndctl.running = c.running;
+  TASK* picked = Task_get();
+  if (c.chosen < 0) {
+    EXPECT_EQ(picked, nullptr);
+    // The jobs' first tasks are in the file all the same, waiting.
+    EXPECT_EQ(count_entries(), static_cast<int>(jobs.size()));
+  } else {
+    ASSERT_NE(picked, nullptr);
+    EXPECT_EQ(picked->job, jobs[static_cast<size_t>(c.chosen)]);
+  }
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Jobs, Priority,
+    testing::Values(PriorityCase{"lowest_number_wins", 0, {5, 1, 3}, 1},
+                    PriorityCase{"tie_goes_to_the_first", 0, {2, 2}, 1},
+                    PriorityCase{"busy_host_takes_priority_0_only", 1, {0, 0, 1}, 1},
+                    PriorityCase{"busy_host_leaves_the_rest", 1, {1, 2}, -1}),
+    [](const testing::TestParamInfo<PriorityCase>& info) { return std::string(info.param.label); });
+
+TEST_F(SelectTest, JobsThisHostMayNotRenderAreLeftAlone) {
+  make_job(1, "elsewhere.sdl", 0, {there_});
+  Job* nohosts = make_job(2, "nohosts.sdl", 0, {});
+  Job* done = make_job(3, "done.sdl", 0, {here_});
+  done->status.set("finished");
+  EXPECT_EQ(Task_get(), nullptr);
+  // The other host's job gets its first task for that host to take.
+  EXPECT_EQ(tasks(), group_line("elsewhere.sdl", 1, 1, 1) + rec_line(0, 1, 10, 1, 0, 0, "PENDING"));
+  EXPECT_EQ(isa_job_using_host("testhost", nohosts), 0);
+}
+
+// --- Failed tasks -------------------------------------------------------------
+
+struct FailCase {
+  const char* label;
+  float current;
+  int retries;
+  std::string file;
+  int entries;
+  int status;  // of the failed task's entry afterwards
+};
+void PrintTo(const FailCase& c, std::ostream* os) { *os << c.label; }
+
+class PutBack : public SelectTest, public testing::WithParamInterface<FailCase> {};
+
+TEST_P(PutBack, FailedTaskGoesBackOrIsCutWhereItStopped) {
+  const FailCase& c = GetParam();
+  here_->max_frames = 100;
+  Job* job = make_job(1, "scene.sdl", 0, {here_, there_});
+  TASK* failed = Task_get();
+  ASSERT_NE(failed, nullptr);
+  failed->rec->status = TASK_FAILED;
+  failed->rec->current = c.current;
+  failed->rec->retries = c.retries;
+
+  EXPECT_EQ(Split_first_splittable_failed_tasks(), nullptr);
+  EXPECT_EQ(tasks(), c.file);
+  EXPECT_EQ(count_entries(), c.entries);
+  EXPECT_EQ(failed->rec->status, c.status);
+  if (c.entries == 2) {
+    TASK* rest = entry_of(job, 1);
+    ASSERT_NE(rest, nullptr);
+    EXPECT_EQ(rest->rec->status, TASK_PENDING);
+    EXPECT_EQ(rest->rec->keep, 0);
+    // The remainder is a fresh task: any host, this one included, takes it.
+    TASK* again = Task_get();
+    ASSERT_NE(again, nullptr);
+    EXPECT_EQ(again, rest);
+  }
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Failures, PutBack,
+    testing::Values(
+        FailCase{"after_progress", 5, 0,
+                 group_line("scene.sdl", 1, 2, 2) + rec_line(0, 1, 4, 4, 1, 1, "FINISHED") +
+                     rec_line(1, 5, 10, 5, 0, 0, "PENDING"),
+                 2, TASK_FINISHED},
+        FailCase{"no_progress", 1, 0,
+                 group_line("scene.sdl", 1, 1, 1) + rec_line(0, 1, 10, 1, 1, 1, "PENDING"), 1,
+                 TASK_PENDING},
+        FailCase{"tenth_failure", 5, 10,
+                 group_line("scene.sdl", 1, 1, 1) + rec_line(0, 1, 10, 1, 1, 0, "STARTED"), 1,
+                 TASK_FAILED}),
+    [](const testing::TestParamInfo<FailCase>& info) { return std::string(info.param.label); });
+
+struct RetryCase {
+  const char* label;
+  int failed_on;  // resource index the task failed on
+  bool other_host_listed;
+  bool taken;
+};
+void PrintTo(const RetryCase& c, std::ostream* os) { *os << c.label; }
+
+class Retry : public SelectTest, public testing::WithParamInterface<RetryCase> {};
+
+TEST_P(Retry, TaskThatFailedHereWaitsOnlyWhenAnotherHostCanTakeIt) {
+  const RetryCase& c = GetParam();
+  Job* job = c.other_host_listed ? make_job(1, "scene.sdl", 0, {here_, there_})
+                                 : make_job(1, "scene.sdl", 0, {here_});
+  job->status.set("started");
+  write_file("Render_Tasks",
+             group_line("scene.sdl", 1, 1, 1) + rec_line(0, 1, 3, 1, c.failed_on, 2, "PENDING"));
+  TASK* picked = Task_get();
+  EXPECT_EQ(picked != nullptr, c.taken);
+  EXPECT_EQ(tasks(),
+            group_line("scene.sdl", 1, 1, 1) + rec_line(0, 1, 3, 1, c.taken ? 1 : c.failed_on, 2,
+                                                        c.taken ? "STARTED" : "PENDING"));
+}
+
+INSTANTIATE_TEST_SUITE_P(Hosts, Retry,
+                         testing::Values(RetryCase{"failed_here_other_host_waits", 1, true, false},
+                                         RetryCase{"failed_here_only_host_retries", 1, false, true},
+                                         RetryCase{"failed_elsewhere", 2, true, true}),
+                         [](const testing::TestParamInfo<RetryCase>& info) {
+                           return std::string(info.param.label);
+                         });
+
+// --- The mirror of the file -------------------------------------------------------
+
+TEST_F(SelectTest, EntriesFollowTheFileAndThisHostKeepsItsOwnStatus) {
+  Job* job = make_job(1, "scene.sdl", 0, {here_, there_});
+  job->status.set("started");
+  write_file("Render_Tasks", group_line("scene.sdl", 1, 2, 2) +
+                                 rec_line(0, 1, 3, 1, 2, 0, "STARTED") +
+                                 rec_line(1, 4, 10, 4, 0, 0, "PENDING"));
+  TASK* mine = Task_get();
+  ASSERT_NE(mine, nullptr);
+  EXPECT_EQ(mine->rec->id, 1);
+  TASK* theirs = entry_of(job, 0);
+  ASSERT_NE(theirs, nullptr);
+  EXPECT_EQ(theirs->rec->dev, there_);
+
+  // Meanwhile: the other host finished, this one got its process going.
+  mine->rec->status = TASK_RUNNING;
+  write_file("Render_Tasks",
+             group_line("scene.sdl", 1, 3, 3) + rec_line(0, 1, 3, 3, 2, 0, "FINISHED") +
+                 rec_line(1, 4, 6, 4, 1, 0, "STARTED") + rec_line(2, 7, 10, 7, 0, 0, "PENDING"));
+  rndctl.running = 1;  // only priority 0 jobs, as this one is
+  TASK* next = Task_get();
+  ASSERT_NE(next, nullptr);
+  EXPECT_EQ(next->rec->id, 2);
+  EXPECT_EQ(entry_of(job, 0), theirs);
+  EXPECT_EQ(theirs->rec->status, TASK_FINISHED);
+  EXPECT_FLOAT_EQ(theirs->rec->current, 3);
+  EXPECT_EQ(tasks(), group_line("scene.sdl", 1, 4, 4) + rec_line(0, 1, 3, 3, 2, 0, "FINISHED") +
+                         rec_line(1, 4, 6, 4, 1, 0, "RUNNING") +
+                         rec_line(2, 7, 9, 7, 1, 0, "STARTED") +
+                         rec_line(3, 10, 10, 10, 0, 0, "PENDING"));
+
+  // The job's group leaves the file: its entries go too.
+  write_file("Render_Tasks", "");
+  EXPECT_EQ(Task_get(), nullptr);
+  EXPECT_EQ(rndctl.tasks, nullptr);
+}
+
+// --- The service loop's call -------------------------------------------------------
+
+struct LockCase {
+  const char* label;
+  int lock_state;
+  int lock_from, lock_to;  // Monday, HHMM; 0, 0 for none
+  unsigned seconds;
+};
+void PrintTo(const LockCase& c, std::ostream* os) { *os << c.label; }
+
+class HostLock : public SelectTest, public testing::WithParamInterface<LockCase> {};
+
+TEST_P(HostLock, LockedHostPicksNothingAndSleepsUntilTheLockEnds) {
+  const LockCase& c = GetParam();
+  make_job(1, "scene.sdl", 0, {here_});
+  here_->status = c.lock_state;
+  if (c.lock_to != 0) Schedule_dev_lock(here_, c.lock_from, c.lock_to, "Monday", "Monday");
+  alarm(0);
+  EXPECT_EQ(GetaPendingTask(), nullptr);
+  unsigned left = alarm(0);
+  EXPECT_LE(left, c.seconds);
+  EXPECT_GE(left + 2, c.seconds);
+  EXPECT_EQ(tasks(), "");
+  EXPECT_EQ(rndctl.tasks, nullptr);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Locks, HostLock,
+    testing::Values(LockCase{"locked_state_half_hour", LOCK_LOCKED, 0, 0, 1800},
+                    LockCase{"schedule_until_noon", LOCK_SCHEDULE, 800, 1200, 3 * 3600}),
+    [](const testing::TestParamInfo<LockCase>& info) { return std::string(info.param.label); });
+
+TEST_F(SelectTest, PickedTaskGetsAnEmptyStreamFileThatALinkCannotRedirect) {
+  here_->num_processors = 3;
+  make_job(1, "scene.sdl", 0, {here_});
+  write_file("scene.sdl.render1.0", "old output");
+  TASK* first = GetaPendingTask();
+  ASSERT_NE(first, nullptr);
+  EXPECT_EQ(std::string(first->stream_path.c_str()), path("scene.sdl.render1.0"));
+  ASSERT_NE(first->stream, nullptr);
+  EXPECT_EQ(read_file("scene.sdl.render1.0"), "");
+  EXPECT_EQ(rndctl.stream_counter, 1);
+
+  write_file("victim", "keep");
+  ASSERT_EQ(symlink(path("victim").c_str(), path("scene.sdl.render1.1").c_str()), 0);
+  TASK* second = GetaPendingTask();
+  ASSERT_NE(second, nullptr);
+  EXPECT_EQ(second->stream, nullptr);
+  EXPECT_EQ(read_file("victim"), "keep");
+
+  rndctl.stream_counter = INT_MAX;
+  TASK* third = GetaPendingTask();
+  ASSERT_NE(third, nullptr);
+  EXPECT_EQ(rndctl.stream_counter, 0);
+  EXPECT_NE(third->stream, nullptr);
+}
+
+}  // namespace
