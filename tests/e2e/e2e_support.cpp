@@ -167,7 +167,8 @@ bool wait_for(const std::function<bool()>& done, double seconds, Daemon* wake) {
   int round = 0;
   while (std::chrono::steady_clock::now() < deadline) {
     if (done()) return true;
-    if (wake != nullptr && ++round % 25 == 0) wake->wake();
+    // Before its loop a daemon would die of SIGALRM: wake it only from then on.
+    if (wake != nullptr && ++round % 25 == 0 && wake->in_loop()) wake->wake();
     std::this_thread::sleep_for(std::chrono::milliseconds(10));
   }
   return done();
