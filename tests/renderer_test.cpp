@@ -234,6 +234,30 @@ INSTANTIATE_TEST_SUITE_P(
                    {"ball.01", "ball.02", "ball.03", "ball.04", "ball.05", "ball.06", "ball.07",
                     "ball.08", "ball.09", "ball.10"}}));
 
+// The daemon counts a task's frames with its own arithmetic and judges
+// progress by it; the renderer must paint exactly that many.
+class RendererFrameCount : public RendererTest,
+                           public ::testing::WithParamInterface<std::vector<float>> {};
+
+TEST_P(RendererFrameCount, AgreesWithTheQueue) {
+  const std::vector<float>& r = GetParam();
+  auto text = [](float v) {
+    char buf[32];
+    snprintf(buf, sizeof buf, "%f", v);
+    return std::string(buf);
+  };
+  Outcome out = render({"-p", "pix/ball", "-s", text(r[0]), "-e", text(r[1]), "-b", text(r[2]),
+                        "-S", "1", "-B", "1", "-E", "3", "size=2x2", "sdl/scene.sdl"});
+  ASSERT_TRUE(exited_with(out, 0)) << out.err;
+  EXPECT_EQ(static_cast<int>(pix_files().size()), Calc_frame_range(r[0], r[1], r[2]));
+}
+
+INSTANTIATE_TEST_SUITE_P(Ranges, RendererFrameCount,
+                         testing::Values(std::vector<float>{1, 10, 0.1f},
+                                         std::vector<float>{0, 1, 0.3f},
+                                         std::vector<float>{1.5f, 4.5f, 0.75f},
+                                         std::vector<float>{1, 100, 7}));
+
 TEST_F(RendererTest, StillSceneWritesThePixPathItself) {
   ASSERT_TRUE(write_text_file(project_ + "/sdl/still.sdl", "animation = OFF;\nsize = 8x6;\n"));
   Outcome r = render({"-p", "pix/still", "sdl/still.sdl"});
