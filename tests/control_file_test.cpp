@@ -5,6 +5,7 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <cfloat>
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
@@ -176,6 +177,48 @@ TEST_F(ControlFileTest, NumbersAndWordsSplitByLongestMatch) {
   EXPECT_EQ(job->lock_pid, 0);
   EXPECT_EQ(job->doneframes, 7);
 }
+
+// Reals are read exactly as the C library reads them, then narrowed; huge
+// ones stop at the largest float so that the writer never prints "inf".
+class RealTextTest : public ControlFileTest, public testing::WithParamInterface<const char*> {};
+
+TEST_P(RealTextTest, ReadsAsStrtod) {
+  const std::string real = GetParam();
+  ASSERT_EQ(parse("RenderJobControl 1 1\nr.sdl 4 {\n\tframes = " + real + ", 1, 1;\n}\n",
+                  "Render_Job_Control"),
+            0);
+  ASSERT_NE(Job_by_index(4), nullptr);
+  double expected = strtod(real.c_str(), nullptr);
+  if (expected > FLT_MAX) expected = FLT_MAX;
+  EXPECT_EQ(Job_by_index(4)->frames[0], static_cast<float>(expected));
+}
+
+INSTANTIATE_TEST_SUITE_P(Texts, RealTextTest,
+                         testing::Values("0.1", "1.000000", "-2.500000", "3.14159265358979",
+                                         "16777217.0", "123456789.123456", "0.30000000000000004",
+                                         "-0.0", "-.5", "1.2.3", "1-2.5", "-.",
+                                         "99999999999999999999999999999999999999999.0"));
+
+// Frames are written as "%f" of the float widened to double, whatever the
+// value.
+class FramesTextTest : public ControlFileTest, public testing::WithParamInterface<float> {};
+
+TEST_P(FramesTextTest, PrintAsPercentF) {
+  Job* job = Add_a_job(nullptr, "f.sdl", 4);
+  ASSERT_NE(job, nullptr);
+  job->animate = 1;
+  job->frames[0] = GetParam();
+  job->frames[1] = 2.0f;
+  job->frames[2] = -GetParam();
+  char expected[512];
+  snprintf(expected, sizeof expected, "\tframes\t\t= %f, %f, %f;\n",
+           static_cast<double>(job->frames[0]), 2.0, static_cast<double>(job->frames[2]));
+  EXPECT_THAT(written_jobs(), testing::HasSubstr(expected));
+}
+
+INSTANTIATE_TEST_SUITE_P(Values, FramesTextTest,
+                         testing::Values(0.0f, 1.0f, 250.0f, 0.5f, 1e9f, 999999999.0f, 16777216.0f,
+                                         2147483648.0f, 3.4e38f, 1e-7f, 0.1f));
 
 TEST_F(ControlFileTest, ReaderStartsAfreshOnEachStream) {
   static int exits = 0;

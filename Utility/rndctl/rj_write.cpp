@@ -3,6 +3,7 @@
 // every line is kept exactly as it has always been written, oddities
 // included (tabs against blanks, the resource comment that nothing reads
 // back, the two-blank default_dev line, the indented resource brace).
+#include <cmath>
 #include <cstdio>
 #include <cstring>
 
@@ -19,25 +20,15 @@ const char* shown(const Text& text) { return text.or_else("(null)"); }
 // hour is set.  The blocks are taken out of a scratch copy: taking a block
 // clears it, and the record must keep its grid.
 void write_week(FILE* fp, const char* keyword, const int* grid) {
-  bool any = false;
-  for (int i = 0; i < RJ_WEEK; ++i) {
-    if (grid[i] != 0) {
-      any = true;
-      break;
-    }
-  }
-  if (!any) return;
-
   int scratch[RJ_WEEK_SCAN];
   memcpy(scratch, grid, sizeof(int) * RJ_WEEK);
   scratch[RJ_WEEK] = 0;
 
-  fputs(keyword, fp);
   int times[2];
   const char* days[2];
   bool first = true;
   while (Schedule_get_a_block(scratch, times, days) != 0) {
-    if (!first) fputs(",\n\t\t", fp);
+    fputs(first ? keyword : ",\n\t\t", fp);
     first = false;
     const char* d0 = days[0] != nullptr ? days[0] : "(null)";
     const char* d1 = days[1] != nullptr ? days[1] : "(null)";
@@ -46,7 +37,24 @@ void write_week(FILE* fp, const char* keyword, const int* grid) {
     else
       fprintf(fp, "\t{ %d to %d %s }", times[0], times[1], d0);
   }
-  fputs(";\n", fp);
+  if (!first) fputs(";\n", fp);
+}
+
+// Frame numbers are nearly always whole.  For a whole float within int range
+// (negative zero excepted) "%d.000000" prints what "%f" would, without the
+// cost of the general floating-point conversion.
+bool whole(float f) {
+  return f == std::trunc(f) && std::fabs(f) < 1e9f && !(f == 0.0f && std::signbit(f));
+}
+
+void write_frames(FILE* fp, const float* frames) {
+  if (whole(frames[0]) && whole(frames[1]) && whole(frames[2])) {
+    fprintf(fp, "\tframes\t\t= %d.000000, %d.000000, %d.000000;\n", static_cast<int>(frames[0]),
+            static_cast<int>(frames[1]), static_cast<int>(frames[2]));
+  } else {
+    fprintf(fp, "\tframes\t\t= %f, %f, %f;\n", static_cast<double>(frames[0]),
+            static_cast<double>(frames[1]), static_cast<double>(frames[2]));
+  }
 }
 
 void write_job(FILE* fp, const Job* job) {
@@ -61,15 +69,14 @@ void write_job(FILE* fp, const Job* job) {
   if (job->sdl) fprintf(fp, "\tsdl \t\t= \"%s\";\n", job->sdl.c_str());
   if (job->pix) fprintf(fp, "\tpix \t\t= \"%s\";\n", job->pix.c_str());
   if (job->matte) fprintf(fp, "\tmatte \t\t= \"%s\";\n", job->matte.c_str());
-  fprintf(fp, "\tuse_sdl_paths = %s;\n", truth(job->use_sdl_paths));
-  fprintf(fp, "\toutput_mask = %s;\n", truth(job->output_mask));
+  fprintf(fp, "\tuse_sdl_paths = %s;\n\toutput_mask = %s;\n", truth(job->use_sdl_paths),
+          truth(job->output_mask));
 
   // A still job carries none of the animation group, its run state
   // included: a paused still job comes back from a rewrite unpaused.
   if (job->animate != 0) {
     fputs("\tanimate\t\t= TRUE;\n", fp);
-    fprintf(fp, "\tframes\t\t= %f, %f, %f;\n", static_cast<double>(job->frames[0]),
-            static_cast<double>(job->frames[1]), static_cast<double>(job->frames[2]));
+    write_frames(fp, job->frames);
     if (job->extension != 0)
       fprintf(fp, "\textension\t= %d, %d, %d;\n", job->ext_start, job->ext_by, job->ext_size);
     if (job->save_out != 0) fputs("\tsave_out\t= TRUE;\n", fp);
@@ -89,8 +96,7 @@ void write_job(FILE* fp, const Job* job) {
     }
     if (job->fields != 0) fprintf(fp, "\tfields\t\t= %d;\n", job->fields);
     if (job->rnd_opts) fprintf(fp, "\trnd_opts\t= \"%s\";\n", job->rnd_opts.c_str());
-    fprintf(fp, "\ttotalframes\t= %d;\n", job->totalframes);
-    fprintf(fp, "\tdoneframes\t= %d;\n", job->doneframes);
+    fprintf(fp, "\ttotalframes\t= %d;\n\tdoneframes\t= %d;\n", job->totalframes, job->doneframes);
   }
 
   if (job->resources != nullptr) {
@@ -130,9 +136,10 @@ void write_dev(FILE* fp, const Dev* dev) {
     default:
       break;
   }
-  fprintf(fp, "\tmax_frames \t\t= %d;\n", dev->max_frames);
-  fprintf(fp, "\tnum_processors \t= %d;\n", dev->num_processors);
-  fprintf(fp, "  default_dev     = %d;\n", dev->default_dev);
+  // default_dev has always been indented with two blanks and padded with
+  // blanks, unlike every other line.
+  fprintf(fp, "\tmax_frames \t\t= %d;\n\tnum_processors \t= %d;\n  default_dev     = %d;\n",
+          dev->max_frames, dev->num_processors, dev->default_dev);
   write_week(fp, "\tlocks =", dev->locks);
   fputs("\t}\n\n", fp);
 }

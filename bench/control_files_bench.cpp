@@ -1,0 +1,174 @@
+// Reading and writing a large control directory: 10,000 jobs (each with
+// resources, search paths, a weekly schedule) and 500 resources.  A daemon
+// rereads both files whenever anything in the queue changes, so a reload
+// has to stay in the tens of milliseconds.
+//
+// Counters: ms (per reload or write, wall clock), MB/s (both files).
+#include <benchmark/benchmark.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <random>
+#include <string>
+
+#include "Utility/rndctl/rndctl.h"
+
+namespace {
+
+constexpr int kJobs = 10000;
+constexpr int kDevs = 500;
+
+std::string dir;
+std::string job_file;
+std::string dev_file;
+double file_bytes = 0;
+
+void clear_lists() {
+  while (rndctl.jobs != nullptr) Job_del(rndctl.jobs);
+  while (rndctl.devs != nullptr) Dev_del(rndctl.devs);
+}
+
+void build_queue() {
+  std::mt19937 rng(42);
+  auto pick = [&](int lo, int hi) { return std::uniform_int_distribution<int>(lo, hi)(rng); };
+  Dev* devs[kDevs];
+  char text[256];
+  for (int i = 0; i < kDevs; ++i) {
+    snprintf(text, sizeof text, "render%03d", i);
+    Dev* dev = Add_a_dev(nullptr, text, i + 1);
+    dev->host_name.set(text);
+    dev->num_processors = pick(1, 16);
+    dev->max_frames = pick(1, 10);
+    if (i % 4 == 0) {
+      dev->comment.set("night shift only");
+      Schedule_dev_lock(dev, 800, 1800, "monday", "friday");
+    }
+    devs[i] = dev;
+  }
+  for (int i = 0; i < kJobs; ++i) {
+    snprintf(text, sizeof text, "/projects/show%02d/sdl/shot_%05d.sdl", i % 40, i);
+    Job* job = Add_a_job(nullptr, text, i + 1);
+    job->sdl.set(text);
+    snprintf(text, sizeof text, "/projects/show%02d/pix/shot_%05d", i % 40, i);
+    job->pix.set(text);
+    job->user.set("artist");
+    job->status.set(i % 3 == 0 ? "pending" : "37");
+    job->priority = pick(0, 10);
+    job->executable.set("zrender");
+    job->animate = 1;
+    job->frames[0] = 1.0f;
+    job->frames[1] = static_cast<float>(pick(24, 500));
+    job->frames[2] = 1.0f;
+    job->extension = 291;
+    job->ext_size = 4;
+    job->ctrl = RUN_SCHEDULE;
+    job->totalframes = static_cast<int>(job->frames[1]);
+    job->doneframes = pick(0, job->totalframes);
+    if (i % 10 == 0) job->comment.set("ERROR: render017 (render017) frame 12.0\nQuit\n \n");
+    for (int n = 0; n < 3; ++n) RndDevList_add(job, devs[pick(0, kDevs - 1)]);
+    RndPathList_add(job, "/projects/textures");
+    RndPathList_add(job, "/library/maps");
+    Schedule_job_runs(job, 1800, 2400, "Monday", "Friday");
+    Schedule_job_runs(job, 0, 2400, "Saturday", "Sunday");
+  }
+}
+
+bool write_file(const std::string& path, void (*writer)(FILE*)) {
+  FILE* fp = fopen(path.c_str(), "w");
+  if (fp == nullptr) return false;
+  writer(fp);
+  return fclose(fp) == 0;
+}
+
+bool parse_file(const std::string& path, const char* name) {
+  FILE* fp = fopen(path.c_str(), "r");
+  if (fp == nullptr) return false;
+  RJCin = fp;
+  RJCreadfile = name;
+  int result = RJCparse();
+  fclose(fp);
+  RJCin = nullptr;
+  return result == 0;
+}
+
+off_t size_of(const std::string& path) {
+  struct stat st;
+  return stat(path.c_str(), &st) == 0 ? st.st_size : 0;
+}
+
+// Once per process: a control directory holding the two files.
+bool ready() {
+  static bool done = [] {
+    char templ[] = "/tmp/rjc_bench_XXXXXX";
+    if (mkdtemp(templ) == nullptr) return false;
+    dir = templ;
+    job_file = dir + "/Render_Job_Control";
+    dev_file = dir + "/Render_Resource_Control";
+    rndctl.location.set(dir.c_str());
+    rndctl.host.set("benchhost");
+    rndctl.pid = getpid();
+    rndctl.interval_min = 10;
+    build_queue();
+    if (!write_file(dev_file, Resource_control_write_dev) ||
+        !write_file(job_file, Job_control_write_dev))
+      return false;
+    file_bytes = static_cast<double>(size_of(job_file) + size_of(dev_file));
+    return true;
+  }();
+  return done;
+}
+
+void report(benchmark::State& state) {
+  // Rate of (iterations / 1000), inverted: milliseconds per iteration.
+  state.counters["ms"] =
+      benchmark::Counter(static_cast<double>(state.iterations()) / 1000.0,
+                         benchmark::Counter::kIsRate | benchmark::Counter::kInvert);
+  state.counters["MB/s"] = benchmark::Counter(
+      file_bytes * static_cast<double>(state.iterations()) / 1e6, benchmark::Counter::kIsRate);
+  state.counters["file_MB"] = file_bytes / 1e6;
+}
+
+void BM_Reload(benchmark::State& state) {
+  if (!ready()) {
+    state.SkipWithError("cannot set up the control directory");
+    return;
+  }
+  for (auto _ : state) {
+    state.PauseTiming();
+    clear_lists();
+    state.ResumeTiming();
+    if (!parse_file(dev_file, "Render_Resource_Control") ||
+        !parse_file(job_file, "Render_Job_Control")) {
+      state.SkipWithError("parse failed");
+      break;
+    }
+  }
+  report(state);
+}
+BENCHMARK(BM_Reload)->Unit(benchmark::kMillisecond)->UseRealTime();
+
+void BM_Write(benchmark::State& state) {
+  if (!ready()) {
+    state.SkipWithError("cannot set up the control directory");
+    return;
+  }
+  if (rndctl.jobs == nullptr) {
+    parse_file(dev_file, "Render_Resource_Control");
+    parse_file(job_file, "Render_Job_Control");
+  }
+  for (auto _ : state) {
+    if (!write_file(dev_file, Resource_control_write_dev) ||
+        !write_file(job_file, Job_control_write_dev)) {
+      state.SkipWithError("write failed");
+      break;
+    }
+  }
+  report(state);
+}
+BENCHMARK(BM_Write)->Unit(benchmark::kMillisecond)->UseRealTime();
+
+}  // namespace
+
+BENCHMARK_MAIN();
