@@ -106,3 +106,16 @@ bool edit_job_file(Farm& farm, const std::string& from, const std::string& to,
   utimensat(AT_FDCWD, pid_file.c_str(), nullptr, 0);
   return found;
 }
+
+bool set_job_status(Farm& farm, const std::string& job, const std::string& status,
+                    const std::string& host) {
+  for (int attempt = 0; attempt < 100; ++attempt) {
+    std::string block = job_block(farm, job);
+    size_t at = block.find("\tstatus \t\t= \"");
+    if (at == std::string::npos) return false;
+    size_t end = block.find(";\n", at);
+    std::string line = block.substr(at, end - at);
+    if (edit_job_file(farm, line, "\tstatus \t\t= \"" + status + "\"", host)) return true;
+  }
+  return false;
+}

@@ -48,3 +48,8 @@ std::string job_block(Farm& farm, const std::string& job);
 /// by `to` in the text, then touches the pid file of `host`.
 bool edit_job_file(Farm& farm, const std::string& from, const std::string& to,
                    const std::string& host);
+
+/// Sets a job's state text as an editor does (under the lock, then touching
+/// the pid file of `host`); false when the job has no state line.
+bool set_job_status(Farm& farm, const std::string& job, const std::string& status,
+                    const std::string& host);

@@ -141,9 +141,7 @@ TEST_F(RenderTest, AnAbortedJobHasItsRenderProgramKilled) {
   Daemon& d = start({here(6, 1)}, {spin});
   ASSERT_TRUE(wait_for([&] { return children_of(d.pid).size() == 1; }, 30)) << d.log();
   int renderer = children_of(d.pid)[0];
-  ASSERT_TRUE(edit_job_file(farm_, "status \t\t= \"started\"", "status \t\t= \"aborted\"", host_) ||
-              edit_job_file(farm_, "status \t\t= \"pending\"", "status \t\t= \"aborted\"", host_))
-      << farm_.read("Render_Job_Control");
+  ASSERT_TRUE(set_job_status(farm_, "spin", "aborted", host_)) << farm_.read("Render_Job_Control");
   ASSERT_TRUE(wait_for([&] { return !exists("/proc/" + std::to_string(renderer)); }, 30, &d))
       << d.log();
   EXPECT_NE(d.log().find("kill( " + std::to_string(renderer) + ", 9 )"), std::string::npos)
