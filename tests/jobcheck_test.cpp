@@ -269,13 +269,8 @@ TEST_F(JobCheckTest, ResourceDifferences) {
 
   const std::function<void(Dev*)> changes[] = {
       [](Dev* d) { d->max_frames = 8; },
-      [](Dev* d) { d->num_processors = 2; },
-      [](Dev* d) { d->status = LOCK_LOCKED; },
       [](Dev* d) { d->host_name.reset(); },
-      [](Dev* d) { d->comment.set("x"); },
-      [](Dev* d) { d->remote_location.set("/r"); },
       [](Dev* d) { d->locks[0] = 1; },
-      [](Dev* d) { d->lock_pid = 4; },
       [](Dev* d) { RndJobList_del(d, d->jobs->job); },
       [](Dev* d) { RndDevList_add(Job_new(nullptr, nullptr, "j", 3), d); },
   };

@@ -227,30 +227,3 @@ INSTANTIATE_TEST_SUITE_P(Words, StateWords,
                                          StateWord{"AVAILABLE", 2, 2}, StateWord{"SCHEDULE", 3, 3},
                                          StateWord{"NOW", 4, 0}, StateWord{"LOCKED", 0, 1},
                                          StateWord{"Locked", 0, 0}, StateWord{"NOW ", 0, 0}));
-
-TEST_F(RecordsTest, CurrentRecordHoldsTheLockAndCloneCopies) {
-  Job* job = Job_new(nullptr, nullptr, "shot", 5);
-  Job* next = Job_new(nullptr, nullptr, "next", 6);
-  setcurrent_job(job);
-  EXPECT_EQ(rndctl.current_job, job);
-  EXPECT_EQ(job->lock_pid, rndctl.pid);
-  setcurrent_job(next);
-  EXPECT_EQ(job->lock_pid, 0);
-  EXPECT_EQ(next->lock_pid, rndctl.pid);
-  Job_del(next);
-  EXPECT_EQ(rndctl.current_job, nullptr);
-
-  Dev* dev = Dev_new(nullptr, nullptr, "host", 1);
-  RndDevList_add(job, dev);
-  RndPathList_add(job, "/maps");
-  job->runs[40] = 1;
-  Job* clone = Job_clone(job);
-  ASSERT_NE(clone, nullptr);
-  EXPECT_STREQ(clone->name.c_str(), "shot.clone");
-  EXPECT_NE(clone->index, job->index);
-  EXPECT_EQ(clone->runs[40], 1);
-  EXPECT_EQ(ISA_resource_usedby(clone, dev), 1);
-  ASSERT_NE(clone->searchpath, nullptr);
-  EXPECT_NE(clone->searchpath, job->searchpath);
-  EXPECT_EQ(rndctl.jobs->next, clone);
-}
