@@ -8,8 +8,10 @@
 //
 // Output streams: the daemon sends stderr to the task's stream file (only its
 // last line is read, as progress) and stdout to the task's output file (which
-// is searched for error lines when a task fails). Error lines therefore go to
-// both.
+// is searched for error lines when a task fails). Error lines go to both,
+// except a failure between frames: there the last progress line must stay
+// the stream's last line, because the daemon cuts a failed task at the frame
+// that line reports and an error line would read as no progress at all.
 
 #include <fcntl.h>
 #include <signal.h>
@@ -76,19 +78,34 @@ struct Settings {
   std::string fail_once;
 };
 
-void error_line(const char* fmt, ...) __attribute__((format(printf, 1, 2)));
+enum class Streams { kBoth, kOutputOnly };
 
-void error_line(const char* fmt, ...) {
+void report(Streams where, const char* fmt, va_list ap) {
   char msg[1024];
-  va_list ap;
-  va_start(ap, fmt);
   vsnprintf(msg, sizeof msg, fmt, ap);
-  va_end(ap);
-  fflush(stdout);
   fprintf(stdout, "Error: %s\n", msg);
   fflush(stdout);
-  fprintf(stderr, "Error: %s\n", msg);
-  fflush(stderr);
+  if (where == Streams::kBoth) {
+    fprintf(stderr, "Error: %s\n", msg);
+    fflush(stderr);
+  }
+}
+
+void error_line(const char* fmt, ...) __attribute__((format(printf, 1, 2)));
+void error_line(const char* fmt, ...) {
+  va_list ap;
+  va_start(ap, fmt);
+  report(Streams::kBoth, fmt, ap);
+  va_end(ap);
+}
+
+// For a failure between frames; see the note on output streams at the top.
+void frame_error_line(const char* fmt, ...) __attribute__((format(printf, 1, 2)));
+void frame_error_line(const char* fmt, ...) {
+  va_list ap;
+  va_start(ap, fmt);
+  report(Streams::kOutputOnly, fmt, ap);
+  va_end(ap);
 }
 
 bool to_float(const char* s, float* out) {
@@ -376,7 +393,7 @@ int main(int argc, char** argv) {
       die_by_signal(f, st.die_signal);
     if (((st.have_fail_at && same_frame(f, st.fail_at)) || (fail_first && i == 0)) &&
         failure_armed(st)) {
-      error_line("frame %g did not render (requested failure)", f);
+      frame_error_line("frame %g did not render (requested failure)", f);
       return 1;
     }
 
