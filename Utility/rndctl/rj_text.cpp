@@ -2,9 +2,9 @@
 
 #include "Shared/memory/MA_rtns.h"
 
-void Text::set(const char* text, std::source_location at) {
+void Text::set(const char* text, int line, const char* unit) {
   // Copy first: `text` may point into the value being replaced.
-  char* copy = MA_strdup(text, static_cast<int>(at.line()), at.file_name());
+  char* copy = MA_strdup(text, line, unit);
   reset();
   p_ = copy;
 }

@@ -8,13 +8,13 @@
 #pragma once
 
 #include <cstring>
-#include <source_location>
 
 class Text {
  public:
   Text() = default;
-  explicit Text(const char* text, std::source_location at = std::source_location::current()) {
-    set(text, at);
+  explicit Text(const char* text, int line = __builtin_LINE(),
+                const char* unit = __builtin_FILE()) {
+    set(text, line, unit);
   }
   Text(const Text& other) { set(other.p_); }
   Text(Text&& other) noexcept : p_(other.p_) { other.p_ = nullptr; }
@@ -33,7 +33,8 @@ class Text {
   ~Text() { reset(); }
 
   /// Replaces the value with a copy of `text` (none for null).
-  void set(const char* text, std::source_location at = std::source_location::current());
+  /// (The line and unit of the caller tag the copy for the allocator.)
+  void set(const char* text, int line = __builtin_LINE(), const char* unit = __builtin_FILE());
   /// Takes over a block made by MA_malloc/MA_strdup (none for null).
   void adopt(char* block);
   /// Gives up the block without freeing it; the caller owns it (MA_free).
@@ -52,7 +53,9 @@ class Text {
   /// The text, or `fallback` when none (for messages: "noname", "null").
   const char* or_else(const char* fallback) const { return p_ ? p_ : fallback; }
   /// True when set and equal to `text` (strcmp); false for none.
-  bool is(const char* text) const { return p_ != nullptr && text != nullptr && std::strcmp(p_, text) == 0; }
+  bool is(const char* text) const {
+    return p_ != nullptr && text != nullptr && std::strcmp(p_, text) == 0;
+  }
 
  private:
   char* p_ = nullptr;
