@@ -201,6 +201,14 @@ bool project_dir_of(const char* sdl, std::string* dir) {
   return true;
 }
 
+// The directory a job's render program runs in: its project directory when
+// that exists, else (false) wherever the daemon is.
+bool render_dir_of(const Job* job, std::string* dir) {
+  if (job == nullptr || !project_dir_of(job->sdl.c_str(), dir)) return false;
+  struct stat st;
+  return stat(dir->c_str(), &st) == 0 && S_ISDIR(st.st_mode);
+}
+
 }  // namespace
 
 int rj_splitpath(const char* path, char** base, char** dir, const char* last) {
@@ -283,7 +291,7 @@ int rj_system(char* const argv[], const char* stream_path, const char* out_path,
 
   // Only the child changes directory: the daemon holds relative paths.
   std::string workdir;
-  bool change_dir = job != nullptr && project_dir_of(job->sdl.c_str(), &workdir);
+  bool change_dir = render_dir_of(job, &workdir);
 
   ChildPlan plan{argv,
                  stream_path,
@@ -332,7 +340,19 @@ int Perform_a_Task(TASK* entry) {
            rndctl.out_counter);
   // Wraps to 0 rather than going negative.
   rndctl.out_counter = rndctl.out_counter == INT_MAX ? 0 : rndctl.out_counter + 1;
-  entry->out_path.set(out);
+  // The program opens its output from its own working directory; the
+  // daemon, which stays where it is, reads and removes the same file, so a
+  // relative path is anchored there for both.
+  std::string workdir;
+  if (out[0] != '/' && render_dir_of(job, &workdir)) {
+    if (workdir[0] != '/') {
+      char cwd[4096];
+      if (getcwd(cwd, sizeof cwd) != nullptr) workdir = std::string(cwd) + "/" + workdir;
+    }
+    entry->out_path.set((workdir + "/" + out).c_str());
+  } else {
+    entry->out_path.set(out);
+  }
 
   int first_extension = 0;
   get_task_frame_range(entry, &first_extension);

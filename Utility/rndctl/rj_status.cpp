@@ -120,11 +120,17 @@ int set_image_percentage_done(TASK* entry) {
   dbgpnt("\tset_image_percentage_done------------------\n");
 
   // The program may be in the middle of writing a line: a piece without its
-  // newline at the end of the stream is read again, whole, next time.
+  // newline at the end of the stream is read again, whole, next time.  Other
+  // text on the stream (an error message after the last progress line, say)
+  // does not hide the progress reported before it.
   clearerr(entry->stream);
   char buf[256] = "";
   char prev[256] = "";
   char line[256];
+  char image[256] = "";
+  int line_no = 0;
+  int lines_per_frame = 0;
+  bool found = false;
   for (;;) {
     long at = ftell(entry->stream);
     if (fgets(line, sizeof line, entry->stream) == nullptr) break;
@@ -133,18 +139,24 @@ int set_image_percentage_done(TASK* entry) {
       break;
     }
     if (strchr(line, ' ') == nullptr) continue;
+    char name[256];
+    char letter = 0;
+    int number = 0;
+    int per_frame = 0;
+    if (sscanf(line, "%255s %c %d of %d", name, &letter, &number, &per_frame) != 4 ||
+        letter != 'r' || per_frame <= 0) {
+      continue;
+    }
     memcpy(prev, buf, sizeof prev);
     memcpy(buf, line, sizeof buf);
+    memcpy(image, name, sizeof image);
+    line_no = number;
+    lines_per_frame = per_frame;
+    found = true;
   }
   dbgpnt("prev = \"%s\"\n", prev);
   dbgpnt("buf = \"%s\"\n", buf);
-
-  char image[256];
-  char letter = 0;
-  int line_no = 0;
-  int lines_per_frame = 0;
-  if (sscanf(buf, "%255s %c %d of %d", image, &letter, &line_no, &lines_per_frame) != 4 ||
-      letter != 'r' || lines_per_frame <= 0) {
+  if (!found) {
     dbgpnt("\tset_image_percentage_done----same-----done\n");
     return 0;
   }
@@ -169,13 +181,16 @@ int set_image_percentage_done(TASK* entry) {
 
   const float old_current = rec->current;
   const float old_progress = entry->progress;
-  // The frame being rendered now, not the one after it: a task that fails
-  // in the middle of this frame must be cut before it, so that the frame is
-  // rendered again.
+  // `current` is the frame under way, not the one after it: a task that
+  // fails in the middle of a frame is cut before that frame, so that it is
+  // rendered again.  Once a frame's last line is in, the next one is under
+  // way; never past the task's end, which would leave an empty remainder.
   float current = rec->start;
-  if (job->animate != 0 && frames_done > 1) {
-    current = rec->start + static_cast<float>(frames_done - 1) * job->frames[2];
+  if (job->animate != 0) {
+    int under_way = line_no >= lines_per_frame ? frames_done : frames_done - 1;
+    if (under_way > 0) current = rec->start + static_cast<float>(under_way) * job->frames[2];
     if (current < rec->start) current = rec->start;
+    if (current > rec->end) current = rec->end;
   }
   rec->current = current;
   const int lines_done = frames_done * lines_per_frame + line_no;
