@@ -1,7 +1,7 @@
 #!/usr/bin/env bash
 # Runs every fuzzer of a fuzz build for a bounded time, each from its seed corpus.
 set -euo pipefail
-build=$1
+build=$(cd "$1" && pwd)
 seconds=${2:-60}
 here=$(cd "$(dirname "$0")" && pwd)
 status=0
