@@ -2,7 +2,9 @@
 # Renders a small farm on this machine: a control directory under the build
 # directory, this host as the one render resource, its daemon, and two jobs
 # for the demo renderer. "ball" renders cleanly; "hiccup" fails once at a
-# frame (as a crashing renderer would) and is retried. The script follows the
+# frame (as a crashing renderer would) and is retried. The host has two
+# processors and takes three frames a task; both jobs are immediate
+# (priority 0), so both processors work. The script follows the
 # job states, then shows the images, the error the queue recorded and the job
 # logs, and stops the daemon.
 #   demo/run.sh [BUILD_DIR]          (default: build)
@@ -18,7 +20,7 @@ farm_init "$build" "$(cd "$build" && pwd)/demo_farm"
 cp -R "$here/project/sdl/." "$project/sdl/"
 scene=$project/sdl/bouncing_ball.sdl
 
-farm_resource 6 2
+farm_resource 3 2  # 3 frames a task, 2 processors
 {
   echo "RenderJobControl 0 10"
   farm_job ball 1 "$scene" 1 24 "slow=0.2"
