@@ -1,64 +1,76 @@
 #!/usr/bin/env bash
-# Dispatch throughput of one daemon: how fast it cuts tasks off a job, starts
-# the renderer, notices it ended and writes the outcome back. The renderer
-# paints tiny images, so the figures are the queue's own cost per task.
+# Dispatch on one host: 2 processors, an immediate (priority 0) job of 120
+# frames, 1 frame a task, each frame taking 0.5 s to render.  Reports the
+# makespan against the ideal (frames / processors x 0.5 s) and the dispatch
+# latency: from a render program's exit to the start of the next one
+# (median and 95th percentile).  The render program is wrapped by a script
+# that notes when it starts and when it ends.
 #   bench/dispatch_bench.sh [BUILD_DIR]     (default: build)
-#   BENCH_QUICK=1                           a few tasks only (proves it runs)
+#   BENCH_QUICK=1                           12 frames only (proves it runs)
 set -euo pipefail
 
 here=$(cd "$(dirname "$0")" && pwd)
 # shellcheck source=demo/farm.sh
 . "$here/../demo/farm.sh"
 build=$(cd "${1:-build}" && pwd)
-quick=${BENCH_QUICK:-0}
-frames=60
-[ "$quick" = 1 ] && frames=6
+frames=120
+seconds_per_frame=0.5
+[ "${BENCH_QUICK:-0}" = 1 ] && frames=12
+processors=2
 limit=${DISPATCH_TIMEOUT:-600}
 
-now_ms() { echo $(($(date +%s%N) / 1000000)); }
-
-# Renders one job of $frames frames cut into pieces of $1 frames; prints one
-# result line.
-run_case() {  # frames_per_task processors
-  local per_task=$1 processors=$2 tasks start first="" t elapsed
-  farm_init "$build" "$build/bench_farm"
-  printf 'animation = ON;\nstartframe = 1;\nendframe = %d;\nbyframe = 1;\nsize = 8x6;\n' \
-    "$frames" >"$project/sdl/tiny.sdl"
-  farm_resource "$per_task" "$processors"
-  {
-    echo "RenderJobControl 0 10"
-    farm_job tiny 1 "$project/sdl/tiny.sdl" 1 "$frames" "size=8x6"
-    echo "End"
-  } >"$farm/Render_Job_Control"
-  tasks=$(((frames + per_task - 1) / per_task))
-
-  start=$(now_ms)
-  farm_start
-  until farm_done; do
-    t=$(now_ms)
-    if [ -z "$first" ] && [ -e "$project/pix/tiny.0001" ]; then first=$((t - start)); fi
-    if ! farm_alive || [ $((t - start)) -ge $((limit * 1000)) ]; then
-      echo "dispatch: job not done (daemon ended or ${limit}s passed); states: $(farm_states)" >&2
-      farm_stop
-      return 1
-    fi
-    sleep 0.02
-  done
-  elapsed=$(($(now_ms) - start))
-  farm_stop
-  if [ "$(farm_states)" != "tiny: finished" ]; then
-    echo "dispatch: job ended as $(farm_states)" >&2
-    return 1
-  fi
-  awk -v n="$tasks" -v f="$frames" -v p="$per_task" -v ms="$elapsed" -v first="${first:-0}" \
-    'BEGIN { printf "%3d frames/task  %4d tasks  %7.0f ms  %7.1f ms/task  %6.1f tasks/s  first frame %5d ms\n",
-             p, n, ms, ms / n, n * 1000.0 / ms, first }'
-}
+farm_init "$build" "$build/bench_farm"
+mkdir -p "$farm/bin"
+times=$farm/times
+: >"$times"
+cat >"$farm/bin/timed_painter" <<END_OF_WRAPPER
+#!/bin/sh
+echo "start \$(date +%s%N)" >>"$times"
+"$painter_bin/frame_painter" "\$@"
+rc=\$?
+echo "end \$(date +%s%N)" >>"$times"
+exit \$rc
+END_OF_WRAPPER
+chmod +x "$farm/bin/timed_painter"
+printf 'animation = ON;\nstartframe = 1;\nendframe = %d;\nbyframe = 1;\nsize = 8x6;\n' \
+  "$frames" >"$project/sdl/tiny.sdl"
+farm_resource 1 "$processors"
+{
+  echo "RenderJobControl 0 10"
+  farm_job tiny 1 "$project/sdl/tiny.sdl" 1 "$frames" "size=8x6 slow=$seconds_per_frame" |
+    sed 's/= frame_painter;/= timed_painter;/'
+  echo "End"
+} >"$farm/Render_Job_Control"
 
 trap farm_stop EXIT
-echo "dispatch: one host, $frames frames of 8x6, from daemon start to the job finished"
-status=0
-run_case 1 1 || status=1
-run_case 10 1 || status=1
+PATH=$farm/bin:$PATH
+start=$(date +%s%N)
+farm_start
+until farm_done; do
+  if ! farm_alive || [ $((($(date +%s%N) - start) / 1000000000)) -ge "$limit" ]; then
+    echo "dispatch: job not done (daemon ended or ${limit}s passed); states: $(farm_states)" >&2
+    exit 1
+  fi
+  sleep 0.05
+done
+farm_stop
+if [ "$(farm_states)" != "tiny: finished" ]; then
+  echo "dispatch: job ended as $(farm_states)" >&2
+  exit 1
+fi
+
+# Makespan: first start to last end.  Latency: each start after the first
+# `processors` ones, minus the latest end before it.
+sort -k2,2n "$times" | awk -v frames="$frames" -v p="$processors" -v spf="$seconds_per_frame" '
+  $1 == "start" { starts++; if (first == "") first = $2;
+                  if (starts > p && last_end != "") lat[n++] = ($2 - last_end) / 1e6 }
+  $1 == "end"   { last_end = $2; final = $2 }
+  END {
+    makespan = (final - first) / 1e9; ideal = frames / p * spf
+    for (i = 0; i < n; i++) for (j = i + 1; j < n; j++) if (lat[j] < lat[i]) { t = lat[i]; lat[i] = lat[j]; lat[j] = t }
+    med = n ? lat[int((n - 1) / 2)] : 0; p95 = n ? lat[int(0.95 * (n - 1))] : 0
+    printf "dispatch: %d frames on %d processors, %.1f s a frame, 1 frame a task\n", frames, p, spf
+    printf "  makespan %.2f s, ideal %.2f s, efficiency %.1f%% (target >= 90%%)\n", makespan, ideal, 100 * ideal / makespan
+    printf "  dispatch latency over %d starts: median %.1f ms, p95 %.1f ms (target median < 50 ms)\n", n, med, p95
+  }'
 rm -rf "$build/bench_farm"
-exit $status
