@@ -120,17 +120,11 @@ int set_image_percentage_done(TASK* entry) {
   dbgpnt("\tset_image_percentage_done------------------\n");
 
   // The program may be in the middle of writing a line: a piece without its
-  // newline at the end of the stream is read again, whole, next time.  Other
-  // text on the stream (an error message after the last progress line, say)
-  // does not hide the progress reported before it.
+  // newline at the end of the stream is read again, whole, next time.
   clearerr(entry->stream);
   char buf[256] = "";
   char prev[256] = "";
   char line[256];
-  char image[256] = "";
-  int line_no = 0;
-  int lines_per_frame = 0;
-  bool found = false;
   for (;;) {
     long at = ftell(entry->stream);
     if (fgets(line, sizeof line, entry->stream) == nullptr) break;
@@ -139,24 +133,20 @@ int set_image_percentage_done(TASK* entry) {
       break;
     }
     if (strchr(line, ' ') == nullptr) continue;
-    char name[256];
-    char letter = 0;
-    int number = 0;
-    int per_frame = 0;
-    if (sscanf(line, "%255s %c %d of %d", name, &letter, &number, &per_frame) != 4 ||
-        letter != 'r' || per_frame <= 0) {
-      continue;
-    }
     memcpy(prev, buf, sizeof prev);
     memcpy(buf, line, sizeof buf);
-    memcpy(image, name, sizeof image);
-    line_no = number;
-    lines_per_frame = per_frame;
-    found = true;
   }
   dbgpnt("prev = \"%s\"\n", prev);
   dbgpnt("buf = \"%s\"\n", buf);
-  if (!found) {
+
+  // Only a progress line counts, and only when it is the last line: what a
+  // program writes after its progress is news the percentage cannot show.
+  char image[256];
+  char letter = 0;
+  int line_no = 0;
+  int lines_per_frame = 0;
+  if (sscanf(buf, "%255s %c %d of %d", image, &letter, &line_no, &lines_per_frame) != 4 ||
+      letter != 'r' || lines_per_frame <= 0) {
     dbgpnt("\tset_image_percentage_done----same-----done\n");
     return 0;
   }
