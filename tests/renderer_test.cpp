@@ -316,13 +316,13 @@ TEST_F(RendererTest, FailAtStopsBeforeTheFrameLeavingTheLastProgressLineLast) {
 
 TEST_F(RendererTest, DieAtEndsTheProcessByTheSignalAtThatFrame) {
   struct {
-    const char* spec;
+    const char* signal_name;
     int sig;
   } cases[] = {{"9", SIGKILL}, {"TERM", SIGTERM}, {"SIGINT", SIGINT}};
   for (const auto& c : cases) {
-    SCOPED_TRACE(c.spec);
+    SCOPED_TRACE(c.signal_name);
     Outcome r = render({"-p", "pix/ball", "-s", "1", "-e", "4", "-b", "1", "-E", "1",
-                        std::string("size=8x6 die_at=3:") + c.spec, "sdl/scene.sdl"});
+                        std::string("size=8x6 die_at=3:") + c.signal_name, "sdl/scene.sdl"});
     ASSERT_TRUE(WIFSIGNALED(r.status)) << r.err;
     EXPECT_EQ(WTERMSIG(r.status), c.sig);
     EXPECT_EQ(pix_files(), (std::vector<std::string>{"ball.1", "ball.2"}));
