@@ -58,6 +58,15 @@ class ControlFileTest : public ControlDirTest {
   void SetUp() override {
     ControlDirTest::SetUp();
     setenv("DRCTMPDIR", "/golden/tmp", 1);
+    // The death tests wait for their child and expect it to die of abort,
+    // whatever an earlier test in the same process did to these signals.
+    signal(SIGCHLD, SIG_DFL);
+    signal(SIGABRT, SIG_DFL);
+    sigset_t both;
+    sigemptyset(&both);
+    sigaddset(&both, SIGCHLD);
+    sigaddset(&both, SIGABRT);
+    sigprocmask(SIG_UNBLOCK, &both, nullptr);
   }
   void TearDown() override {
     RJC_fatal_exit = nullptr;
