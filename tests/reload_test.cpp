@@ -1,0 +1,133 @@
+// The reconciling reload: fresh records from the files, running-task entries
+// re-pointed at them, the state text settled, both files written back.
+#include <unistd.h>
+
+#include "Shared/memory/MA_rtns.h"
+#include "tests/support/test_support.h"
+
+namespace {
+
+const char kResources[] =
+    "RenderResourceControl\n"
+    "testhost 1 {\n\tlock_pid \t= 0;\n\thost_name\t\t= testhost;\n\tmax_frames \t\t= 3;\n"
+    "\tnum_processors \t= 2;\n  default_dev     = 0;\n\t}\n\n"
+    "End\n";
+
+std::string jobs_file(const std::string& state, int minutes = 0, int seconds = 0,
+                      bool with_job = true) {
+  std::string text =
+      "RenderJobControl " + std::to_string(minutes) + " " + std::to_string(seconds) + "\n";
+  if (with_job) {
+    text += "shot 7 {\n\tstatus \t\t= \"" + state +
+            "\";\n\tpriority \t= 0;\n\tuse_sdl_paths = TRUE;\n\toutput_mask = FALSE;\n"
+            "\tresources\t= testhost;\n}\n\n";
+  }
+  return text + "End\n";
+}
+
+class ReloadTest : public ControlDirTest {
+ protected:
+  void load(const std::string& jobs) {
+    write_file("Render_Resource_Control", kResources);
+    write_file("Render_Job_Control", jobs);
+    RJC_in();
+    ASSERT_NE(Job_by_index(7), nullptr);
+  }
+  std::string state_in_file() {
+    std::string text = read_file("Render_Job_Control");
+    size_t at = text.find("status \t\t= \"");
+    if (at == std::string::npos) return "(none)";
+    at += 12;
+    return text.substr(at, text.find('"', at) - at);
+  }
+};
+
+struct Case {
+  const char* name;
+  int editor;
+  const char* in_file;
+  const char* in_memory;
+  const char* expected;
+};
+
+class Reconcile : public ReloadTest, public ::testing::WithParamInterface<Case> {};
+
+TEST_P(Reconcile, FurtherProgressWinsAndTheFileWinsInTheDaemon) {
+  const Case& c = GetParam();
+  load(jobs_file("none"));
+  write_file("Render_Job_Control", jobs_file(c.in_file));
+  Job_by_index(7)->status.set(c.in_memory);
+  Update_from_demon(c.editor);
+  ASSERT_NE(Job_by_index(7), nullptr);
+  EXPECT_STREQ(Job_by_index(7)->status.c_str(), c.expected);
+  EXPECT_EQ(state_in_file(), c.expected);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    States, Reconcile,
+    ::testing::Values(Case{"daemon_takes_file", 0, "pending", "started", "pending"},
+                      Case{"editor_keeps_more_progress", 1, "40", "55", "55"},
+                      Case{"editor_takes_file_progress", 1, "60", "55", "60"},
+                      Case{"file_abort_wins", 1, "aborted", "55", "aborted"},
+                      Case{"file_finished_wins", 1, "finished", "started", "finished"},
+                      Case{"memory_abort_taken_from_file", 1, "40", "aborted", "40"},
+                      Case{"started_over_pending", 1, "started", "pending", "started"},
+                      Case{"keyword_kept_over_keyword", 1, "pending", "started", "started"},
+                      Case{"number_over_started", 1, "12.5", "started", "12.5"}),
+    [](const ::testing::TestParamInfo<Case>& info) { return std::string(info.param.name); });
+
+TEST_F(ReloadTest, RunningTaskEntriesFollowTheFreshRecordsOrLoseAVanishedJob) {
+  load(jobs_file("started"));
+  Job* old_job = Job_by_index(7);
+  Dev* old_dev = Dev_by_index(1);
+  auto* rec = MA_new<TaskRec>(__LINE__, "tests/reload_test");
+  rec->dev = old_dev;
+  TASK* entry = Task_add(old_job, rec);
+  ASSERT_NE(entry, nullptr);
+
+  Update_from_demon(0);
+  EXPECT_NE(entry->job, nullptr);
+  EXPECT_EQ(entry->job, Job_by_index(7));
+  EXPECT_EQ(entry->rec->dev, Dev_by_index(1));
+  EXPECT_EQ(entry->rec->dev->index, 1);
+
+  write_file("Render_Job_Control", jobs_file("", 0, 0, false));
+  Update_from_demon(0);
+  EXPECT_EQ(entry->job, nullptr);
+  EXPECT_EQ(Job_by_index(7), nullptr);
+  EXPECT_EQ(entry->rec->dev, Dev_by_index(1));
+}
+
+TEST_F(ReloadTest, TheJobFileHeaderSetsTheCheckIntervalAndTheUpdateTimeIsRecorded) {
+  write_file("testhost.pid", "abcd");
+  load(jobs_file("pending", 2, 30));
+  write_file("Render_Job_Control", jobs_file("pending", 4, 5));
+  daemon_updatetime_set("testhost");
+  Update_from_demon(0);
+  EXPECT_EQ(rndctl.interval_min, 4u);
+  EXPECT_EQ(rndctl.interval_sec, 5u);
+  EXPECT_EQ(rndctl.last_update, daemon_updatetime_get("testhost"));
+  // Written back as read, and no lock left behind.
+  EXPECT_EQ(read_file("Render_Job_Control").rfind("RenderJobControl 4 5\n", 0), 0u);
+  EXPECT_NE(access(path("Render_Job_Control.lock").c_str(), F_OK), 0);
+  EXPECT_NE(access(path("Render_Resource_Control.lock").c_str(), F_OK), 0);
+}
+
+TEST_F(ReloadTest, AnEmptyOrMissingControlFileReadsAsNoRecords) {
+  EXPECT_EQ(RJC_in(), 0);
+  EXPECT_EQ(rndctl.jobs, nullptr);
+  EXPECT_EQ(rndctl.devs, nullptr);
+  RJC_out();
+  EXPECT_EQ(read_file("Render_Resource_Control"), "RenderResourceControl\nEnd\n");
+  EXPECT_EQ(read_file("Render_Job_Control"), "RenderJobControl 0 0\nEnd\n");
+}
+
+TEST(FloatValue, LeadingNumberOrNothing) {
+  float v = -1;
+  EXPECT_EQ(get_fvalue("12.50% ", &v), 1);
+  EXPECT_FLOAT_EQ(v, 12.5f);
+  EXPECT_EQ(get_fvalue("pending", &v), 0);
+  EXPECT_EQ(get_fvalue(nullptr, &v), 0);
+}
+
+}  // namespace
