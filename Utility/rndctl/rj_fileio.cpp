@@ -43,6 +43,7 @@ struct FileRecord {
   char* lock_path = nullptr;  // "%s/%s.lock" (owned)
   FILE* stream = nullptr;     // open between an open and a close operation (owned)
   int fd = -1;                // descriptor of `stream`, for fsync and ftruncate
+  bool for_update = false;    // opened by update_fileop: its close forces it to disk
 };
 
 FileRecord files[FILE_COUNT];
@@ -98,11 +99,15 @@ FILE* open_record(int index, const char* first_mode, const char* second_mode) {
   if (fp == nullptr) fp = fopen(rec.path, second_mode);
   rec.stream = fp;
   rec.fd = fp != nullptr ? fileno(fp) : -1;
+  rec.for_update = false;
   return fp;
 }
 
 void after_open(int index, FILE* fp) {
-  setvbuf(fp, nullptr, _IOLBF, BUFSIZ);
+  // Fully buffered: whole files are read or rewritten under their lock, and
+  // a line-buffered stream would cost one system call per line of a large
+  // job file.  Nobody reads a locked file half-written either way.
+  setvbuf(fp, nullptr, _IOFBF, 1 << 16);
   if (index == FILE_JOBS || index == FILE_RESOURCES) {
     RJCin = fp;
     RJCreadfile = files[index].path;
@@ -268,6 +273,7 @@ FILE* update_fileop(int index) {
     sounder(3);
     return nullptr;
   }
+  files[index].for_update = true;
   after_open(index, fp);
   return fp;
 }
@@ -284,7 +290,9 @@ void close_fileop(int index) {
   FileRecord& rec = files[index];
   if (rec.stream == nullptr) return;
   fflush(rec.stream);
-  fsync(rec.fd);
+  // Forcing a file that was only read costs a journal commit (its access
+  // time) and protects nothing.
+  if (rec.for_update) fsync(rec.fd);
   fclose(rec.stream);
   rec.stream = nullptr;
   rec.fd = -1;
