@@ -5,6 +5,7 @@
 // Grid index = day * 48 + slot, day 0 = Sunday, slot k = minutes k*30 up to
 // (k+1)*30.  Entry 336 is never set: the wake-up scans visit it as the
 // week's end, so a locked host wakes at the week boundary at the latest.
+#include <algorithm>
 #include <cstdio>
 #include <cstring>
 #include <ctime>
@@ -63,10 +64,12 @@ void fill_grid(int* grid, int start, int end, const char* first_day, const char*
   int from = time_slot(start);
   int to = time_slot(end);
   for (int d = first; d <= last; d++) {
-    for (int k = from; k < to; k++) {
-      int n = d * kSlotsPerDay + k;
-      if (n >= 0 && n < RJ_WEEK) grid[n] = 1;
-    }
+    // Out-of-range times run into the neighbouring days of the grid; only
+    // the part inside the week is visited (a hostile file could name
+    // billions of slots).
+    long long lo = std::max<long long>(from, -static_cast<long long>(d) * kSlotsPerDay);
+    long long hi = std::min<long long>(to, static_cast<long long>(RJ_WEEK) - d * kSlotsPerDay);
+    for (long long k = lo; k < hi; k++) grid[d * kSlotsPerDay + k] = 1;
   }
 }
 
