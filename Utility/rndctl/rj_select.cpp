@@ -10,6 +10,7 @@
 #include <fcntl.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <climits>
 #include <cmath>
@@ -66,9 +67,21 @@ struct PickView {
   // Free process slots of this host's resources, asked once each.
   std::unordered_map<Dev*, int> slots;
 
+  // This host's resources (usually one): every resource a record or a job
+  // names comes from the control block's list, so a pointer test will do
+  // where a name compare per entry would cost a string compare each.
+  std::vector<const Dev*> here;
+
+  bool is_here(const Dev* dev) const {
+    return dev != nullptr && std::find(here.begin(), here.end(), dev) != here.end();
+  }
+
   PickView() {
+    for (Dev* d = rndctl.devs; d != nullptr; d = d->next) {
+      if (dev_on_this_host(d)) here.push_back(d);
+    }
     for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
-      if (e->job == nullptr || e->rec == nullptr || !dev_on_this_host(e->rec->dev)) continue;
+      if (e->job == nullptr || e->rec == nullptr || !is_here(e->rec->dev)) continue;
       int s = e->rec->status;
       if (s == TASK_STARTED || s == TASK_RUNNING || s == TASK_FAILED) {
         worked_on.insert({e->job, e->rec->dev});
@@ -120,26 +133,76 @@ FILE* open_stream_file(const char* path) {
 
 // First-match lookup of running-task entries by (job, record id), the
 // question match_a_taskrec answers, for the one place that asks it for
-// every record of the file.
+// every record of the file.  One walk of the list files the entries under
+// their job, in list order; a group then turns its job's entries into a
+// table by id (ids of a job are a short run of numbers), the first entry in
+// list order winning, as in the list walk.  Entries made while the groups
+// are worked through are filed under their job too.
 class EntryIndex {
  public:
   EntryIndex() {
-    for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) add(e);
-  }
-  void add(TASK* e) {
-    if (e->rec != nullptr)
-      map_.emplace(std::make_pair(static_cast<const Job*>(e->job), e->rec->id), e);
-  }
-  TASK* find(const Job* job, int id) const {
-    auto it = map_.find({job, id});
-    if (it == map_.end()) return nullptr;
-    // An entry may have lost its record since it was indexed.
-    TASK* e = it->second;
-    return e->rec != nullptr && e->rec->id == id ? e : nullptr;
+    for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
+      if (e->rec != nullptr) by_job_[e->job].push_back(e);
+    }
   }
 
+  /// Narrows the search to one job's entries.
+  void select(const Job* job) {
+    entries_ = &by_job_[job];
+    table_.clear();
+    sorted_.clear();
+    base_ = 0;
+    if (entries_->empty()) return;
+    int lo = INT_MAX, hi = INT_MIN;
+    for (TASK* e : *entries_) {
+      lo = std::min(lo, e->rec->id);
+      hi = std::max(hi, e->rec->id);
+    }
+    int64_t span = static_cast<int64_t>(hi) - lo + 1;
+    if (span <= 4 * static_cast<int64_t>(entries_->size()) + 64) {
+      base_ = lo;
+      table_.assign(static_cast<size_t>(span), nullptr);
+      for (TASK* e : *entries_) {
+        TASK*& slot = table_[static_cast<size_t>(e->rec->id - lo)];
+        if (slot == nullptr) slot = e;
+      }
+    } else {
+      // Ids scattered far apart: a damaged or hand-made file.
+      sorted_ = *entries_;
+      std::stable_sort(sorted_.begin(), sorted_.end(),
+                       [](const TASK* a, const TASK* b) { return a->rec->id < b->rec->id; });
+    }
+    indexed_ = entries_->size();
+  }
+
+  TASK* find(int id) const {
+    if (!table_.empty()) {
+      int64_t at = static_cast<int64_t>(id) - base_;
+      if (at >= 0 && at < static_cast<int64_t>(table_.size())) {
+        TASK* e = table_[static_cast<size_t>(at)];
+        if (e != nullptr) return e;
+      }
+    } else if (!sorted_.empty()) {
+      auto it = std::lower_bound(sorted_.begin(), sorted_.end(), id,
+                                 [](const TASK* e, int i) { return e->rec->id < i; });
+      if (it != sorted_.end() && (*it)->rec->id == id) return *it;
+    }
+    for (size_t i = indexed_; i < entries_->size(); ++i) {
+      if ((*entries_)[i]->rec->id == id) return (*entries_)[i];
+    }
+    return nullptr;
+  }
+
+  /// A new entry of the selected job.
+  void add(TASK* e) { entries_->push_back(e); }
+
  private:
-  std::unordered_map<std::pair<const Job*, int>, TASK*, PairHash<const Job*, int>> map_;
+  std::unordered_map<const Job*, std::vector<TASK*>> by_job_;
+  std::vector<TASK*>* entries_ = nullptr;
+  size_t indexed_ = 0;
+  int base_ = 0;
+  std::vector<TASK*> table_;
+  std::vector<TASK*> sorted_;
 };
 
 }  // namespace
@@ -257,8 +320,9 @@ TASK* Task_get() {
   for (TaskGroup* g = groups; g != nullptr; g = g->next) {
     Job* job = g->job;
     int uses_host = isa_job_using_host(host, job);
+    index.select(job);
     for (TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
-      TASK* e = index.find(job, rec->id);
+      TASK* e = index.find(rec->id);
       if (e == nullptr) {
         e = Task_add(job, rec);  // the entry owns the record from now on
         if (e != nullptr) index.add(e);

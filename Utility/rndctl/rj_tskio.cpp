@@ -15,6 +15,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <climits>
 #include <cmath>
@@ -89,6 +90,15 @@ class TokenSource {
   bool next_int(int* out) {
     const char* t = next();
     if (t == nullptr) return false;
+    // Plain decimal numbers of up to nine digits cannot overflow: done here.
+    const char* d = t + (*t == '-' || *t == '+');
+    int digits = 0;
+    int v9 = 0;
+    while (d[digits] >= '0' && d[digits] <= '9' && digits < 10) v9 = v9 * 10 + (d[digits++] - '0');
+    if (digits > 0 && digits < 10 && d[digits] == '\0') {
+      *out = *t == '-' ? -v9 : v9;
+      return true;
+    }
     char* stop = nullptr;
     errno = 0;
     long v = strtol(t, &stop, 10);
@@ -156,7 +166,33 @@ class TokenSource {
 // Formatting into a buffer, with the exact output of "%d" and of "%f" of a
 // float promoted to double.
 
-void append_int(std::string& out, int value) {
+// A growable text buffer written through a pointer: the writer formats
+// every number of a file of many thousand records, and appending character
+// by character to a std::string costs a capacity check each.
+class TextOut {
+ public:
+  /// Room for at least `n` more characters; write them, then commit().
+  char* room(size_t n) {
+    if (used_ + n > text_.size()) text_.resize(std::max(text_.size() * 2, used_ + n + 4096));
+    return text_.data() + used_;
+  }
+  void commit(char* end) { used_ = static_cast<size_t>(end - text_.data()); }
+  void put(const char* s) {
+    size_t n = strlen(s);
+    char* p = room(n);
+    memcpy(p, s, n);
+    commit(p + n);
+  }
+  const char* data() const { return text_.data(); }
+  size_t size() const { return used_; }
+
+ private:
+  std::string text_;
+  size_t used_ = 0;
+};
+
+// "%d" into p (room for 11 characters); returns the end.
+char* put_int(char* p, int value) {
   char digits[16];
   int n = 0;
   unsigned u = value < 0 ? 0u - static_cast<unsigned>(value) : static_cast<unsigned>(value);
@@ -164,41 +200,55 @@ void append_int(std::string& out, int value) {
     digits[n++] = static_cast<char>('0' + u % 10);
     u /= 10;
   } while (u != 0);
-  if (value < 0) out.push_back('-');
-  while (n > 0) out.push_back(digits[--n]);
+  if (value < 0) *p++ = '-';
+  while (n > 0) *p++ = digits[--n];
+  return p;
 }
 
-void append_fixed6(std::string& out, double value) {
-  // Exact when value * 10^6 is a whole number below 2^50: the product is
-  // then computed exactly (or within a rounding error far below the last
-  // printed digit), which covers every frame number with at most six
-  // decimals.  Anything else goes through the C library.
+constexpr size_t kFixed6Room = 32;  // the fast path's longest text, with sign
+
+// "%f" of value into p, which has room for kFixed6Room characters.  Exact
+// when value * 10^6 is a whole number below 2^50: the product is then
+// computed exactly (or within a rounding error far below the last printed
+// digit), which covers every frame number with at most six decimals.  For
+// anything else returns null and the caller asks the C library.
+char* put_fixed6_fast(char* p, double value) {
   double scaled = value * 1e6;
-  if (std::isfinite(scaled) && std::fabs(scaled) < 1125899906842624.0 &&
-      scaled == std::floor(scaled)) {
-    int64_t s = static_cast<int64_t>(std::fabs(scaled));
-    if (std::signbit(value)) out.push_back('-');
-    int64_t whole = s / 1000000;
-    int64_t frac = s % 1000000;
-    char digits[24];
-    int n = 0;
-    do {
-      digits[n++] = static_cast<char>('0' + whole % 10);
-      whole /= 10;
-    } while (whole != 0);
-    while (n > 0) out.push_back(digits[--n]);
-    out.push_back('.');
-    char f[6];
-    for (int i = 5; i >= 0; --i) {
-      f[i] = static_cast<char>('0' + frac % 10);
-      frac /= 10;
-    }
-    out.append(f, 6);
+  if (!(std::fabs(scaled) < 1125899906842624.0) || scaled != std::floor(scaled)) return nullptr;
+  int64_t s = static_cast<int64_t>(std::fabs(scaled));
+  if (std::signbit(value)) *p++ = '-';
+  int64_t whole = s / 1000000;
+  int64_t frac = s % 1000000;
+  char digits[24];
+  int n = 0;
+  do {
+    digits[n++] = static_cast<char>('0' + whole % 10);
+    whole /= 10;
+  } while (whole != 0);
+  while (n > 0) *p++ = digits[--n];
+  *p++ = '.';
+  for (int i = 5; i >= 0; --i) {
+    p[i] = static_cast<char>('0' + frac % 10);
+    frac /= 10;
+  }
+  return p + 6;
+}
+
+void put_fixed6(TextOut& out, double value) {
+  char* p = out.room(kFixed6Room);
+  if (char* end = put_fixed6_fast(p, value)) {
+    out.commit(end);
     return;
   }
   char buffer[512];
-  int n = snprintf(buffer, sizeof buffer, "%f", value);
-  if (n > 0) out.append(buffer, static_cast<size_t>(n) < sizeof buffer ? n : sizeof buffer - 1);
+  snprintf(buffer, sizeof buffer, "%f", value);
+  out.put(buffer);
+}
+
+void put_literal(TextOut& out, const char* s, size_t n) {
+  char* p = out.room(n);
+  memcpy(p, s, n);
+  out.commit(p + n);
 }
 
 // ---------------------------------------------------------------------------
@@ -231,6 +281,9 @@ GroupRead read_group(TokenSource& in, TaskGroup** out, bool* more) {
     group = TaskGroup_alloc(job, next_id);
     if (group == nullptr) return GroupRead::kEnd;
   }
+  // Records are linked here at the tail as they come, rather than by
+  // TaskRec_alloc, which looks for the tail from the head each time.
+  TaskRec** tail = group != nullptr ? &group->tasks : nullptr;
 
   for (int i = 0; i < numrecs; ++i) {
     // A record begins with its id.  Anything else means the group line
@@ -251,13 +304,16 @@ GroupRead read_group(TokenSource& in, TaskGroup** out, bool* more) {
       return GroupRead::kEnd;
     }
     if (group == nullptr) continue;
-    TaskRec* rec = TaskRec_alloc(group, start, end, current, Dev_by_index(dev_index), TASK_PENDING,
-                                 status, id);
+    TaskRec* rec = TaskRec_alloc(nullptr, start, end, current, Dev_by_index(dev_index),
+                                 TASK_PENDING, status, id);
     if (rec == nullptr) {
       *out = group;
       return GroupRead::kEnd;
     }
+    rec->group = group;
     rec->retries = retries;
+    *tail = rec;
+    tail = &rec->next;
   }
   *out = group;
   *more = true;
@@ -287,34 +343,49 @@ TaskGroup* read_all(TokenSource& in) {
 // ---------------------------------------------------------------------------
 // Writing groups.
 
-void format_group(std::string& out, const TaskGroup* group, int numrecs) {
-  out.push_back('\n');
-  out.append(group->job->name.or_else("(null)"));
-  out.append("\t ");
-  append_int(out, group->job->index);
-  out.append("\t ");
-  append_int(out, numrecs);
-  out.append("\t ");
-  append_int(out, group->next_task_id);
-  out.push_back('\n');
+void format_group(TextOut& out, const TaskGroup* group, int numrecs) {
+  put_literal(out, "\n", 1);
+  out.put(group->job->name.or_else("(null)"));
+  char* p = out.room(48);
+  *p++ = '\t';
+  *p++ = ' ';
+  p = put_int(p, group->job->index);
+  *p++ = '\t';
+  *p++ = ' ';
+  p = put_int(p, numrecs);
+  *p++ = '\t';
+  *p++ = ' ';
+  p = put_int(p, group->next_task_id);
+  *p++ = '\n';
+  out.commit(p);
 }
 
-void format_record(std::string& out, const TaskRec* rec) {
-  out.push_back('\t');
-  append_int(out, rec->id);
-  out.append("\t ");
-  append_fixed6(out, rec->start);
-  out.append("\t ");
-  append_fixed6(out, rec->end);
-  out.append("\t ");
-  append_fixed6(out, rec->current);
-  out.append("  ");
-  append_int(out, rec->dev != nullptr ? rec->dev->index : 0);
-  out.append("\t ");
-  append_int(out, rec->retries);
-  out.push_back('\t');
-  out.append(GetTaskStatusStr(rec->status));
-  out.push_back('\n');
+void format_record(TextOut& out, const TaskRec* rec) {
+  char* p = out.room(16);
+  *p++ = '\t';
+  p = put_int(p, rec->id);
+  *p++ = '\t';
+  *p++ = ' ';
+  out.commit(p);
+  put_fixed6(out, rec->start);
+  put_literal(out, "\t ", 2);
+  put_fixed6(out, rec->end);
+  put_literal(out, "\t ", 2);
+  put_fixed6(out, rec->current);
+  p = out.room(64);
+  *p++ = ' ';
+  *p++ = ' ';
+  p = put_int(p, rec->dev != nullptr ? rec->dev->index : 0);
+  *p++ = '\t';
+  *p++ = ' ';
+  p = put_int(p, rec->retries);
+  *p++ = '\t';
+  const char* name = GetTaskStatusStr(rec->status);
+  size_t n = strlen(name);
+  memcpy(p, name, n);  // status names are at most 8 characters
+  p += n;
+  *p++ = '\n';
+  out.commit(p);
 }
 
 // The daemon-alive test: the pid file names the daemon of a host.
@@ -571,14 +642,13 @@ TaskGroup* Task_read(FILE* fp) {
   return read_all(in);
 }
 
-int TaskGroup_write(FILE* fp, TaskGroup* group) {
-  if (fp == nullptr || group == nullptr || group->tasks == nullptr || group->job == nullptr) {
-    return 0;
-  }
+namespace {
+
+// Appends the group's text; false when the group is not written at all.
+bool append_group(TextOut& out, const TaskGroup* group) {
+  if (group == nullptr || group->tasks == nullptr || group->job == nullptr) return false;
   int numrecs = 0;
   for (TaskRec* rec = group->tasks; rec != nullptr; rec = rec->next) ++numrecs;
-  std::string out;
-  out.reserve(64 + 72 * static_cast<size_t>(numrecs));
   format_group(out, group, numrecs);
   for (TaskRec* rec = group->tasks; rec != nullptr; rec = rec->next) {
     format_record(out, rec);
@@ -588,18 +658,32 @@ int TaskGroup_write(FILE* fp, TaskGroup* group) {
              GetTaskStatusStr(rec->status));
     }
   }
-  if (fwrite(out.data(), 1, out.size(), fp) != out.size()) {
-    perror("in TaskGroup_write");
-    return -1;
-  }
-  return 1;
+  return true;
+}
+
+bool write_text(FILE* fp, const TextOut& text) {
+  if (fwrite(text.data(), 1, text.size(), fp) == text.size()) return true;
+  perror("in TaskGroup_write");
+  return false;
+}
+
+}  // namespace
+
+int TaskGroup_write(FILE* fp, TaskGroup* group) {
+  if (fp == nullptr) return 0;
+  TextOut out;
+  if (!append_group(out, group)) return 0;
+  return write_text(fp, out) ? 1 : -1;
 }
 
 int Task_write(FILE* fp, TaskGroup* groups) {
   dbgpnt("Task_write--------------------------------------\n");
-  for (TaskGroup* g = groups; g != nullptr; g = g->next) {
-    if (TaskGroup_write(fp, g) < 0) return -1;
-  }
+  if (fp == nullptr) return -1;
+  // The whole file in one write: the stream is line-buffered, and a write
+  // per group costs a system call each on a file of thousands of groups.
+  TextOut out;
+  for (TaskGroup* g = groups; g != nullptr; g = g->next) append_group(out, g);
+  if (!write_text(fp, out)) return -1;
   dbgpnt("Task_write---------------------------------done\n\n");
   return 0;
 }
