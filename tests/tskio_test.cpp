@@ -364,22 +364,6 @@ TEST_F(TaskFileTest, EntriesLeaveTheListWithTheirRecords) {
   TaskGroup_free_all(&groups);
 }
 
-TEST(TaskStatus, NamesAndCodes) {
-  const char* names[] = {"PENDING", "CRASHED", "RUNNING", "FINISHED",
-                         "ABORTED", "FAILED",  "STARTED", "STOPPED"};
-  for (int i = 0; i < 8; ++i) {
-    int code = -1;
-    EXPECT_EQ(ISA_task_status(names[i], &code), 1);
-    EXPECT_EQ(code, i);
-    EXPECT_STREQ(GetTaskStatusStr(i), names[i]);
-  }
-  int code = 4;
-  EXPECT_EQ(ISA_task_status("pending", &code), 0);
-  EXPECT_EQ(code, 4);
-  EXPECT_EQ(ISA_task_status(nullptr, &code), 0);
-  EXPECT_EQ(task_status_table[8], nullptr);
-}
-
 // --- Status files -----------------------------------------------------------
 
 TEST_F(TaskFileTest, StatusFileListsThisHostsLiveEntries) {
