@@ -459,10 +459,11 @@ TaskGroup* get_highest_taskgroup(TaskGroup* groups, int mode) {
   TaskGroup* chosen = nullptr;
   for (TaskGroup* g = groups; g != nullptr; g = g->next) {
     Job* job = g->job;
-    // Any non-zero answer lets the job through, a paused one included.  It
-    // is asked once per job: the answer could only change if the clock
-    // crossed a half-hour mark during the walk.
-    if (job == nullptr || job->resources == nullptr || !Job_available(job)) continue;
+    // Only a job that may be worked on now (2) is taken: a paused one (1)
+    // keeps what it has but starts nothing new, as its owner asked.  It is
+    // asked once per job: the answer could only change if the clock crossed
+    // a half-hour mark during the walk.
+    if (job == nullptr || job->resources == nullptr || Job_available(job) != 2) continue;
     for (RndDevList* e = job->resources; e != nullptr; e = e->next) {
       if (!dev_on_host(e->dev, host)) continue;
       if (mode != 2 && already_worked_on(job, e->dev)) {

@@ -221,4 +221,19 @@ TEST_F(RenderTest, AScheduledJobStartsOnlyInItsHours) {
   EXPECT_TRUE(exists(image("nightly", 2)));
 }
 
+TEST_F(RenderTest, APausedJobStartsNothingUntilItIsReleased) {
+  JobSpec paused = job("held", 1, 1, 2);
+  paused.ctrl = "PAUSED";
+  JobSpec ordinary = job("ordinary", 2, 1, 2);
+  ordinary.priority = 1;
+  Daemon& d = start({here(3, 1)}, {paused, ordinary});
+  ASSERT_TRUE(status_becomes(d, "ordinary", "finished")) << d.log();
+  EXPECT_FALSE(exists(image("held", 1)));
+  EXPECT_EQ(job_status(farm_, "held"), "pending");
+
+  ASSERT_TRUE(edit_job_file(farm_, "\tctrl\t\t= PAUSED;\n", "", host_));
+  ASSERT_TRUE(status_becomes(d, "held", "finished")) << d.log();
+  EXPECT_TRUE(exists(image("held", 2)));
+}
+
 }  // namespace
