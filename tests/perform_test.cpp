@@ -1,6 +1,6 @@
 // Starting render programs: real children, real files.  The "render
 // programs" are small shell scripts on PATH that report what they were given.
-#include <fcntl.h>
+#include <gmock/gmock.h>
 #include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -9,60 +9,31 @@
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
-#include <ostream>
-#include <sstream>
 #include <string>
-#include <utility>
-#include <vector>
 
 #include "tests/support/task_fixture.h"
 
 namespace {
 
 // Only shell builtins read /proc: a forking shell blocks every signal for a
-// moment, and an outside reader could catch it in that window.
+// moment, and an outside reader could catch it in that window.  The first
+// line is the command line as "prog|arg|arg...".
 constexpr const char* kReporter =
     "#!/bin/sh\n"
+    "printf '%s' \"${0##*/}\"; for a in \"$@\"; do printf '|%s' \"$a\"; done; echo\n"
     "while read -r key value; do\n"
     "  case \"$key\" in SigBlk:|SigIgn:) echo \"$key $value\";; esac\n"
     "done < /proc/$$/status\n"
-    "echo \"prog=${0##*/}\"\n"
     "echo \"cwd=$(pwd -P)\"\n"
-    "for a in \"$@\"; do echo \"arg=$a\"; done\n"
     "echo \"search=[$ZARNO_PIX_SEARCHPATH]\"\n"
     "read -r stat < /proc/$$/stat; set -- $stat; echo \"pid=$$ pgid=$5\"\n"
     "echo 'pix.0001 r 5 of 10' >&2\n";
 
-struct Report {
-  std::string prog;
-  std::string cwd;
-  std::vector<std::string> args;
-  std::string search;
-  std::string text;
-};
-
 // The hexadecimal mask after `key` in a /proc status text; all ones when absent.
 unsigned long long signal_mask(const std::string& text, const char* key) {
   size_t at = text.find(key);
-  if (at == std::string::npos) return ~0ULL;
-  return strtoull(text.c_str() + at + strlen(key), nullptr, 16);
+  return at == std::string::npos ? ~0ULL : strtoull(text.c_str() + at + strlen(key), nullptr, 16);
 }
-
-Report parse_report(const std::string& text) {
-  Report r;
-  r.text = text;
-  std::istringstream in(text);
-  std::string line;
-  while (std::getline(in, line)) {
-    if (line.rfind("prog=", 0) == 0) r.prog = line.substr(5);
-    if (line.rfind("cwd=", 0) == 0) r.cwd = line.substr(4);
-    if (line.rfind("arg=", 0) == 0) r.args.push_back(line.substr(4));
-    if (line.rfind("search=", 0) == 0) r.search = line.substr(7);
-  }
-  return r;
-}
-
-std::string real(const std::string& p) { return std::filesystem::canonical(p).string(); }
 
 class PerformTest : public TaskFixture {
  protected:
@@ -70,9 +41,8 @@ class PerformTest : public TaskFixture {
     TaskFixture::SetUp();
     mkdir_p("bin");
     for (const char* name : {"shadepass", "glintcast", "glintwalk", "myrender"}) {
-      std::string script = path(std::string("bin/") + name);
       write_file(std::string("bin/") + name, kReporter);
-      chmod(script.c_str(), 0755);
+      chmod(path(std::string("bin/") + name).c_str(), 0755);
     }
     const char* old = getenv("PATH");
     old_path_ = old != nullptr ? old : "";
@@ -84,14 +54,14 @@ class PerformTest : public TaskFixture {
     TaskFixture::TearDown();
   }
 
-  /// Starts the entry's render program, waits for it and reads its stdout.
-  Report perform(TASK* entry) {
+  /// Starts the entry's render program, waits for it and returns its stdout.
+  std::string perform(TASK* entry) {
     entry->stream_path.set(path("stream").c_str());
     EXPECT_EQ(Perform_a_Task(entry), 1);
     EXPECT_GE(entry->pid, 2);
     int status = wait_for(entry->pid);
     EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
-    return parse_report(read_text_file(entry->out_path.c_str()));
+    return read_text_file(entry->out_path.c_str());
   }
 
   std::string old_path_;
@@ -108,7 +78,6 @@ struct ArgCase {
   float start, end;
   const char* argv;  // joined by '|'; $PIX, $MATTE, $SDL stand for the job's paths
 };
-void PrintTo(const ArgCase& c, std::ostream* os) { *os << c.label; }
 
 class PerformArgs : public PerformTest, public testing::WithParamInterface<ArgCase> {};
 
@@ -125,7 +94,7 @@ TEST_P(PerformArgs, BuildsTheProgramsArgumentList) {
     job_->ext_by = 10;
     job_->ext_size = 4;
   }
-  Report r = perform(add_entry(job_, dev_, c.start, c.end, TASK_STARTED));
+  std::string out = perform(add_entry(job_, dev_, c.start, c.end, TASK_STARTED));
 
   std::string expected = c.argv;
   for (auto [key, value] : {std::pair{"$PIX", job_->pix.c_str()},
@@ -134,29 +103,19 @@ TEST_P(PerformArgs, BuildsTheProgramsArgumentList) {
     size_t at = expected.find(key);
     if (at != std::string::npos) expected.replace(at, strlen(key), value);
   }
-  std::string got = r.prog;
-  for (const std::string& a : r.args) got += "|" + a;
-  EXPECT_EQ(got, expected) << r.text;
+  EXPECT_EQ(out.substr(0, out.find('\n')), expected) << out;
 }
 
 // clang-format off
 INSTANTIATE_TEST_SUITE_P(Programs, PerformArgs, testing::Values(
-    ArgCase{"edgepass_runs_shadepass_verbose", "edgepass", 1, 0, 0, 1, nullptr, 1, 3,
-            "shadepass|-V|-p|$PIX|-A|-s|1.000000|-e|3.000000|-b|1.000000|-E|1|$SDL"},
-    ArgCase{"glintcast_gets_processors", "glintcast", 1, 0, 0, 1, nullptr, 4, 4,
-            "glintcast|-n4|-p|$PIX|-A|-s|4.000000|-e|4.000000|-b|1.000000|-E|1|$SDL"},
-    ArgCase{"glintwalk_gets_processors", "glintwalk", 1, 0, 0, 0, nullptr, 1, 1,
-            "glintwalk|-n4|-p|$PIX|-A|$SDL"},
-    ArgCase{"mask_and_options_as_one_argument", "myrender", 1, 0, 1, 0, "-q  high", 1, 1,
-            "myrender|-p|$PIX|-m|$MATTE|-A|-q  high|$SDL"},
-    ArgCase{"options_of_blanks_only_are_dropped", "myrender", 1, 0, 0, 0, "   ", 1, 1,
-            "myrender|-p|$PIX|-A|$SDL"},
-    ArgCase{"half_step_numbers_the_frames", "myrender", 0.5f, 0, 0, 1, nullptr, 2, 3,
-            "myrender|-p|$PIX|-A|-s|2.000000|-e|3.000000|-b|0.500000|-S|3|-B|1|-E|1|$SDL"},
-    ArgCase{"whole_step_keeps_frame_numbers", "myrender", 2, 0, 0, 1, nullptr, 3, 7,
-            "myrender|-p|$PIX|-A|-s|3.000000|-e|7.000000|-b|2.000000|-E|1|$SDL"},
-    ArgCase{"job_extension_numbers", "myrender", 1, 1, 0, 1, nullptr, 4, 6,
-            "myrender|-p|$PIX|-A|-s|4.000000|-e|6.000000|-b|1.000000|-S|130|-B|10|-E|4|$SDL"}),
+    ArgCase{"edgepass_runs_shadepass_verbose", "edgepass", 1, 0, 0, 1, nullptr, 1, 3, "shadepass|-V|-p|$PIX|-A|-s|1.000000|-e|3.000000|-b|1.000000|-E|1|$SDL"},
+    ArgCase{"glintcast_gets_processors", "glintcast", 1, 0, 0, 1, nullptr, 4, 4, "glintcast|-n4|-p|$PIX|-A|-s|4.000000|-e|4.000000|-b|1.000000|-E|1|$SDL"},
+    ArgCase{"glintwalk_gets_processors", "glintwalk", 1, 0, 0, 0, nullptr, 1, 1, "glintwalk|-n4|-p|$PIX|-A|$SDL"},
+    ArgCase{"mask_and_options_as_one_argument", "myrender", 1, 0, 1, 0, "-q  high", 1, 1, "myrender|-p|$PIX|-m|$MATTE|-A|-q  high|$SDL"},
+    ArgCase{"options_of_blanks_only_are_dropped", "myrender", 1, 0, 0, 0, "   ", 1, 1, "myrender|-p|$PIX|-A|$SDL"},
+    ArgCase{"half_step_numbers_the_frames", "myrender", 0.5f, 0, 0, 1, nullptr, 2, 3, "myrender|-p|$PIX|-A|-s|2.000000|-e|3.000000|-b|0.500000|-S|3|-B|1|-E|1|$SDL"},
+    ArgCase{"whole_step_keeps_frame_numbers", "myrender", 2, 0, 0, 1, nullptr, 3, 7, "myrender|-p|$PIX|-A|-s|3.000000|-e|7.000000|-b|2.000000|-E|1|$SDL"},
+    ArgCase{"job_extension_numbers", "myrender", 1, 1, 0, 1, nullptr, 4, 6, "myrender|-p|$PIX|-A|-s|4.000000|-e|6.000000|-b|1.000000|-S|130|-B|10|-E|4|$SDL"}),
     [](const testing::TestParamInfo<ArgCase>& info) { return std::string(info.param.label); });
 // clang-format on
 
@@ -172,52 +131,39 @@ TEST_F(PerformTest, RenderProgramRunsInProjectDirWithItsOwnStreamsGroupAndSignal
   sigaddset(&block, SIGALRM);
   sigaddset(&block, SIGCHLD);
   sigprocmask(SIG_BLOCK, &block, &saved);
-  struct sigaction ignore {
-  }, saved_hup{};
-  ignore.sa_handler = SIG_IGN;
-  sigaction(SIGHUP, &ignore, &saved_hup);
+  void (*saved_hup)(int) = signal(SIGHUP, SIG_IGN);
   std::string cwd_before = std::filesystem::current_path().string();
-
-  entry->stream_path.set(path("stream").c_str());
   int running_before = rndctl.running;
-  ASSERT_EQ(Perform_a_Task(entry), 1);
-  int pid = entry->pid;
-  int status = wait_for(pid);
+  std::string out = perform(entry);
   sigprocmask(SIG_SETMASK, &saved, nullptr);
-  sigaction(SIGHUP, &saved_hup, nullptr);
+  signal(SIGHUP, saved_hup);
 
-  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
   EXPECT_EQ(rndctl.running, running_before + 1);
   EXPECT_EQ(std::filesystem::current_path().string(), cwd_before);
   EXPECT_EQ(dev_->last_task, entry);
   EXPECT_STREQ(entry->out_path.c_str(), path("pix/out.img.testhost.render1.0").c_str());
-
-  Report r = parse_report(read_text_file(entry->out_path.c_str()));
-  EXPECT_EQ(r.cwd, real(path("proj")));
-  EXPECT_EQ(r.search, "[ /maps/a /maps/b]");
-  std::string group = "pid=" + std::to_string(pid) + " pgid=" + std::to_string(pid) + "\n";
-  EXPECT_NE(r.text.find(group), std::string::npos) << r.text;
+  using testing::HasSubstr;
+  EXPECT_THAT(out, HasSubstr("cwd=" + std::filesystem::canonical(path("proj")).string() + "\n"));
+  EXPECT_THAT(out, HasSubstr("search=[ /maps/a /maps/b]\n"));
+  const std::string pid = std::to_string(entry->pid);
+  EXPECT_THAT(out, HasSubstr("pid=" + pid + " pgid=" + pid + "\n"));
   // The standard signals only: 32 and 33 belong to the C library, which
   // lets no program change them, so a test runner may hand them down ignored.
-  EXPECT_EQ(signal_mask(r.text, "SigBlk:") & 0x7fffffffULL, 0ULL) << r.text;
-  EXPECT_EQ(signal_mask(r.text, "SigIgn:") & 0x7fffffffULL, 0ULL) << r.text;
+  EXPECT_EQ(signal_mask(out, "SigBlk:") & 0x7fffffffULL, 0ULL) << out;
+  EXPECT_EQ(signal_mask(out, "SigIgn:") & 0x7fffffffULL, 0ULL) << out;
   EXPECT_EQ(read_file("stream"), "pix.0001 r 5 of 10\n");
 }
 
 TEST_F(PerformTest, PixWithoutDirectoryWritesOutputBesideTheProgramAndCountsUp) {
   job_->pix.set("img");
   job_->animate = 0;
-  TASK* entry = add_entry(job_, dev_, 1, 1, TASK_STARTED);
-  entry->stream_path.set(path("stream").c_str());
   rndctl.out_counter = INT_MAX;
-  ASSERT_EQ(Perform_a_Task(entry), 1);
-  wait_for(entry->pid);
+  std::string out = perform(add_entry(job_, dev_, 1, 1, TASK_STARTED));
   // Beside the program, in the project directory, where the daemon finds it
   // too.
-  EXPECT_EQ(entry->out_path.c_str(), path("proj") + "/./out.img.testhost.render1.2147483647");
+  EXPECT_EQ(read_file("proj/out.img.testhost.render1.2147483647"), out);
+  EXPECT_EQ(out.rfind("myrender|", 0), 0u) << out;
   EXPECT_EQ(rndctl.out_counter, 0);
-  Report r = parse_report(read_file("proj/out.img.testhost.render1.2147483647"));
-  EXPECT_EQ(r.prog, "myrender");
 }
 
 TEST_F(PerformTest, ExecFailureIsReportedInBothFilesAndEndsWith255) {
@@ -226,8 +172,7 @@ TEST_F(PerformTest, ExecFailureIsReportedInBothFilesAndEndsWith255) {
   int pid = rj_system(argv, path("stream").c_str(), path("out").c_str(), job_);
   ASSERT_GT(pid, 0);
   int status = wait_for(pid);
-  ASSERT_TRUE(WIFEXITED(status));
-  EXPECT_EQ(WEXITSTATUS(status), 255);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 255) << status;
   const char* message =
       "system(\"no_such_render_program\") failed at exec <No such file or directory>\n";
   EXPECT_EQ(read_file("out"), message);
