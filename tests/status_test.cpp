@@ -7,7 +7,6 @@
 
 #include <cstdio>
 #include <filesystem>
-#include <ostream>
 #include <string>
 
 #include "tests/support/task_fixture.h"
@@ -16,11 +15,14 @@ namespace {
 
 bool exists(const std::string& p) { return std::filesystem::exists(p); }
 
+// Names parameterised cases by their label.
+constexpr auto label_of = [](const auto& info) { return std::string(info.param.label); };
+
 class StatusTest : public TaskFixture {
  protected:
   /// An entry whose stream reads the file "stream" of the control directory.
-  TASK* entry_with_stream(float start, float end, int status = TASK_RUNNING) {
-    TASK* entry = add_entry(job_, dev_, start, end, status);
+  TASK* entry_with_stream(float start, float end) {
+    TASK* entry = add_entry(job_, dev_, start, end, TASK_RUNNING);
     write_file("stream", "");
     entry->stream_path.set(path("stream").c_str());
     entry->stream = fopen(entry->stream_path.c_str(), "r");
@@ -32,17 +34,22 @@ class StatusTest : public TaskFixture {
     fputs(text.c_str(), fp);
     fclose(fp);
   }
-  /// A child that waits to be killed.
-  static int sleeper() {
-    int pid = fork();
-    if (pid == 0) {
+  /// The entry's render program: a child that waits to be killed.
+  static void give_sleeper(TASK* entry) {
+    entry->pid = fork();
+    if (entry->pid == 0)
       for (;;) pause();
-    }
-    return pid;
+  }
+  static void expect_killed(int pid) {
+    int status = wait_for(pid);
+    EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL) << status;
+  }
+  static Dev* other_host() {
+    Dev* other = Dev_new(nullptr, nullptr, "render2", 2);
+    other->host_name.set("otherhost");
+    return other;
   }
 };
-
-// --- Progress reading --------------------------------------------------------
 
 struct ProgressCase {
   const char* label;
@@ -55,7 +62,6 @@ struct ProgressCase {
   float progress;
   const char* output;  // null: none
 };
-void PrintTo(const ProgressCase& c, std::ostream* os) { *os << c.label; }
 
 class Progress : public StatusTest, public testing::WithParamInterface<ProgressCase> {};
 
@@ -77,32 +83,21 @@ TEST_P(Progress, LastProgressLineSetsFrameAndPercentage) {
   EXPECT_EQ(set_image_percentage_done(entry), 0);
 }
 
-INSTANTIATE_TEST_SUITE_P(
-    Lines, Progress,
-    testing::Values(
-        // Frame 3 of 1..10 in progress: current is that frame, not the next.
-        ProgressCase{"third_frame", "pix.0003 r 10 of 100\n", 1, 0, 1, 10, 1, 3, 30.8f, "pix.0003"},
-        ProgressCase{"first_frame_stays_at_start", "pix.0001 r 50 of 100\n", 1, 0, 1, 10, 1, 1,
-                     14.8f, "pix.0001"},
-        ProgressCase{"finished_frame_moves_on", "pix.0003 r 102 of 100\n", 1, 0, 1, 10, 1, 4, 40,
-                     "pix.0003"},
-        ProgressCase{"never_past_the_end", "pix.0003 r 102 of 100\n", 1, 0, 1, 3, 1, 3, 133.33333f,
-                     "pix.0003"},
-        ProgressCase{"line_zero_is_the_frames_last", "pix.0003 r 0 of 100\n", 1, 0, 1, 10, 1, 3,
-                     39.8f, "pix.0003"},
-        ProgressCase{"only_the_last_line_counts",
-                     "pix.0002 r 10 of 100\npix.0004 r 20 of 100\nnoblanks\n", 1, 0, 1, 10, 1, 4,
-                     41.8f, "pix.0004"},
-        ProgressCase{"other_text_last_changes_nothing",
-                     "pix.0003 r 10 of 100\nError: frame 4 did not build\n", 1, 0, 1, 10, 0, 1, 0,
-                     nullptr},
-        ProgressCase{"letter_other_than_r_changes_nothing", "pix.0004 w 10 of 100\n", 1, 0, 1, 10,
-                     0, 1, 0, nullptr},
-        ProgressCase{"step_two_counts_frames", "pix.0005 r 10 of 100\n", 2, 0, 1, 9, 1, 5, 61.6f,
-                     "pix.0005"},
-        ProgressCase{"job_extension_numbers", "pix.0140 r 10 of 100\n", 1, 1, 4, 6, 1, 5, 69.33333f,
-                     "pix.0140"}),
-    [](const testing::TestParamInfo<ProgressCase>& info) { return std::string(info.param.label); });
+// Frame 3 of 1..10 in progress: current is that frame, not the next.
+// clang-format off
+INSTANTIATE_TEST_SUITE_P(Lines, Progress, testing::Values(
+    ProgressCase{"third_frame", "pix.0003 r 10 of 100\n", 1, 0, 1, 10, 1, 3, 30.8f, "pix.0003"},
+    ProgressCase{"first_frame_stays_at_start", "pix.0001 r 50 of 100\n", 1, 0, 1, 10, 1, 1, 14.8f, "pix.0001"},
+    ProgressCase{"finished_frame_moves_on", "pix.0003 r 102 of 100\n", 1, 0, 1, 10, 1, 4, 40, "pix.0003"},
+    ProgressCase{"never_past_the_end", "pix.0003 r 102 of 100\n", 1, 0, 1, 3, 1, 3, 133.33333f, "pix.0003"},
+    ProgressCase{"line_zero_is_the_frames_last", "pix.0003 r 0 of 100\n", 1, 0, 1, 10, 1, 3, 39.8f, "pix.0003"},
+    ProgressCase{"only_the_last_line_counts", "pix.0002 r 10 of 100\npix.0004 r 20 of 100\nnoblanks\n", 1, 0, 1, 10, 1, 4, 41.8f, "pix.0004"},
+    ProgressCase{"other_text_last_changes_nothing", "pix.0003 r 10 of 100\nError: frame 4 did not build\n", 1, 0, 1, 10, 0, 1, 0, nullptr},
+    ProgressCase{"letter_other_than_r_changes_nothing", "pix.0004 w 10 of 100\n", 1, 0, 1, 10, 0, 1, 0, nullptr},
+    ProgressCase{"step_two_counts_frames", "pix.0005 r 10 of 100\n", 2, 0, 1, 9, 1, 5, 61.6f, "pix.0005"},
+    ProgressCase{"job_extension_numbers", "pix.0140 r 10 of 100\n", 1, 1, 4, 6, 1, 5, 69.33333f, "pix.0140"}),
+    label_of);
+// clang-format on
 
 TEST_F(StatusTest, HalfWrittenProgressLineWaitsForItsEnd) {
   TASK* entry = entry_with_stream(1, 10);
@@ -115,76 +110,61 @@ TEST_F(StatusTest, HalfWrittenProgressLineWaitsForItsEnd) {
   EXPECT_STREQ(entry->output.c_str(), "pix.0005");
 }
 
-// --- Status changes ----------------------------------------------------------
-
 TEST_F(StatusTest, AbortingARunningTaskKillsItsProcessAndDropsTheStream) {
   TASK* entry = entry_with_stream(1, 10);
   entry->output.set("pix.0001");
-  int pid = sleeper();
-  entry->pid = pid;
+  give_sleeper(entry);
+  int pid = entry->pid;
   EXPECT_EQ(SetTaskStatus(entry, TASK_ABORTED), 1);
-  int status = wait_for(pid);
-  EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL);
+  expect_killed(pid);
   EXPECT_EQ(entry->rec->status, TASK_ABORTED);
   EXPECT_EQ(entry->pid, 0);
   EXPECT_EQ(entry->stream, nullptr);
-  EXPECT_TRUE(entry->stream_path.none());
-  EXPECT_TRUE(entry->output.none());
+  EXPECT_TRUE(entry->stream_path.none() && entry->output.none());
   EXPECT_FALSE(exists(path("stream")));
 }
 
 TEST_F(StatusTest, SameStatusAgainRewritesTheTaskFileAndReportsNoChange) {
-  write_file("Render_Tasks",
-             "\nscene.sdl\t 1\t 1\t 1\n\t0\t 1.000000\t 10.000000\t 1.000000  1\t 0\tRUNNING\n");
+  const std::string head = "\nscene.sdl\t 1\t 1\t 1\n\t0\t 1.000000\t 10.000000\t ";
+  write_file("Render_Tasks", head + "1.000000  1\t 0\tRUNNING\n");
   TASK* entry = add_entry(job_, dev_, 1, 10, TASK_RUNNING);
   entry->rec->current = 4;
   EXPECT_EQ(SetTaskStatus(entry, TASK_RUNNING), 0);
-  EXPECT_EQ(read_file("Render_Tasks"),
-            "\nscene.sdl\t 1\t 1\t 1\n\t0\t 1.000000\t 10.000000\t 4.000000  1\t 0\tRUNNING\n");
+  EXPECT_EQ(read_file("Render_Tasks"), head + "4.000000  1\t 0\tRUNNING\n");
   EXPECT_EQ(SetTaskStatus(entry, TASK_FAILED), 1);
-  EXPECT_NE(read_file("Render_Tasks").find("4.000000  1\t 0\tFAILED\n"), std::string::npos);
+  EXPECT_EQ(read_file("Render_Tasks"), head + "4.000000  1\t 0\tFAILED\n");
 }
 
 TEST_F(StatusTest, StartedTaskTurnsRunningOnlyOnItsOwnHost) {
-  Dev* other = Dev_new(nullptr, nullptr, "render2", 2);
-  other->host_name.set("otherhost");
   TASK* mine = add_entry(job_, dev_, 1, 3, TASK_STARTED, 0);
-  TASK* theirs = add_entry(job_, other, 4, 6, TASK_STARTED, 1);
+  TASK* theirs = add_entry(job_, other_host(), 4, 6, TASK_STARTED, 1);
   TASK* waiting = add_entry(job_, dev_, 7, 9, TASK_STARTED, 2);
   mine->pid = 4242;  // any pid of 2 or more counts as a process
-  TaskRec* mine_rec = mine->rec;
-  TaskRec* theirs_rec = theirs->rec;
-  TaskRec* waiting_rec = waiting->rec;
-
+  TaskRec* recs[3] = {mine->rec, theirs->rec, waiting->rec};
   EXPECT_EQ(ISA_task_running(theirs), 1);
   EXPECT_EQ(ISA_task_running(waiting), 0);
   EXPECT_EQ(UpdateRunningTasks(), 1);
-  EXPECT_EQ(mine_rec->status, TASK_RUNNING);
-  EXPECT_EQ(theirs_rec->status, TASK_STARTED);
-  EXPECT_EQ(waiting_rec->status, TASK_STARTED);
+  EXPECT_EQ(recs[0]->status, TASK_RUNNING);
+  EXPECT_EQ(recs[1]->status, TASK_STARTED);
+  EXPECT_EQ(recs[2]->status, TASK_STARTED);
   mine->pid = 0;  // no process to be killed by the fixture's cleanup
 }
 
 TEST_F(StatusTest, AbortedJobStopsThisHostsTasksAndOthersPendingOnes) {
-  Dev* other = Dev_new(nullptr, nullptr, "render2", 2);
-  other->host_name.set("otherhost");
+  Dev* other = other_host();
   job_->status.set("aborted");
   TASK* running = add_entry(job_, dev_, 1, 3, TASK_RUNNING, 0);
   TASK* pending = add_entry(job_, other, 4, 6, TASK_PENDING, 1);
   TASK* started = add_entry(job_, other, 7, 9, TASK_STARTED, 2);
-  int pid = sleeper();
-  running->pid = pid;
+  give_sleeper(running);
+  int pid = running->pid;
   TaskRec* recs[3] = {running->rec, pending->rec, started->rec};
-
   EXPECT_EQ(UpdateRunningTasks(), 1);  // the other host's STARTED task
-  int status = wait_for(pid);
-  EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL);
+  expect_killed(pid);
   EXPECT_EQ(recs[0]->status, TASK_ABORTED);
   EXPECT_EQ(recs[1]->status, TASK_ABORTED);
   EXPECT_EQ(recs[2]->status, TASK_STARTED);
 }
-
-// --- Judging ended processes -------------------------------------------------
 
 struct EndCase {
   const char* label;
@@ -193,7 +173,6 @@ struct EndCase {
   int status;
   bool out_kept;
 };
-void PrintTo(const EndCase& c, std::ostream* os) { *os << c.label; }
 
 class EndOfProcess : public StatusTest, public testing::WithParamInterface<EndCase> {};
 
@@ -222,7 +201,7 @@ INSTANTIATE_TEST_SUITE_P(
                     EndCase{"clean_exit_keeps_saved_output", 0, 1, TASK_FINISHED, true},
                     EndCase{"exit_one_fails", 1, 0, TASK_FAILED, false},
                     EndCase{"killed_fails_keeping_saved_output", 9, 1, TASK_FAILED, true}),
-    [](const testing::TestParamInfo<EndCase>& info) { return std::string(info.param.label); });
+    label_of);
 
 TEST_F(StatusTest, FailedTaskOfThisHostsJobEndsInTheJobFileWithItsError) {
   // The resource is named after the host, as the reload matches them.
@@ -247,8 +226,6 @@ TEST_F(StatusTest, FailedTaskOfThisHostsJobEndsInTheJobFileWithItsError) {
   EXPECT_NE(read_file("JOBLOG/scene.sdl").find("\t FAILED  10\n"), std::string::npos);
 }
 
-// --- Error record ------------------------------------------------------------
-
 struct ErrorCase {
   const char* label;
   int waitstatus;
@@ -256,7 +233,6 @@ struct ErrorCase {
   const char* old_comment;
   const char* comment;
 };
-void PrintTo(const ErrorCase& c, std::ostream* os) { *os << c.label; }
 
 class ErrorRecord : public StatusTest, public testing::WithParamInterface<ErrorCase> {};
 
@@ -271,19 +247,14 @@ TEST_P(ErrorRecord, ReasonPilesUpInTheComment) {
   EXPECT_STREQ(job_->comment.c_str(), c.comment);
 }
 
-INSTANTIATE_TEST_SUITE_P(
-    Reasons, ErrorRecord,
-    testing::Values(ErrorCase{"first_error_line_wins", 1, "a\nparse error at 3\nb Error\n", nullptr,
-                              "ERROR: render1 (testhost) frame 2.5\nparse error at 3\n\n \n"},
-                    ErrorCase{"last_line_when_nothing_matches", 0, "one\ntwo\n", "old\n",
-                              "old\nERROR: render1 (testhost) frame 2.5\ntwo\n\n \n"},
-                    ErrorCase{"empty_log_unknown_reason", 1, "", nullptr,
-                              "ERROR: render1 (testhost) frame 2.5\nQuit for Unknown reasons\n \n"},
-                    ErrorCase{"signal_reason_skips_the_log", 9, "parse error\n", nullptr,
-                              "ERROR: render1 (testhost) frame 2.5\nSIGKILL (Killed)\n\n \n"}),
-    [](const testing::TestParamInfo<ErrorCase>& info) { return std::string(info.param.label); });
-
-// --- Job state -----------------------------------------------------------------
+// clang-format off
+INSTANTIATE_TEST_SUITE_P(Reasons, ErrorRecord, testing::Values(
+    ErrorCase{"first_error_line_wins", 1, "a\nparse error at 3\nb Error\n", nullptr, "ERROR: render1 (testhost) frame 2.5\nparse error at 3\n\n \n"},
+    ErrorCase{"last_line_when_nothing_matches", 0, "one\ntwo\n", "old\n", "old\nERROR: render1 (testhost) frame 2.5\ntwo\n\n \n"},
+    ErrorCase{"empty_log_unknown_reason", 1, "", nullptr, "ERROR: render1 (testhost) frame 2.5\nQuit for Unknown reasons\n \n"},
+    ErrorCase{"signal_reason_skips_the_log", 9, "parse error\n", nullptr, "ERROR: render1 (testhost) frame 2.5\nSIGKILL (Killed)\n\n \n"}),
+    label_of);
+// clang-format on
 
 struct StateCase {
   const char* label;
@@ -292,7 +263,6 @@ struct StateCase {
   int ctrl;
   const char* expected;
 };
-void PrintTo(const StateCase& c, std::ostream* os) { *os << c.label; }
 
 class JobState : public StatusTest, public testing::WithParamInterface<StateCase> {};
 
@@ -306,10 +276,7 @@ TEST_P(JobState, TasksDecideTheJobsStatusText) {
     TASK* entry = add_entry(job_, dev_, static_cast<float>(i * 2 + 1),
                             static_cast<float>(i * 2 + 2), c.statuses[i], static_cast<int>(i));
     entry->rec->retries = 10;
-    if (c.statuses[i] == TASK_RUNNING) {
-      entry->rec->current = entry->rec->start;
-      entry->progress = 50.0f;
-    }
+    if (c.statuses[i] == TASK_RUNNING) entry->progress = 50.0f;
   }
   UpdateJobState(job_);
   EXPECT_STREQ(job_->status.c_str(), c.expected);
@@ -327,7 +294,7 @@ INSTANTIATE_TEST_SUITE_P(Masks, JobState, testing::Values(
     StateCase{"restarted_keeps_its_text", {TASK_FINISHED, TASK_PENDING}, "restarted", RUN_AVAILABLE, "restarted"},
     StateCase{"restarted_with_pending_only", {TASK_PENDING}, "restarted", RUN_AVAILABLE, "pending"},
     StateCase{"no_tasks_restarted_job", {}, "restarted", RUN_AVAILABLE, "pending"}),
-    [](const testing::TestParamInfo<StateCase>& info) { return std::string(info.param.label); });
+    label_of);
 // clang-format on
 
 TEST_F(StatusTest, FinishedJobWritesItsLogAndClearsItsTasks) {
@@ -338,10 +305,8 @@ TEST_F(StatusTest, FinishedJobWritesItsLogAndClearsItsTasks) {
   utimensat(AT_FDCWD, path("testhost.pid").c_str(), long_ago, 0);
   int64_t before = daemon_updatetime_get("testhost");
   RndDevList_add(job_, dev_);
-  TASK* a = add_entry(job_, dev_, 1, 5, TASK_FINISHED, 0);
-  TASK* b = add_entry(job_, nullptr, 6, 10, TASK_FINISHED, 1);
-  b->rec->retries = 2;
-  ASSERT_NE(a, nullptr);
+  add_entry(job_, dev_, 1, 5, TASK_FINISHED, 0);
+  add_entry(job_, nullptr, 6, 10, TASK_FINISHED, 1)->rec->retries = 2;
 
   UpdateJobState(job_);
   EXPECT_STREQ(job_->status.c_str(), "finished");
@@ -349,20 +314,18 @@ TEST_F(StatusTest, FinishedJobWritesItsLogAndClearsItsTasks) {
   EXPECT_EQ(rndctl.tasks, nullptr);
   EXPECT_EQ(job_->deleted, 1);
   EXPECT_NE(daemon_updatetime_get("testhost"), before);
-  const std::string sdl = path("proj/sdl/scene.sdl");
+  const char* first_task = "\t0\t 1.000000 - 5.000000\t1 - 5\t render1\t FINISHED  0\n";
   EXPECT_EQ(read_file("JOBLOG/scene.sdl"),
-            "scene.sdl 1 using the shadepass\n\tsdl = \"" + sdl +
-                "\"\n"
-                "\tframes = 1.000000 to 10.000000 by 1.000000\n"
-                "  no extension set\n"
-                "\t0\t 1.000000 - 5.000000\t1 - 5\t render1\t FINISHED  0\n"
-                "\t1\t 6.000000 - 10.000000\t6 - 10\t nodev\t FINISHED  2\n");
+            "scene.sdl 1 using the shadepass\n\tsdl = \"" + path("proj/sdl/scene.sdl") +
+                "\"\n\tframes = 1.000000 to 10.000000 by 1.000000\n  no extension set\n" +
+                first_task + "\t1\t 6.000000 - 10.000000\t6 - 10\t nodev\t FINISHED  2\n");
 
+  // Reopened, the log is read from its first task line.
   FILE* log = Logfile_open(job_);
   ASSERT_NE(log, nullptr);
   char line[120];
   ASSERT_NE(fgets(line, sizeof line, log), nullptr);
-  EXPECT_STREQ(line, "\t0\t 1.000000 - 5.000000\t1 - 5\t render1\t FINISHED  0\n");
+  EXPECT_STREQ(line, first_task);
   fclose(log);
 }
 
