@@ -1,6 +1,5 @@
 // Job and resource records and the pick lists between them.
 #include <cstdlib>
-#include <ostream>
 #include <string>
 #include <vector>
 
@@ -8,51 +7,47 @@
 
 namespace {
 
-std::vector<int> job_order() {
+template <class T>
+std::vector<int> order(T* head) {
   std::vector<int> v;
-  for (Job* j = rndctl.jobs; j != nullptr; j = j->next) v.push_back(j->index);
-  return v;
-}
-
-std::vector<int> dev_order() {
-  std::vector<int> v;
-  for (Dev* d = rndctl.devs; d != nullptr; d = d->next) v.push_back(d->index);
+  for (; head != nullptr; head = head->next) v.push_back(head->index);
   return v;
 }
 
 // Back links must mirror forward links, or deletes corrupt the list.
-void expect_links_consistent() {
-  Job* prev = nullptr;
-  for (Job* j = rndctl.jobs; j != nullptr; prev = j, j = j->next) EXPECT_EQ(j->prev, prev);
-  Dev* dprev = nullptr;
-  for (Dev* d = rndctl.devs; d != nullptr; dprev = d, d = d->next) EXPECT_EQ(d->prev, dprev);
+template <class T>
+void expect_back_links(T* head) {
+  for (T* prev = nullptr; head != nullptr; prev = head, head = head->next) {
+    EXPECT_EQ(head->prev, prev);
+  }
 }
 
 class RecordsTest : public ControlDirTest {};
 
 }  // namespace
 
-TEST_F(RecordsTest, NewJobDefaults) {
+TEST_F(RecordsTest, NewRecordsTakeTheirNamesFromWhatTheyAreGiven) {
+  // A job is named after its scene file; without a path it has neither.
   Job* job = Job_new(nullptr, nullptr, "/proj/sdl/ball.sdl", 12);
-  ASSERT_NE(job, nullptr);
   EXPECT_STREQ(job->name.c_str(), "ball.sdl");
   EXPECT_STREQ(job->sdl.c_str(), "/proj/sdl/ball.sdl");
-  EXPECT_STREQ(job->status.c_str(), "none");
-  EXPECT_STREQ(job->pix.c_str(), "./pix_file");
-  EXPECT_STREQ(job->matte.c_str(), "./matte_file");
-  EXPECT_EQ(job->index, 12);
-  EXPECT_EQ(job->use_sdl_paths, 1);
-  EXPECT_EQ(job->ctrl, RUN_AVAILABLE);
-
-  // Without a path: no name, no scene, still taking paths from the scene.
+  EXPECT_STREQ(Job_new(nullptr, nullptr, "shot", 14)->name.c_str(), "shot");
   Job* bare = Job_new(nullptr, nullptr, nullptr, 13);
-  ASSERT_NE(bare, nullptr);
-  EXPECT_TRUE(bare->name.none());
-  EXPECT_TRUE(bare->sdl.none());
-  EXPECT_EQ(bare->use_sdl_paths, 1);
+  EXPECT_TRUE(bare->name.none() && bare->sdl.none());
 
-  Job* plain = Job_new(nullptr, nullptr, "shot", 14);
-  EXPECT_STREQ(plain->name.c_str(), "shot");
+  // The editor's placeholder resource name gets the index; others are kept.
+  // The remote directory follows the temporary-directory setting.
+  setenv("DRCTMPDIR", "/scratch/tmp", 1);
+  Dev* dev = Dev_new(nullptr, nullptr, "new_resource", 7);
+  unsetenv("DRCTMPDIR");
+  EXPECT_STREQ(dev->name.c_str(), "new_resource_7");
+  EXPECT_EQ(Dev_by_name("new_resource_7"), dev);
+  EXPECT_STREQ(dev->host_name.c_str(), "testhost");
+  EXPECT_STREQ(dev->remote_location.c_str(), "/scratch/tmp");
+  Dev* other = Dev_new(nullptr, nullptr, "new_resourceX", 8);
+  EXPECT_STREQ(other->name.c_str(), "new_resourceX");
+  EXPECT_STREQ(other->remote_location.c_str(), "/usr/tmp");
+  EXPECT_TRUE(Dev_new(nullptr, nullptr, nullptr, 9)->name.none());
 }
 
 TEST_F(RecordsTest, JobListOrderInsertAndDelete) {
@@ -60,17 +55,17 @@ TEST_F(RecordsTest, JobListOrderInsertAndDelete) {
   Job* b = Job_new(nullptr, nullptr, "b", 2);
   Job_new(a, nullptr, "head", 3);  // before the head: becomes the head
   Job_new(b, nullptr, "mid", 4);   // before an inner job
-  EXPECT_EQ(job_order(), (std::vector<int>{3, 1, 4, 2}));
-  expect_links_consistent();
+  EXPECT_EQ(order(rndctl.jobs), (std::vector<int>{3, 1, 4, 2}));
+  expect_back_links(rndctl.jobs);
 
   // Deleting returns the job before, else the one after.
   EXPECT_EQ(Job_del(b)->index, 4);
   EXPECT_EQ(Job_del(rndctl.jobs)->index, 1);  // the head: its successor
-  EXPECT_EQ(job_order(), (std::vector<int>{1, 4}));
-  expect_links_consistent();
+  EXPECT_EQ(order(rndctl.jobs), (std::vector<int>{1, 4}));
+  expect_back_links(rndctl.jobs);
   // Appending after deletes lands at the real tail.
   Job_new(nullptr, nullptr, "c", 5);
-  EXPECT_EQ(job_order(), (std::vector<int>{1, 4, 5}));
+  EXPECT_EQ(order(rndctl.jobs), (std::vector<int>{1, 4, 5}));
   Job_del(Job_by_index(5));
   Job_del(Job_by_index(4));
   EXPECT_EQ(Job_del(rndctl.jobs), nullptr);  // the only job
@@ -105,32 +100,13 @@ TEST_F(RecordsTest, AddFindsByIndexAndLookupsReturnFirstMatch) {
   EXPECT_EQ(Job_by_listitem(item), listed);
 }
 
-TEST_F(RecordsTest, NewResourceDefaultsAndNumbering) {
-  setenv("DRCTMPDIR", "/scratch/tmp", 1);
-  Dev* dev = Dev_new(nullptr, nullptr, "new_resource", 7);
-  unsetenv("DRCTMPDIR");
-  ASSERT_NE(dev, nullptr);
-  EXPECT_STREQ(dev->name.c_str(), "new_resource_7");
-  EXPECT_EQ(Dev_by_name("new_resource_7"), dev);
-  EXPECT_STREQ(dev->host_name.c_str(), "testhost");
-  EXPECT_STREQ(dev->remote_location.c_str(), "/scratch/tmp");
-  EXPECT_EQ(dev->status, LOCK_SCHEDULE);
-  EXPECT_EQ(dev->max_frames, 4);
-  EXPECT_EQ(dev->num_processors, 0);
-
-  Dev* other = Dev_new(nullptr, nullptr, "new_resourceX", 8);
-  EXPECT_STREQ(other->name.c_str(), "new_resourceX");
-  EXPECT_STREQ(other->remote_location.c_str(), "/usr/tmp");
-  EXPECT_TRUE(Dev_new(nullptr, nullptr, nullptr, 9)->name.none());
-}
-
 TEST_F(RecordsTest, ResourceListAndRename) {
   Dev* a = Add_a_dev(nullptr, "a", 1);
   Dev* b = Add_a_dev(nullptr, "b", 2);
   EXPECT_EQ(Add_a_dev(nullptr, "zz", 1), a);
   Dev* head = Insert_a_dev(a, nullptr, "head", 3);
-  EXPECT_EQ(dev_order(), (std::vector<int>{3, 1, 2}));
-  expect_links_consistent();
+  EXPECT_EQ(order(rndctl.devs), (std::vector<int>{3, 1, 2}));
+  expect_back_links(rndctl.devs);
 
   Dev_set_name(b, "a");  // two resources called a: the first wins
   EXPECT_EQ(Dev_by_name("a"), a);
@@ -192,38 +168,25 @@ TEST_F(RecordsTest, ManyJobsOnOneResourceKeepOrder) {
   Job_del(Job_by_index(200));
   Job_del(Job_by_index(100));
   RndDevList_add(Job_new(nullptr, nullptr, "j", 201), host);
+  expect_back_links(host->jobs);
   std::vector<int> seen;
-  RndJobList* prev = nullptr;
-  for (RndJobList* e = host->jobs; e != nullptr; prev = e, e = e->next) {
-    ASSERT_EQ(e->prev, prev);
-    seen.push_back(e->job->index);
-  }
+  for (RndJobList* e = host->jobs; e != nullptr; e = e->next) seen.push_back(e->job->index);
   ASSERT_EQ(seen.size(), 199u);
   EXPECT_EQ(seen[98], 99);
   EXPECT_EQ(seen[99], 101);
   EXPECT_EQ(seen.back(), 201);
 }
 
-struct StateWord {
-  const char* word;
-  int run;
-  int lock;
-};
-
-void PrintTo(const StateWord& w, std::ostream* os) {
-  *os << (w.word != nullptr ? w.word : "(none)");
+TEST(StateWords, DecodeCaseSensitively) {
+  struct {
+    const char* word;
+    int run, lock;
+  } const words[] = {{nullptr, 0, 0},     {"", 0, 0},         {"PAUSED", 1, 0}, {"paused", 0, 0},
+                     {"AVAILABLE", 2, 2}, {"SCHEDULE", 3, 3}, {"NOW", 4, 0},    {"LOCKED", 0, 1},
+                     {"Locked", 0, 0},    {"NOW ", 0, 0}};
+  for (const auto& w : words) {
+    SCOPED_TRACE(w.word != nullptr ? w.word : "(none)");
+    EXPECT_EQ(Job_get_runstate(w.word), w.run);
+    EXPECT_EQ(Dev_get_lockstate(w.word), w.lock);
+  }
 }
-
-class StateWords : public testing::TestWithParam<StateWord> {};
-
-TEST_P(StateWords, DecodeCaseSensitively) {
-  EXPECT_EQ(Job_get_runstate(GetParam().word), GetParam().run);
-  EXPECT_EQ(Dev_get_lockstate(GetParam().word), GetParam().lock);
-}
-
-INSTANTIATE_TEST_SUITE_P(Words, StateWords,
-                         testing::Values(StateWord{nullptr, 0, 0}, StateWord{"", 0, 0},
-                                         StateWord{"PAUSED", 1, 0}, StateWord{"paused", 0, 0},
-                                         StateWord{"AVAILABLE", 2, 2}, StateWord{"SCHEDULE", 3, 3},
-                                         StateWord{"NOW", 4, 0}, StateWord{"LOCKED", 0, 1},
-                                         StateWord{"Locked", 0, 0}, StateWord{"NOW ", 0, 0}));
