@@ -5,52 +5,40 @@
 #include <unistd.h>
 
 #include <cstdlib>
-#include <functional>
+#include <cstring>
 #include <optional>
-#include <ostream>
 #include <string>
 
 #include "tests/support/test_support.h"
 
 namespace {
 
-std::string make_temp_dir() {
-  const char* tmp = getenv("TMPDIR");
-  std::string templ = std::string(tmp != nullptr ? tmp : "/tmp") + "/pst_test_XXXXXX";
-  char* made = mkdtemp(templ.data());
-  return made != nullptr ? made : "";
+std::optional<std::string> get_env(const char* name) {
+  const char* v = getenv(name);
+  return v != nullptr ? std::optional<std::string>(v) : std::nullopt;
 }
 
-// Keeps an environment variable and puts it back at the end of the test.
-class SavedEnv {
- public:
-  explicit SavedEnv(const char* name) : name_(name) {
-    if (const char* v = getenv(name)) value_ = v;
+void restore_env(const char* name, const std::optional<std::string>& v) {
+  if (v) {
+    setenv(name, v->c_str(), 1);
+  } else {
+    unsetenv(name);
   }
-  ~SavedEnv() {
-    if (value_) {
-      setenv(name_, value_->c_str(), 1);
-    } else {
-      unsetenv(name_);
-    }
-  }
-
- private:
-  const char* name_;
-  std::optional<std::string> value_;
-};
+}
 
 std::string prefs_line(const std::string& name, const std::string& value) {
   return name + " \"" + value + "\"\n";
 }
 
+// A user's home and a site directory of its own; the environment points at
+// them for the test and is put back afterwards.
 class PstTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    home_ = make_temp_dir();
-    site_ = make_temp_dir();
-    ASSERT_FALSE(home_.empty());
-    ASSERT_FALSE(site_.empty());
+    for (std::string* dir : {&home_, &site_}) {
+      *dir = testing::TempDir() + "pst_test_XXXXXX";
+      ASSERT_NE(mkdtemp(dir->data()), nullptr);
+    }
     setenv("HOME", home_.c_str(), 1);
     setenv("ZARNO_LOCATION", site_.c_str(), 1);
     pst_reset_cache();
@@ -59,45 +47,23 @@ class PstTest : public ::testing::Test {
     pst_reset_cache();
     remove_tree(home_);
     remove_tree(site_);
+    restore_env("HOME", saved_home_);
+    restore_env("ZARNO_LOCATION", saved_location_);
   }
 
-  void write_user(const std::string& content) {
-    ASSERT_TRUE(write_text_file(home_ + "/.ZarnoPrefs", content));
-    ASSERT_EQ(chmod((home_ + "/.ZarnoPrefs").c_str(), 0644), 0);
+  static void write_prefs(const std::string& dir, const std::string& content, mode_t mode = 0644) {
+    ASSERT_TRUE(write_text_file(dir + "/.ZarnoPrefs", content));
+    ASSERT_EQ(chmod((dir + "/.ZarnoPrefs").c_str(), mode), 0);
   }
-  void write_site(const std::string& content, mode_t mode = 0644) {
-    std::string p = site_ + "/.ZarnoPrefs";
-    ASSERT_TRUE(write_text_file(p, content));
-    ASSERT_EQ(chmod(p.c_str(), mode), 0);
-  }
-  std::string lookup(const char* name) {
+  static std::string lookup(const char* name) {
     const char* v = get_zarno_variable(name);
     return v != nullptr ? v : "(null)";
   }
 
-  SavedEnv saved_home_{"HOME"};
-  SavedEnv saved_location_{"ZARNO_LOCATION"};
-  std::string home_;
-  std::string site_;
+  const std::optional<std::string> saved_home_ = get_env("HOME");
+  const std::optional<std::string> saved_location_ = get_env("ZARNO_LOCATION");
+  std::string home_, site_;
 };
-
-// Runs `check` in a child that cannot override file permissions, so that a
-// read-only file is read-only for it.  The child's exit code is the answer.
-void expect_unprivileged(const std::function<bool()>& check, const std::string& dirs) {
-  pid_t child = fork();
-  ASSERT_GE(child, 0);
-  if (child == 0) {
-    if (geteuid() == 0) {
-      if (setgid(65534) != 0 || setuid(65534) != 0) _exit(2);
-    }
-    _exit(check() ? 0 : 1);
-  }
-  int status = 0;
-  ASSERT_EQ(waitpid(child, &status, 0), child);
-  ASSERT_TRUE(WIFEXITED(status));
-  if (WEXITSTATUS(status) == 2) GTEST_SKIP() << "cannot drop privileges to test " << dirs;
-  EXPECT_EQ(WEXITSTATUS(status), 0) << dirs;
-}
 
 struct Files {
   const char* name;
@@ -106,23 +72,28 @@ struct Files {
   const char* expected;
 };
 
-void PrintTo(const Files& f, std::ostream* os) { *os << f.name; }
-
 class PrefsFileTest : public PstTest, public ::testing::WithParamInterface<Files> {};
 
 TEST_P(PrefsFileTest, WritableSiteFileElseTheUsersElseTheSiteFile) {
   const Files& f = GetParam();
-  write_site(prefs_line("ZARNO_RNDCTL_LOCATION", "/site/ctl"), f.site_mode);
-  if (f.user_file) write_user(prefs_line("ZARNO_RNDCTL_LOCATION", "/user/ctl"));
+  write_prefs(site_, prefs_line("ZARNO_RNDCTL_LOCATION", "/site/ctl"), f.site_mode);
+  if (f.user_file) write_prefs(home_, prefs_line("ZARNO_RNDCTL_LOCATION", "/user/ctl"));
   ASSERT_EQ(chmod(home_.c_str(), 0755), 0);
   ASSERT_EQ(chmod(site_.c_str(), 0755), 0);
-  const std::string expected = f.expected;
-  expect_unprivileged(
-      [&] {
-        const char* v = get_zarno_variable("ZARNO_RNDCTL_LOCATION");
-        return v != nullptr && expected == v;
-      },
-      home_ + " " + site_);
+  // Looked up in a child that cannot override file permissions, so that a
+  // read-only file is read-only for it; its exit code is the answer.
+  pid_t child = fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    if (geteuid() == 0 && (setgid(65534) != 0 || setuid(65534) != 0)) _exit(2);
+    const char* v = get_zarno_variable("ZARNO_RNDCTL_LOCATION");
+    _exit(v != nullptr && strcmp(v, f.expected) == 0 ? 0 : 1);
+  }
+  int status = 0;
+  ASSERT_EQ(waitpid(child, &status, 0), child);
+  ASSERT_TRUE(WIFEXITED(status));
+  if (WEXITSTATUS(status) == 2) GTEST_SKIP() << "cannot drop privileges";
+  EXPECT_EQ(WEXITSTATUS(status), 0);
 }
 
 INSTANTIATE_TEST_SUITE_P(Choices, PrefsFileTest,
@@ -137,8 +108,6 @@ struct Expansion {
   std::string expected;  // "(null)" for no value
 };
 
-void PrintTo(const Expansion& e, std::ostream* os) { *os << e.name; }
-
 class ExpansionTest : public PstTest, public ::testing::WithParamInterface<Expansion> {};
 
 TEST_P(ExpansionTest, ExpandsFromTheEnvironment) {
@@ -146,7 +115,7 @@ TEST_P(ExpansionTest, ExpandsFromTheEnvironment) {
   setenv("PST_EMPTY", "", 1);
   setenv("PST_LONG", std::string(200, 'L').c_str(), 1);
   unsetenv("UNSET_VAR");
-  write_site(prefs_line("V", GetParam().value));
+  write_prefs(site_, prefs_line("V", GetParam().value));
   std::string expected = GetParam().expected;
   for (size_t at; (at = expected.find("<HOME>")) != std::string::npos;) {
     expected.replace(at, 6, home_);
@@ -169,7 +138,7 @@ INSTANTIATE_TEST_SUITE_P(
     [](const auto& info) { return std::string(info.param.name); });
 
 TEST_F(PstTest, UnknownVariableAndUnreadableFileYieldNull) {
-  write_site(prefs_line("KNOWN", "yes"));
+  write_prefs(site_, prefs_line("KNOWN", "yes"));
   EXPECT_EQ(lookup("UNKNOWN"), "(null)");
   EXPECT_EQ(get_zarno_variable(nullptr), nullptr);
 
