@@ -11,25 +11,13 @@
 #include <string>
 #include <vector>
 
+#include "tests/support/task_text.h"
 #include "tests/support/test_support.h"
 
 namespace {
 
 // Monday 2024-01-01 09:00 UTC.
 time_t monday_0900() { return 1704099600; }
-
-std::string group_line(const std::string& name, int index, int numrecs, int next_id) {
-  char b[256];
-  snprintf(b, sizeof b, "\t %d\t %d\t %d\n", index, numrecs, next_id);
-  return "\n" + name + b;
-}
-
-std::string rec_line(int id, float start, float end, float current, int dev, int retries,
-                     const std::string& status) {
-  char b[512];
-  snprintf(b, sizeof b, "\t%d\t %f\t %f\t %f  %d\t %d\t", id, start, end, current, dev, retries);
-  return b + status + "\n";
-}
 
 /// The task file text of the one job "scene.sdl" with `n` records.
 std::string scene(int n, const std::string& records) {

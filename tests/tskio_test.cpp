@@ -12,22 +12,10 @@
 #include <string>
 #include <vector>
 
+#include "tests/support/task_text.h"
 #include "tests/support/test_support.h"
 
 namespace {
-
-std::string group_line(const std::string& name, int index, int numrecs, int next_id) {
-  char b[256];
-  snprintf(b, sizeof b, "\t %d\t %d\t %d\n", index, numrecs, next_id);
-  return "\n" + name + b;
-}
-
-std::string rec_line(int id, float start, float end, float current, int dev, int retries,
-                     const std::string& status) {
-  char b[512];
-  snprintf(b, sizeof b, "\t%d\t %f\t %f\t %f  %d\t %d\t", id, start, end, current, dev, retries);
-  return b + status + "\n";
-}
 
 std::string write_groups(TaskGroup* groups) {
   char* buf = nullptr;
