@@ -8,15 +8,17 @@ JOBS ?= $(shell nproc 2>/dev/null || echo 2)
 BUILD ?= build
 FUZZ_SECONDS ?= 60
 
-.PHONY: all deps build test asan fuzz bench demo format clean
+.PHONY: all deps configure build test asan fuzz bench demo format clean
 
 all: build
 
 deps:
 	@tools/install-deps.sh
 
-build: deps
+configure: deps
 	cmake -S . -B $(BUILD) -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
+
+build: configure
 	cmake --build $(BUILD) -j $(JOBS)
 
 test: build
@@ -36,7 +38,9 @@ fuzz:
 bench: build
 	bench/run.sh $(BUILD)
 
-demo: build
+# Only what the demo runs: the daemon and the demo render program.
+demo: configure
+	cmake --build $(BUILD) -j $(JOBS) --target zarno_render_demon frame_painter
 	demo/run.sh $(BUILD)
 
 format:
