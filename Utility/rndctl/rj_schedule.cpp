@@ -113,11 +113,21 @@ void Schedule_dev_lock(Dev* dev, int start, int end, const char* first_day, cons
 }
 
 int Schedule_get_a_block(int* grid, int times[2], const char* days[2]) {
+  // The writer calls this until the grid is empty, and most grids are empty
+  // or nearly so: look at the grid in runs of slots, which the compiler can
+  // test together, before looking for the slot itself.
+  constexpr int kRun = 16;
+  static_assert(RJ_WEEK % kRun == 0);
   int first = -1;
-  for (int n = 0; n < RJ_WEEK; n++) {
-    if (grid[n] != 0) {
-      first = n;
-      break;
+  for (int base = 0; base < RJ_WEEK && first < 0; base += kRun) {
+    int any = 0;
+    for (int k = 0; k < kRun; k++) any |= grid[base + k];
+    if (any == 0) continue;
+    for (int k = 0; k < kRun; k++) {
+      if (grid[base + k] != 0) {
+        first = base + k;
+        break;
+      }
     }
   }
   if (first < 0) return 0;

@@ -3,6 +3,7 @@
 // every line is kept exactly as it has always been written, oddities
 // included (tabs against blanks, the resource comment that nothing reads
 // back, the two-blank default_dev line, the indented resource brace).
+#include <algorithm>
 #include <cmath>
 #include <cstdio>
 #include <cstring>
@@ -16,10 +17,67 @@ const char* truth(int flag) { return flag != 0 ? "TRUE" : "FALSE"; }
 // glibc prints a null "%s" as "(null)"; say so rather than rely on it.
 const char* shown(const Text& text) { return text.or_else("(null)"); }
 
+// The text of a file is put together here and handed to the stream in large
+// pieces: a file of ten thousand jobs is some hundred thousand lines, and one
+// formatted stream call per line costs more than everything else together.
+// Numbers print as "%d" would; the rare general float goes through snprintf.
+class Out {
+ public:
+  explicit Out(FILE* fp) : fp_(fp) {}
+  Out(const Out&) = delete;
+  Out& operator=(const Out&) = delete;
+  ~Out() { flush(); }
+
+  Out& s(const char* text) { return n(text, strlen(text)); }
+  Out& n(const char* text, size_t length) {
+    if (length > sizeof buf_ - used_) {
+      flush();
+      if (length > sizeof buf_) {
+        fwrite(text, 1, length, fp_);
+        return *this;
+      }
+    }
+    memcpy(buf_ + used_, text, length);
+    used_ += length;
+    return *this;
+  }
+  template <size_t N>
+  Out& lit(const char (&text)[N]) {
+    return n(text, N - 1);
+  }
+  Out& d(int value) {
+    char digits[16];
+    char* end = digits + sizeof digits;
+    char* p = end;
+    unsigned u = value < 0 ? 0u - static_cast<unsigned>(value) : static_cast<unsigned>(value);
+    do {
+      *--p = static_cast<char>('0' + u % 10);
+      u /= 10;
+    } while (u != 0);
+    if (value < 0) *--p = '-';
+    return n(p, static_cast<size_t>(end - p));
+  }
+  Out& f(double value) {
+    char text[512];
+    int length = snprintf(text, sizeof text, "%f", value);
+    if (length < 0) return *this;
+    return n(text, std::min(static_cast<size_t>(length), sizeof text - 1));
+  }
+  void flush() {
+    if (used_ > 0) fwrite(buf_, 1, used_, fp_);
+    used_ = 0;
+  }
+
+ private:
+  FILE* fp_;  // not owned
+  size_t used_ = 0;
+  char buf_[16384];
+};
+
 // Writes `keyword` and the blocks of a week grid, or nothing when no half
 // hour is set.  The blocks are taken out of a scratch copy: taking a block
 // clears it, and the record must keep its grid.
-void write_week(FILE* fp, const char* keyword, const int* grid) {
+void write_week(Out& out, const char* keyword, const int* grid) {
   int scratch[RJ_WEEK_SCAN];
   memcpy(scratch, grid, sizeof(int) * RJ_WEEK);
   scratch[RJ_WEEK] = 0;
@@ -28,16 +86,15 @@ void write_week(FILE* fp, const char* keyword, const int* grid) {
   const char* days[2];
   bool first = true;
   while (Schedule_get_a_block(scratch, times, days) != 0) {
-    fputs(first ? keyword : ",\n\t\t", fp);
+    out.s(first ? keyword : ",\n\t\t");
     first = false;
     const char* d0 = days[0] != nullptr ? days[0] : "(null)";
     const char* d1 = days[1] != nullptr ? days[1] : "(null)";
-    if (strcmp(d0, d1) != 0)
-      fprintf(fp, "\t{ %d to %d %s to %s }", times[0], times[1], d0, d1);
-    else
-      fprintf(fp, "\t{ %d to %d %s }", times[0], times[1], d0);
+    out.lit("\t{ ").d(times[0]).lit(" to ").d(times[1]).lit(" ").s(d0);
+    if (strcmp(d0, d1) != 0) out.lit(" to ").s(d1);
+    out.lit(" }");
   }
-  if (!first) fputs(";\n", fp);
+  if (!first) out.lit(";\n");
 }
 
 // Frame numbers are nearly always whole.  For a whole float within int range
@@ -47,109 +104,116 @@ bool whole(float f) {
   return f == std::trunc(f) && std::fabs(f) < 1e9f && !(f == 0.0f && std::signbit(f));
 }
 
-void write_frames(FILE* fp, const float* frames) {
+void write_frames(Out& out, const float* frames) {
+  out.lit("\tframes\t\t= ");
   if (whole(frames[0]) && whole(frames[1]) && whole(frames[2])) {
-    fprintf(fp, "\tframes\t\t= %d.000000, %d.000000, %d.000000;\n", static_cast<int>(frames[0]),
-            static_cast<int>(frames[1]), static_cast<int>(frames[2]));
+    out.d(static_cast<int>(frames[0])).lit(".000000, ");
+    out.d(static_cast<int>(frames[1])).lit(".000000, ");
+    out.d(static_cast<int>(frames[2])).lit(".000000;\n");
   } else {
-    fprintf(fp, "\tframes\t\t= %f, %f, %f;\n", static_cast<double>(frames[0]),
-            static_cast<double>(frames[1]), static_cast<double>(frames[2]));
+    out.f(static_cast<double>(frames[0])).lit(", ");
+    out.f(static_cast<double>(frames[1])).lit(", ");
+    out.f(static_cast<double>(frames[2])).lit(";\n");
   }
 }
 
-void write_job(FILE* fp, const Job* job) {
-  fprintf(fp, "%s %d {\n", shown(job->name), job->index);
-  if (job->comment) fprintf(fp, "\t/*%s*/\n", job->comment.c_str());
-  if (job->lock_pid != 0) fprintf(fp, "\tlock_pid \t= %d;\n", job->lock_pid);
-  if (job->del_when_done != 0) fputs("\tdel_when_done \t= TRUE;\n", fp);
-  if (job->user) fprintf(fp, "\tuser\t \t= %s;\n", job->user.c_str());
-  if (job->status) fprintf(fp, "\tstatus \t\t= \"%s\";\n", job->status.c_str());
-  fprintf(fp, "\tpriority \t= %d;\n", job->priority);
-  if (job->executable) fprintf(fp, "\texecutable \t= %s;\n", job->executable.c_str());
-  if (job->sdl) fprintf(fp, "\tsdl \t\t= \"%s\";\n", job->sdl.c_str());
-  if (job->pix) fprintf(fp, "\tpix \t\t= \"%s\";\n", job->pix.c_str());
-  if (job->matte) fprintf(fp, "\tmatte \t\t= \"%s\";\n", job->matte.c_str());
-  fprintf(fp, "\tuse_sdl_paths = %s;\n\toutput_mask = %s;\n", truth(job->use_sdl_paths),
-          truth(job->output_mask));
+void write_job(Out& out, const Job* job) {
+  out.s(shown(job->name)).lit(" ").d(job->index).lit(" {\n");
+  if (job->comment) out.lit("\t/*").s(job->comment.c_str()).lit("*/\n");
+  if (job->lock_pid != 0) out.lit("\tlock_pid \t= ").d(job->lock_pid).lit(";\n");
+  if (job->del_when_done != 0) out.lit("\tdel_when_done \t= TRUE;\n");
+  if (job->user) out.lit("\tuser\t \t= ").s(job->user.c_str()).lit(";\n");
+  if (job->status) out.lit("\tstatus \t\t= \"").s(job->status.c_str()).lit("\";\n");
+  out.lit("\tpriority \t= ").d(job->priority).lit(";\n");
+  if (job->executable) out.lit("\texecutable \t= ").s(job->executable.c_str()).lit(";\n");
+  if (job->sdl) out.lit("\tsdl \t\t= \"").s(job->sdl.c_str()).lit("\";\n");
+  if (job->pix) out.lit("\tpix \t\t= \"").s(job->pix.c_str()).lit("\";\n");
+  if (job->matte) out.lit("\tmatte \t\t= \"").s(job->matte.c_str()).lit("\";\n");
+  out.lit("\tuse_sdl_paths = ").s(truth(job->use_sdl_paths)).lit(";\n\toutput_mask = ");
+  out.s(truth(job->output_mask)).lit(";\n");
 
   // A still job carries none of the animation group, its run state
   // included: a paused still job comes back from a rewrite unpaused.
   if (job->animate != 0) {
-    fputs("\tanimate\t\t= TRUE;\n", fp);
-    write_frames(fp, job->frames);
-    if (job->extension != 0)
-      fprintf(fp, "\textension\t= %d, %d, %d;\n", job->ext_start, job->ext_by, job->ext_size);
-    if (job->save_out != 0) fputs("\tsave_out\t= TRUE;\n", fp);
+    out.lit("\tanimate\t\t= TRUE;\n");
+    write_frames(out, job->frames);
+    if (job->extension != 0) {
+      out.lit("\textension\t= ").d(job->ext_start).lit(", ").d(job->ext_by).lit(", ");
+      out.d(job->ext_size).lit(";\n");
+    }
+    if (job->save_out != 0) out.lit("\tsave_out\t= TRUE;\n");
     // AVAILABLE is the normal state and goes without saying.
     switch (job->ctrl) {
       case RUN_PAUSED:
-        fprintf(fp, "\tctrl\t\t= %s;\n", "PAUSED");
+        out.lit("\tctrl\t\t= PAUSED;\n");
         break;
       case RUN_SCHEDULE:
-        fprintf(fp, "\tctrl\t\t= %s;\n", "SCHEDULE");
+        out.lit("\tctrl\t\t= SCHEDULE;\n");
         break;
       case RUN_NOW:
-        fprintf(fp, "\tctrl\t\t= %s;\n", "NOW");
+        out.lit("\tctrl\t\t= NOW;\n");
         break;
       default:
         break;
     }
-    if (job->fields != 0) fprintf(fp, "\tfields\t\t= %d;\n", job->fields);
-    if (job->rnd_opts) fprintf(fp, "\trnd_opts\t= \"%s\";\n", job->rnd_opts.c_str());
-    fprintf(fp, "\ttotalframes\t= %d;\n\tdoneframes\t= %d;\n", job->totalframes, job->doneframes);
+    if (job->fields != 0) out.lit("\tfields\t\t= ").d(job->fields).lit(";\n");
+    if (job->rnd_opts) out.lit("\trnd_opts\t= \"").s(job->rnd_opts.c_str()).lit("\";\n");
+    out.lit("\ttotalframes\t= ").d(job->totalframes).lit(";\n\tdoneframes\t= ");
+    out.d(job->doneframes).lit(";\n");
   }
 
   if (job->resources != nullptr) {
-    fputs("\tresources\t=", fp);
+    out.lit("\tresources\t=");
     bool first = true;
     for (const RndDevList* e = job->resources; e != nullptr; e = e->next) {
       const char* name = e->dev != nullptr ? e->dev->name.or_else("(null)") : "(null)";
-      fprintf(fp, first ? " %s" : ", %s", name);
+      out.s(first ? " " : ", ").s(name);
       first = false;
     }
-    fputs(";\n", fp);
+    out.lit(";\n");
   }
   for (const RndPathList* p = job->searchpath; p != nullptr; p = p->next) {
-    if (p->path) fprintf(fp, "\tsearchpath\t= \"%s\";\n", p->path.c_str());
+    if (p->path) out.lit("\tsearchpath\t= \"").s(p->path.c_str()).lit("\";\n");
   }
-  write_week(fp, "\truns\t\t=", job->runs);
-  fputs("}\n\n", fp);
+  write_week(out, "\truns\t\t=", job->runs);
+  out.lit("}\n\n");
 }
 
-void write_dev(FILE* fp, const Dev* dev) {
-  fprintf(fp, "%s %d {\n", dev->name.c_str(), dev->index);
-  fprintf(fp, "\tlock_pid \t= %d;\n", dev->lock_pid);
-  if (dev->comment) fprintf(fp, "/* %s */\n", dev->comment.c_str());
-  if (dev->host_name) fprintf(fp, "\thost_name\t\t= %s;\n", dev->host_name.c_str());
+void write_dev(Out& out, const Dev* dev) {
+  out.s(shown(dev->name)).lit(" ").d(dev->index).lit(" {\n");
+  out.lit("\tlock_pid \t= ").d(dev->lock_pid).lit(";\n");
+  if (dev->comment) out.lit("/* ").s(dev->comment.c_str()).lit(" */\n");
+  if (dev->host_name) out.lit("\thost_name\t\t= ").s(dev->host_name.c_str()).lit(";\n");
   if (dev->remote_location)
-    fprintf(fp, "\tremote_location\t= \"%s\";\n", dev->remote_location.c_str());
+    out.lit("\tremote_location\t= \"").s(dev->remote_location.c_str()).lit("\";\n");
   switch (dev->status) {
     case LOCK_LOCKED:
-      fprintf(fp, "\tstatus \t\t\t= %s;\n", "LOCKED");
+      out.lit("\tstatus \t\t\t= LOCKED;\n");
       break;
     case LOCK_AVAILABLE:
-      fprintf(fp, "\tstatus \t\t\t= %s;\n", "AVAILABLE");
+      out.lit("\tstatus \t\t\t= AVAILABLE;\n");
       break;
     case LOCK_SCHEDULE:
-      fprintf(fp, "\tstatus \t\t\t= %s;\n", "SCHEDULE");
+      out.lit("\tstatus \t\t\t= SCHEDULE;\n");
       break;
     default:
       break;
   }
   // default_dev has always been indented with two blanks and padded with
   // blanks, unlike every other line.
-  fprintf(fp, "\tmax_frames \t\t= %d;\n\tnum_processors \t= %d;\n  default_dev     = %d;\n",
-          dev->max_frames, dev->num_processors, dev->default_dev);
-  write_week(fp, "\tlocks =", dev->locks);
-  fputs("\t}\n\n", fp);
+  out.lit("\tmax_frames \t\t= ").d(dev->max_frames).lit(";\n\tnum_processors \t= ");
+  out.d(dev->num_processors).lit(";\n  default_dev     = ").d(dev->default_dev).lit(";\n");
+  write_week(out, "\tlocks =", dev->locks);
+  out.lit("\t}\n\n");
 }
 
 }  // namespace
 
 void Job_control_write_dev(FILE* fp) {
   if (fp == nullptr) return;
-  fprintf(fp, "RenderJobControl %d %d\n", static_cast<int>(rndctl.interval_min),
-          static_cast<int>(rndctl.interval_sec));
+  Out out(fp);
+  out.lit("RenderJobControl ").d(static_cast<int>(rndctl.interval_min)).lit(" ");
+  out.d(static_cast<int>(rndctl.interval_sec)).lit("\n");
   Job* job = rndctl.jobs;
   while (job != nullptr) {
     Job* next = job->next;
@@ -158,17 +222,18 @@ void Job_control_write_dev(FILE* fp) {
     if (job->deleted != 0)
       Job_del(job);
     else
-      write_job(fp, job);
+      write_job(out, job);
     job = next;
   }
-  fputs("End\n", fp);
+  out.lit("End\n");
 }
 
 void Resource_control_write_dev(FILE* fp) {
   if (fp == nullptr) return;
-  fputs("RenderResourceControl\n", fp);
+  Out out(fp);
+  out.lit("RenderResourceControl\n");
   for (const Dev* dev = rndctl.devs; dev != nullptr; dev = dev->next) {
-    if (dev->name) write_dev(fp, dev);
+    if (dev->name) write_dev(out, dev);
   }
-  fputs("End\n", fp);
+  out.lit("End\n");
 }
