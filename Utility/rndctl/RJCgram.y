@@ -12,9 +12,10 @@
  * they map to "unset" or drop out.  A syntax error ends the process (see
  * RJCerror); an empty input is an empty file, not an error.
  *
- * Every text token (word, string, comment) arrives as a heap block owned by
- * the parser: an action either hands it to a record or frees it, and the
- * destructor below frees what an abandoned parse leaves on its stack.
+ * Every text token (word, string, comment) points into the lexer's own
+ * buffers and stays valid only until its statement is reduced: an action
+ * copies what a record keeps (Text::set, or the record functions, which take
+ * copies of their own).
  */
 
 /* The older prefix directive, not api.prefix: the latter would also rename
@@ -48,16 +49,8 @@ int mode = MODE_NONE;
 Job* cur_job = nullptr;
 Dev* cur_dev = nullptr;
 
-void drop(char* text) { MA_free(text, __LINE__, kUnit); }
-
-// Hands a parsed text to a record field, replacing (and freeing) the old one.
-void give(Text& field, char* text) {
-  if (text == nullptr) {
-    field.reset();
-    return;
-  }
-  field.adopt(text);
-}
+// A copy of a parsed text into a record field, replacing the old value.
+void give(Text& field, const char* text) { field.set(text, __LINE__, kUnit); }
 
 // Bison's own wording, in the words the logs have always carried.
 const char* parser_message(const char* text) {
@@ -77,27 +70,22 @@ bool block_days(const char* word1, const char* word2, char (&first)[16], const c
   return *last != nullptr;
 }
 
-void run_block(int t1, int t2, char* word1, char* word2) {
+void run_block(int t1, int t2, const char* word1, const char* word2) {
   char first[16];
   const char* last = nullptr;
   if (cur_job != nullptr && block_days(word1, word2, first, &last))
     Schedule_job_runs(cur_job, t1, t2, first, last);
-  drop(word1);
-  drop(word2);
 }
 
-void lock_block(int t1, int t2, char* word1, char* word2) {
+void lock_block(int t1, int t2, const char* word1, const char* word2) {
   char first[16];
   const char* last = nullptr;
   if (cur_dev != nullptr && block_days(word1, word2, first, &last))
     Schedule_dev_lock(cur_dev, t1, t2, first, last);
-  drop(word1);
-  drop(word2);
 }
 
-void begin_job(char* name, int index) {
+void begin_job(const char* name, int index) {
   cur_job = Add_a_job(nullptr, name, index);
-  drop(name);
   if (cur_job == nullptr) return;
   // Only what the file says stands: the defaults a new record starts with
   // (and, for a record read before, its old values) are dropped for these.
@@ -109,23 +97,16 @@ void begin_job(char* name, int index) {
   cur_job->rnd_opts.reset();
 }
 
-void begin_dev(char* name, int index) {
+void begin_dev(const char* name, int index) {
   cur_dev = Add_a_dev(nullptr, name, index);
-  drop(name);
 }
 
-void job_text(Text Job::*field, char* text) {
-  if (cur_job != nullptr)
-    give(cur_job->*field, text);
-  else
-    drop(text);
+void job_text(Text Job::*field, const char* text) {
+  if (cur_job != nullptr) give(cur_job->*field, text);
 }
 
-void dev_text(Text Dev::*field, char* text) {
-  if (cur_dev != nullptr)
-    give(cur_dev->*field, text);
-  else
-    drop(text);
+void dev_text(Text Dev::*field, const char* text) {
+  if (cur_dev != nullptr) give(cur_dev->*field, text);
 }
 
 void job_int(int Job::*field, int value) {
@@ -199,8 +180,6 @@ int RJClex();
 %type <ival> flag
 %type <rval> number
 
-%destructor { drop($$); } <sval>
-
 %initial-action {
   mode = MODE_NONE;
   cur_job = nullptr;
@@ -233,13 +212,13 @@ res_header
 job_items
   : %empty
   | job_items job_block
-  | job_items TK_COMMENT { drop($2); }
+  | job_items TK_COMMENT
   ;
 
 res_items
   : %empty
   | res_items res_block
-  | res_items TK_COMMENT { drop($2); }
+  | res_items TK_COMMENT
   ;
 
 job_block
@@ -267,7 +246,6 @@ job_stmt
   | TK_SEARCHPATH '=' TK_STRING ';'
       {
         if (cur_job != nullptr) RndPathList_add(cur_job, $3);
-        drop($3);
       }
   | TK_PRIORITY '=' TK_INTEGER ';'          { job_int(&Job::priority, $3); }
   | TK_FIELDS '=' TK_INTEGER ';'            { job_int(&Job::fields, $3); }
@@ -282,7 +260,6 @@ job_stmt
   | TK_CTRL '=' TK_WORD ';'
       {
         job_int(&Job::ctrl, Job_get_runstate($3));
-        drop($3);
       }
   | TK_FRAMES '=' number ',' number ',' number ';'
       {
@@ -332,7 +309,6 @@ dev_name
           Dev* dev = Dev_by_name($1);
           if (dev != nullptr) RndDevList_add(cur_job, dev);
         }
-        drop($1);
       }
   ;
 
@@ -362,13 +338,12 @@ res_stmts
 /* A resource comment is written for people reading the file; nothing reads
  * it back into the record. */
 res_stmt
-  : TK_COMMENT                              { drop($1); }
+  : TK_COMMENT
   | TK_HOST_NAME '=' TK_WORD ';'            { dev_text(&Dev::host_name, $3); }
   | TK_REMOTE_LOCATION '=' TK_STRING ';'    { dev_text(&Dev::remote_location, $3); }
   | TK_RSTATUS '=' TK_WORD ';'
       {
         dev_int(&Dev::status, Dev_get_lockstate($3));
-        drop($3);
       }
   | TK_LOCK_PID '=' TK_INTEGER ';'          { dev_int(&Dev::lock_pid, $3); }
   | TK_MAX_FRAMES '=' TK_INTEGER ';'        { dev_int(&Dev::max_frames, $3); }

@@ -41,14 +41,9 @@ Job* Job_new(Job* before, void* listitem, const char* path, int index) {
 
   job->pick_level = 0;
   job->listitem = listitem;
-  char* base = nullptr;
-  char* dir = nullptr;
-  rj_splitpath(path, &base, &dir, nullptr);
-  MA_free(dir, __LINE__, kUnit);
-  if (base != nullptr)
-    job->name.adopt(base);
-  else
-    job->name.set(path);
+  // The job is named after the last component of its scene path.
+  const char* slash = path != nullptr ? strrchr(path, '/') : nullptr;
+  job->name.set(slash != nullptr ? slash + 1 : path);
   job->status.set("none");
   job->priority = 0;
   job->index = index != 0 ? index : RJCget_next_index(FILE_JOB_INDEX);
@@ -87,15 +82,7 @@ Job* Add_a_job(void* listitem, const char* path, int index) {
     Job* found = Job_by_index(index);
     if (found != nullptr) return found;
   }
-  Job* job = Job_new(nullptr, listitem, path, index);
-  if (job != nullptr) {
-    char* derived_path = nullptr;
-    char* derived_root = nullptr;
-    rj_set_paths(job, &derived_path, &derived_root);
-    MA_free(derived_path, __LINE__, kUnit);
-    MA_free(derived_root, __LINE__, kUnit);
-  }
-  return job;
+  return Job_new(nullptr, listitem, path, index);
 }
 
 Job* Insert_a_job(Job* before, void* listitem, const char* path, int index) {

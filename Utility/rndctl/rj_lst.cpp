@@ -58,7 +58,10 @@ void append_job_entry(Dev* dev, RndJobList* entry) {
     last->next = entry;
     entry->prev = last;
   }
-  tails[dev] = entry;
+  if (it != tails.end())
+    it->second = entry;
+  else
+    tails.emplace(dev, entry);
 }
 
 // Takes one entry out of a resource's job list and frees it; the other half
