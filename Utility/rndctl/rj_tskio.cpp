@@ -23,6 +23,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -37,9 +38,26 @@ constexpr int kStatusCount = 8;
 // Debug lines print record addresses with "%x", as the log readers expect.
 unsigned px(const void* p) { return static_cast<unsigned>(reinterpret_cast<uintptr_t>(p)); }
 
-bool is_space(int c) {
-  return c == ' ' || c == '\t' || c == '\n' || c == '\v' || c == '\f' || c == '\r';
-}
+// The blanks of the C library's "C" locale, as a table: the reader asks
+// about every character of a file of some megabytes.
+constexpr struct SpaceTable {
+  bool is[257] = {};
+  constexpr SpaceTable() {
+    for (int c : {' ', '\t', '\n', '\v', '\f', '\r'}) is[c + 1] = true;
+  }
+} kSpace;
+
+// c is a character as getc returns it: unsigned char value or EOF.
+bool is_space(int c) { return kSpace.is[c + 1]; }
+
+// Where a token in a buffer may end: a blank, or the NUL that ends the
+// buffer (a NUL inside the text is part of the token).
+constexpr struct TokenEndTable {
+  bool is[256] = {};
+  constexpr TokenEndTable() {
+    for (int c : {'\0', ' ', '\t', '\n', '\v', '\f', '\r'}) is[c] = true;
+  }
+} kTokenEnd;
 
 // Whitespace-separated tokens, either from a buffer that the source may
 // write into (each token is NUL-terminated in place) or straight from a
@@ -52,6 +70,7 @@ class TokenSource {
   static constexpr size_t kMaxToken = 4096;
 
   explicit TokenSource(FILE* fp) : fp_(fp) {}
+  /// text[length] must be a NUL: the scans stop on it instead of counting.
   TokenSource(char* text, size_t length) : p_(text), end_(text + length) {}
 
   /// The first character of the next token, or EOF; consumes only whitespace.
@@ -63,7 +82,7 @@ class TokenSource {
       if (c != EOF) ungetc(c, fp_);
       return c;
     }
-    while (p_ < end_ && is_space(static_cast<unsigned char>(*p_))) ++p_;
+    while (is_space(static_cast<unsigned char>(*p_))) ++p_;  // the NUL at end_ stops it
     return p_ < end_ ? static_cast<unsigned char>(*p_) : EOF;
   }
 
@@ -79,7 +98,11 @@ class TokenSource {
       return token_.c_str();
     }
     char* start = p_;
-    while (p_ < end_ && !is_space(static_cast<unsigned char>(*p_))) ++p_;
+    for (;;) {
+      while (!kTokenEnd.is[static_cast<unsigned char>(*p_)]) ++p_;
+      if (*p_ != '\0' || p_ >= end_) break;
+      ++p_;
+    }
     // The buffer has one spare byte past its end, so the last token can be
     // terminated too.
     *p_ = '\0';
@@ -87,7 +110,22 @@ class TokenSource {
     return start;
   }
 
+  // The numbers of a buffer are converted where they stand, without finding
+  // the end of the token first; whatever the quick look does not take is
+  // read the long way below.
   bool next_int(int* out) {
+    if (fp_ == nullptr && peek() != EOF) {
+      const char* t = p_;
+      const char* d = t + (*t == '-' || *t == '+');
+      int digits = 0;
+      int v9 = 0;
+      while (d[digits] >= '0' && d[digits] <= '9' && digits < 10)
+        v9 = v9 * 10 + (d[digits++] - '0');
+      if (digits > 0 && digits < 10 && take_token_ending_at(p_ + (d - t) + digits)) {
+        *out = *t == '-' ? -v9 : v9;
+        return true;
+      }
+    }
     const char* t = next();
     if (t == nullptr) return false;
     // Plain decimal numbers of up to nine digits cannot overflow: done here.
@@ -108,6 +146,14 @@ class TokenSource {
   }
 
   bool next_float(float* out) {
+    if (fp_ == nullptr && peek() != EOF) {
+      float v = 0;
+      const char* stop = scan_decimal(p_, &v);
+      if (stop != nullptr && take_token_ending_at(p_ + (stop - p_))) {
+        *out = v;
+        return true;
+      }
+    }
     const char* t = next();
     if (t == nullptr) return false;
     if (fast_decimal(t, out)) return true;
@@ -122,12 +168,33 @@ class TokenSource {
   }
 
  private:
+  // Buffer mode, p_ at the start of a token: when `stop` is where next()
+  // would end that token (a blank, or the NUL that closes the buffer), takes
+  // it as next() would and returns true.
+  bool take_token_ending_at(char* stop) {
+    unsigned char c = static_cast<unsigned char>(*stop);
+    if (!kTokenEnd.is[c] || (c == '\0' && stop < end_)) return false;
+    *stop = '\0';
+    p_ = stop < end_ ? stop + 1 : stop;
+    return true;
+  }
+
+  static bool fast_decimal(const char* t, float* out) {
+    float v = 0;
+    const char* stop = scan_decimal(t, &v);
+    if (stop == nullptr || *stop != '\0') return false;
+    *out = v;
+    return true;
+  }
+
   // "[-]d{1,7}[.d{0,6}]" is all the writer ever produces for sensible frame
   // numbers.  Such a value is m / 10^k with m < 10^13: both are exact
   // doubles, so the quotient is correctly rounded, and it lies too far from
   // any float rounding midpoint for the second rounding to float to differ
   // from strtof's.
-  static bool fast_decimal(const char* t, float* out) {
+  // Reads such a number from the start of t; returns where it stopped, or
+  // null when t does not start with one.
+  static const char* scan_decimal(const char* t, float* out) {
     const char* s = t;
     bool negative = false;
     if (*s == '-') {
@@ -137,23 +204,22 @@ class TokenSource {
     int64_t m = 0;
     int int_digits = 0;
     while (*s >= '0' && *s <= '9') {
-      if (++int_digits > 7) return false;
+      if (++int_digits > 7) return nullptr;
       m = m * 10 + (*s++ - '0');
     }
-    if (int_digits == 0) return false;
+    if (int_digits == 0) return nullptr;
     int frac_digits = 0;
     if (*s == '.') {
       ++s;
       while (*s >= '0' && *s <= '9') {
-        if (++frac_digits > 6) return false;
+        if (++frac_digits > 6) return nullptr;
         m = m * 10 + (*s++ - '0');
       }
     }
-    if (*s != '\0') return false;
     static const double kPow10[] = {1e0, 1e1, 1e2, 1e3, 1e4, 1e5, 1e6};
     double v = static_cast<double>(m) / kPow10[frac_digits];
     *out = static_cast<float>(negative ? -v : v);
-    return true;
+    return s;
   }
 
   FILE* fp_ = nullptr;
@@ -173,21 +239,35 @@ class TextOut {
  public:
   /// Room for at least `n` more characters; write them, then commit().
   char* room(size_t n) {
-    if (used_ + n > text_.size()) text_.resize(std::max(text_.size() * 2, used_ + n + 4096));
-    return text_.data() + used_;
+    if (used_ + n > capacity_) grow(used_ + n);
+    return text_.get() + used_;
   }
-  void commit(char* end) { used_ = static_cast<size_t>(end - text_.data()); }
+  void commit(char* end) { used_ = static_cast<size_t>(end - text_.get()); }
   void put(const char* s) {
     size_t n = strlen(s);
     char* p = room(n);
     memcpy(p, s, n);
     commit(p + n);
   }
-  const char* data() const { return text_.data(); }
+  /// Makes room for `n` characters in all, to save growing step by step.
+  void reserve(size_t n) {
+    if (n > capacity_) grow(n);
+  }
+  const char* data() const { return text_.get(); }
   size_t size() const { return used_; }
 
  private:
-  std::string text_;
+  // Grown without clearing: every character is written before it is read.
+  void grow(size_t need) {
+    size_t capacity = std::max(capacity_ * 2, need + 4096);
+    std::unique_ptr<char[]> text = std::make_unique_for_overwrite<char[]>(capacity);
+    if (used_ > 0) memcpy(text.get(), text_.get(), used_);
+    text_ = std::move(text);
+    capacity_ = capacity;
+  }
+
+  std::unique_ptr<char[]> text_;
+  size_t capacity_ = 0;
   size_t used_ = 0;
 };
 
@@ -205,20 +285,34 @@ char* put_int(char* p, int value) {
   return p;
 }
 
-constexpr size_t kFixed6Room = 32;  // the fast path's longest text, with sign
+// "00" "01" ... "99": the six decimals go out two at a time.
+constexpr struct DigitPairs {
+  char text[201] = {};
+  constexpr DigitPairs() {
+    for (int i = 0; i < 100; ++i) {
+      text[2 * i] = static_cast<char>('0' + i / 10);
+      text[2 * i + 1] = static_cast<char>('0' + i % 10);
+    }
+  }
+} kDigitPairsTable;
+constexpr const char* kDigitPairs = kDigitPairsTable.text;
 
-// "%f" of value into p, which has room for kFixed6Room characters.  Exact
+// "%f" of value into p, which has room for kFloatRoom characters.  Exact
 // when value * 10^6 is a whole number below 2^50: the product is then
 // computed exactly (or within a rounding error far below the last printed
 // digit), which covers every frame number with at most six decimals.  For
 // anything else returns null and the caller asks the C library.
 char* put_fixed6_fast(char* p, double value) {
   double scaled = value * 1e6;
-  if (!(std::fabs(scaled) < 1125899906842624.0) || scaled != std::floor(scaled)) return nullptr;
-  int64_t s = static_cast<int64_t>(std::fabs(scaled));
+  if (!(std::fabs(scaled) < 1125899906842624.0)) return nullptr;
+  // Below 2^50 the conversion is exact for whole numbers, so this is the
+  // test for one.
+  int64_t signed_scaled = static_cast<int64_t>(scaled);
+  if (static_cast<double>(signed_scaled) != scaled) return nullptr;
+  uint64_t s = static_cast<uint64_t>(signed_scaled < 0 ? -signed_scaled : signed_scaled);
   if (std::signbit(value)) *p++ = '-';
-  int64_t whole = s / 1000000;
-  int64_t frac = s % 1000000;
+  uint64_t whole = s / 1000000;
+  uint32_t frac = static_cast<uint32_t>(s - whole * 1000000);
   char digits[24];
   int n = 0;
   do {
@@ -227,22 +321,24 @@ char* put_fixed6_fast(char* p, double value) {
   } while (whole != 0);
   while (n > 0) *p++ = digits[--n];
   *p++ = '.';
-  for (int i = 5; i >= 0; --i) {
-    p[i] = static_cast<char>('0' + frac % 10);
-    frac /= 10;
-  }
+  uint32_t high = frac / 10000;
+  uint32_t low = frac % 10000;
+  memcpy(p, kDigitPairs + 2 * high, 2);
+  memcpy(p + 2, kDigitPairs + 2 * (low / 100), 2);
+  memcpy(p + 4, kDigitPairs + 2 * (low % 100), 2);
   return p + 6;
 }
 
-void put_fixed6(TextOut& out, double value) {
-  char* p = out.room(kFixed6Room);
-  if (char* end = put_fixed6_fast(p, value)) {
-    out.commit(end);
-    return;
-  }
-  char buffer[512];
-  snprintf(buffer, sizeof buffer, "%f", value);
-  out.put(buffer);
+// "%f" of a float promoted to double is at most 47 characters (sign, 39
+// digits, point, six decimals), "-nan" and "-inf" fewer.
+constexpr size_t kFloatRoom = 64;
+
+// "%f" of value into p, which has room for kFloatRoom characters.
+char* put_fixed6(char* p, double value) {
+  if (char* end = put_fixed6_fast(p, value)) return end;
+  int n = snprintf(p, kFloatRoom, "%f", value);
+  if (n < 0) return p;
+  return p + std::min(static_cast<size_t>(n), kFloatRoom - 1);
 }
 
 void put_literal(TextOut& out, const char* s, size_t n) {
@@ -266,14 +362,17 @@ GroupRead read_group(TokenSource& in, TaskGroup** out, bool* more) {
   int c = in.peek();
   if (c == EOF) return GroupRead::kEnd;
   const char* name = in.next();
+  // The name is kept for the trace only; the numbers after it may overwrite
+  // the text it points into.
   char name_copy[1024];
-  snprintf(name_copy, sizeof name_copy, "%s", name);
+  if (debug) snprintf(name_copy, sizeof name_copy, "%s", name);
   int index = 0, numrecs = 0, next_id = 0;
   if (!in.next_int(&index) || !in.next_int(&numrecs) || !in.next_int(&next_id)) {
     return GroupRead::kEnd;
   }
-  dbgpnt("%d   name(%s) id(%d) numrecs(%d) next_task_id(%d)\n", 4, name_copy, index, numrecs,
-         next_id);
+  if (debug)
+    dbgpnt("%d   name(%s) id(%d) numrecs(%d) next_task_id(%d)\n", 4, name_copy, index, numrecs,
+           next_id);
 
   Job* job = Job_by_index(index);
   TaskGroup* group = nullptr;
@@ -361,18 +460,20 @@ void format_group(TextOut& out, const TaskGroup* group, int numrecs) {
 }
 
 void format_record(TextOut& out, const TaskRec* rec) {
-  char* p = out.room(16);
+  // The whole line in one piece: three numbers, four integers of at most 11
+  // characters, blanks and a status name of at most 8.
+  char* p = out.room(3 * kFloatRoom + 64);
   *p++ = '\t';
   p = put_int(p, rec->id);
   *p++ = '\t';
   *p++ = ' ';
-  out.commit(p);
-  put_fixed6(out, rec->start);
-  put_literal(out, "\t ", 2);
-  put_fixed6(out, rec->end);
-  put_literal(out, "\t ", 2);
-  put_fixed6(out, rec->current);
-  p = out.room(64);
+  p = put_fixed6(p, rec->start);
+  *p++ = '\t';
+  *p++ = ' ';
+  p = put_fixed6(p, rec->end);
+  *p++ = '\t';
+  *p++ = ' ';
+  p = put_fixed6(p, rec->current);
   *p++ = ' ';
   *p++ = ' ';
   p = put_int(p, rec->dev != nullptr ? rec->dev->index : 0);
@@ -477,7 +578,8 @@ const char* GetTaskStatusStr(int code) {
 int ISA_task_status(const char* text, int* code) {
   if (text == nullptr || code == nullptr) return 0;
   for (int i = 0; task_status_table[i] != nullptr; ++i) {
-    if (strcmp(text, task_status_table[i]) == 0) {
+    // The first letters tell most names apart without a call.
+    if (text[0] == task_status_table[i][0] && strcmp(text, task_status_table[i]) == 0) {
       *code = i;
       return 1;
     }
@@ -634,6 +736,9 @@ TaskGroup* TaskGroup_read(FILE* fp) {
 TaskGroup* Task_read(FILE* fp) {
   if (fp == nullptr) return nullptr;
   std::string text;
+  struct stat st;
+  if (fstat(fileno(fp), &st) == 0 && S_ISREG(st.st_mode) && st.st_size > 0)
+    text.reserve(static_cast<size_t>(st.st_size) + 1);
   char chunk[65536];
   size_t n;
   while ((n = fread(chunk, 1, sizeof chunk, fp)) > 0) text.append(chunk, n);
@@ -682,6 +787,12 @@ int Task_write(FILE* fp, TaskGroup* groups) {
   // The whole file in one write: the stream is line-buffered, and a write
   // per group costs a system call each on a file of thousands of groups.
   TextOut out;
+  // A record's line is some fifty characters; reserving for all of them at
+  // once saves copying the text as it grows.
+  size_t records = 0;
+  for (TaskGroup* g = groups; g != nullptr; g = g->next)
+    for (TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) ++records;
+  out.reserve(records * 64 + 4096);
   for (TaskGroup* g = groups; g != nullptr; g = g->next) append_group(out, g);
   if (!write_text(fp, out)) return -1;
   dbgpnt("Task_write---------------------------------done\n\n");
