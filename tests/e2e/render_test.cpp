@@ -44,7 +44,7 @@ class RenderTest : public ::testing::Test {
     return j;
   }
   bool status_becomes(Daemon& d, const std::string& job, const std::string& status,
-                      double seconds = 60) {
+                      double seconds = 120) {
     return wait_for([&] { return job_status(farm_, job) == status || d.ended(); }, seconds, &d) &&
            job_status(farm_, job) == status;
   }
