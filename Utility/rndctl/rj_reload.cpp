@@ -162,6 +162,11 @@ void RJC_out() {
 
 void Update_from_demon(int editor) {
   dbgpnt("Update_from_demon................................%s\n", editor ? "TRUE" : "FALSE");
+  // The update time as it stands before the files are read is the one these
+  // files answer.  A touch that lands while they are being read or written
+  // must still read as a change afterwards, or an editor's change that came
+  // in during the pass would wait for the next timed check.
+  const int64_t seen_before = daemon_updatetime_get(rndctl.host.c_str());
 
   // Set the in-memory lists aside; the parse below fills fresh ones.
   Lists old;
@@ -219,6 +224,6 @@ void Update_from_demon(int editor) {
   lock_fileop(FILE_RESOURCES, 0);
   lock_fileop(FILE_JOBS, 0);
 
-  rndctl.last_update = daemon_updatetime_get(host);
+  rndctl.last_update = seen_before;
   dbgpnt("Update_from_demon done..........................\n\n");
 }
