@@ -242,17 +242,24 @@ int lock_fileop(int index, int take) {
   return 1;
 }
 
+// "ERROR: failed to <verb> <path>" to the user, stdout and the trace, with
+// the system's reason; both open paths say "in read_fileop", which log
+// readers match.
+static void report_open_failure(int index, const char* verb) {
+  const char* path = files[index].path != nullptr ? files[index].path : "";
+  int saved_errno = errno;
+  EDuprintf("ERROR: failed to %s %s", verb, path);
+  printf("ERROR: failed to %s %s\n", verb, path);
+  errno = saved_errno;
+  perror("in read_fileop");
+  dbgpnt("ERROR: failed to %s %s\n", verb, path);
+}
+
 FILE* read_fileop(int index) {
   if (!valid_index(index)) return nullptr;
   FILE* fp = open_record(index, "r+e", "w+e");
   if (fp == nullptr) {
-    const char* path = files[index].path != nullptr ? files[index].path : "";
-    int saved_errno = errno;
-    EDuprintf("ERROR: failed to open %s", path);
-    printf("ERROR: failed to open %s\n", path);
-    errno = saved_errno;
-    perror("in read_fileop");
-    dbgpnt("ERROR: failed to open %s\n", path);
+    report_open_failure(index, "open");
     return nullptr;
   }
   after_open(index, fp);
@@ -263,13 +270,7 @@ FILE* update_fileop(int index) {
   if (!valid_index(index)) return nullptr;
   FILE* fp = open_record(index, "rb+e", "w+e");
   if (fp == nullptr) {
-    const char* path = files[index].path != nullptr ? files[index].path : "";
-    int saved_errno = errno;
-    EDuprintf("ERROR: failed to create %s", path);
-    printf("ERROR: failed to create %s\n", path);
-    errno = saved_errno;
-    perror("in read_fileop");  // the same text as the read path: log readers match it
-    dbgpnt("ERROR: failed to create %s\n", path);
+    report_open_failure(index, "create");
     sounder(3);
     return nullptr;
   }

@@ -99,27 +99,28 @@ int RJC_parse() {
   return RJCparse();
 }
 
+namespace {
+// Reads one control file under its lock into the control block's lists.
+int reload_file(int index) {
+  int result = 0;
+  lock_fileop(index, 1);
+  if (read_fileop(index) != nullptr) {
+    result = RJC_parse();
+    close_fileop(index);
+  }
+  lock_fileop(index, 0);
+  return result;
+}
+}  // namespace
+
 int RJC_reload(int /*flag*/) {
   dbgpnt("RJC_reload\n");
-  int result = 0;
-  lock_fileop(FILE_JOBS, 1);
-  if (read_fileop(FILE_JOBS) != nullptr) {
-    result = RJC_parse();
-    close_fileop(FILE_JOBS);
-  }
-  lock_fileop(FILE_JOBS, 0);
-  return result;
+  return reload_file(FILE_JOBS);
 }
 
 int RRC_reload(int flag) {
   dbgpnt("RRC_reload\n");
-  int result = 0;
-  lock_fileop(FILE_RESOURCES, 1);
-  if (read_fileop(FILE_RESOURCES) != nullptr) {
-    result = RJC_parse();
-    close_fileop(FILE_RESOURCES);
-  }
-  lock_fileop(FILE_RESOURCES, 0);
+  int result = reload_file(FILE_RESOURCES);
   if (flag != 0 && rndctl.editors != 0) IR_rebuild_rndctl();
   return result;
 }
