@@ -89,6 +89,13 @@ void release_records_of(int pid) {
   }
 }
 
+// The registry could not be opened: say so and let go of its lock.
+void give_up_open(const char* path) {
+  dbgpnt("ERROR: failed to open %s\n", path);
+  EDuprintf("ERROR: failed to open %s", path);
+  lock_fileop(FILE_EDITPIDS, 0);
+}
+
 }  // namespace
 
 void Editor_process_list(int mode) {
@@ -99,9 +106,7 @@ void Editor_process_list(int mode) {
   lock_fileop(FILE_EDITPIDS, 1);
   FILE* fp = update_fileop(FILE_EDITPIDS);
   if (fp == nullptr) {
-    dbgpnt("ERROR: failed to open %s\n", path);
-    EDuprintf("ERROR: failed to open %s", path);
-    lock_fileop(FILE_EDITPIDS, 0);
+    give_up_open(path);
     return;
   }
 
@@ -160,9 +165,7 @@ int Editor_process_validate(int pid) {
     lock_fileop(FILE_EDITPIDS, 1);
     FILE* fp = read_fileop(FILE_EDITPIDS);
     if (fp == nullptr) {
-      dbgpnt("ERROR: failed to open %s\n", path);
-      EDuprintf("ERROR: failed to open %s", path);
-      lock_fileop(FILE_EDITPIDS, 0);
+      give_up_open(path);
       return 0;
     }
     read_table(fp);
