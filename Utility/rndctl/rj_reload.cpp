@@ -194,7 +194,7 @@ void Update_from_demon(int editor) {
   const char* host = rndctl.host.c_str();
   for (Job* J = old.jobs; J != nullptr; J = J->next) {
     for (RndDevList* item = J->resources; item != nullptr; item = item->next) {
-      if (item->dev == nullptr || host == nullptr || !item->dev->name.is(host)) continue;
+      if (!rj_dev_on_host(item->dev, host)) continue;
       Job* N = Job_by_index(J->index);
       if (N != nullptr) reconcile(J, N, editor);
       break;

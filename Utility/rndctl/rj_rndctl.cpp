@@ -69,6 +69,12 @@ time_t (*rj_clock)() = system_clock;
 
 time_t rj_now() { return rj_clock(); }
 
+bool rj_dev_on_host(const Dev* dev, const char* host) {
+  return dev != nullptr && host != nullptr && dev->host_name.is(host);
+}
+
+bool rj_dev_is_this_host(const Dev* dev) { return rj_dev_on_host(dev, rndctl.host.c_str()); }
+
 const char* rj_tmpdir() {
   const char* dir = getenv("DRCTMPDIR");
   if (dir != nullptr && *dir != '\0') return dir;

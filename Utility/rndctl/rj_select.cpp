@@ -31,11 +31,9 @@ constexpr int kMaxRetries = 10;
 
 unsigned px(const void* p) { return static_cast<unsigned>(reinterpret_cast<uintptr_t>(p)); }
 
-bool dev_on_host(const Dev* dev, const char* host) {
-  return dev != nullptr && host != nullptr && dev->host_name.is(host);
-}
+bool dev_on_host(const Dev* dev, const char* host) { return rj_dev_on_host(dev, host); }
 
-bool dev_on_this_host(const Dev* dev) { return dev_on_host(dev, rndctl.host.c_str()); }
+bool dev_on_this_host(const Dev* dev) { return rj_dev_is_this_host(dev); }
 
 bool is_active(int status) { return status == TASK_STARTED || status == TASK_RUNNING; }
 

@@ -20,14 +20,13 @@ const char* status_name(int code) {
 }
 
 bool runs_here(const TaskRec* rec) {
-  return rec != nullptr && rec->dev != nullptr && rndctl.host &&
-         rec->dev->host_name.is(rndctl.host.c_str());
+  return rec != nullptr && rj_dev_is_this_host(rec->dev);
 }
 
 bool job_uses_this_host(const Job* job) {
   if (!rndctl.host) return false;
   for (RndDevList* d = job->resources; d != nullptr; d = d->next) {
-    if (d->dev != nullptr && d->dev->host_name.is(rndctl.host.c_str())) return true;
+    if (rj_dev_is_this_host(d->dev)) return true;
   }
   return false;
 }

@@ -263,6 +263,14 @@ time_t rj_now();
 /// The temporary directory: DRCTMPDIR, else "/usr/tmp" when it exists, else "/var/tmp".
 const char* rj_tmpdir();
 
+/// Whether a resource stands for `host`: its host_name names it.  A resource
+/// name is only a label (one host may offer several resources, "fast1" on
+/// host "hostA"); every "is this task / job / resource ours" question asks
+/// this, never the resource name.  Null resource or host: false.
+bool rj_dev_on_host(const Dev* dev, const char* host);
+/// rj_dev_on_host(dev, this host's name).
+bool rj_dev_is_this_host(const Dev* dev);
+
 void RJC_init_rndctl(const char* location);
 int64_t daemon_updatetime_set(const char* host);
 int64_t daemon_updatetime_get(const char* host);
