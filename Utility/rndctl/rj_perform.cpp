@@ -308,6 +308,9 @@ int rj_system(char* const argv[], const char* stream_path, const char* out_path,
     // Not counted: no child exists that the SIGCHLD side would ever reap.
     return -1;
   }
+  // The child makes itself the leader of its own group too; doing it here as
+  // well closes the window in which a kill of the group would find no group.
+  setpgid(pid, pid);
   rndctl.running = rndctl.running + 1;
   return pid;
 }
@@ -492,11 +495,22 @@ void Job_Log_out(Job* job) {
   }
 }
 
+int rj_kill_render(const char* host, int pid, int sig) {
+  if (pid < 2) return 0;
+  // Another host's render: RJ_signal says so in the trace and sends nothing.
+  if (host != nullptr && !rndctl.host.is(host)) return RJ_signal(host, pid, sig);
+  // The render program leads its own process group: whatever it started
+  // (a renderer behind a wrapper script, helpers) must go with it.
+  int result = kill(-pid, sig);
+  if (result != 0 && errno == ESRCH) result = kill(pid, sig);
+  dbgpnt("kill( %d, %d ) = %d(%d);\n", -pid, sig, result, result != 0 ? errno : 0);
+  return result;
+}
+
 void daemon_kill_running_tasks(const char* host) {
   if (host == nullptr) return;
   for (TASK* entry = rndctl.tasks; entry != nullptr; entry = entry->next) {
-    if (entry->rec == nullptr || entry->rec->dev == nullptr) continue;
-    if (!entry->rec->dev->host_name.is(host)) continue;
-    RJ_signal(host, entry->pid, 9);
+    if (entry->rec == nullptr || !rj_dev_on_host(entry->rec->dev, host)) continue;
+    rj_kill_render(host, entry->pid, 9);
   }
 }

@@ -101,7 +101,7 @@ int SetTaskStatus(TASK* entry, int status) {
     dbgpnt("**************** KILL %s on %s:%s\n",
            job != nullptr ? job->name.or_else("noname") : "noname", host != nullptr ? host : "",
            dev != nullptr ? dev->name.or_else("") : "");
-    RJ_signal(host, entry->pid, 9);
+    rj_kill_render(host, entry->pid, 9);
   }
   entry->pid = 0;
   drop_stream(entry);

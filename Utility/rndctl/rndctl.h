@@ -498,6 +498,11 @@ void Job_Log_out(Job* job);
 FILE* Logfile_open(Job* job);
 FILE* Logfile_open_nr(Job* job);
 void daemon_kill_running_tasks(const char* host);
+/// The one kill of a render: sends `sig` to the process group that the
+/// render program `pid` leads on this host (so its own children go too).
+/// For another host nothing is sent (RJ_signal traces it) and 0 is returned;
+/// a pid below 2 is no render and returns 0.  Otherwise kill's result.
+int rj_kill_render(const char* host, int pid, int sig);
 
 // Task status, job state and progress (rj_status).
 int SetTaskStatus(TASK* entry, int status);
