@@ -503,7 +503,7 @@ int rj_kill_render(const char* host, int pid, int sig) {
   // (a renderer behind a wrapper script, helpers) must go with it.
   int result = kill(-pid, sig);
   if (result != 0 && errno == ESRCH) result = kill(pid, sig);
-  dbgpnt("kill( %d, %d ) = %d(%d);\n", -pid, sig, result, result != 0 ? errno : 0);
+  dbgpnt("kill( %d, %d ) = %d(%d);\n", pid, sig, result, result != 0 ? errno : 0);
   return result;
 }
 
