@@ -75,6 +75,19 @@ bool rj_dev_on_host(const Dev* dev, const char* host) {
 
 bool rj_dev_is_this_host(const Dev* dev) { return rj_dev_on_host(dev, rndctl.host.c_str()); }
 
+void Job_wake_other_hosts(const Job* job) {
+  if (job == nullptr) return;
+  for (const RndDevList* e = job->resources; e != nullptr; e = e->next) {
+    const Dev* dev = e->dev;
+    if (dev == nullptr || dev->host_name.none() || rj_dev_is_this_host(dev)) continue;
+    bool seen = false;  // several resources may stand for one host
+    for (const RndDevList* f = job->resources; f != e && !seen; f = f->next) {
+      seen = f->dev != nullptr && f->dev->host_name.is(dev->host_name.c_str());
+    }
+    if (!seen) daemon_updatetime_set(dev->host_name.c_str());
+  }
+}
+
 const char* rj_tmpdir() {
   const char* dir = getenv("DRCTMPDIR");
   if (dir != nullptr && *dir != '\0') return dir;

@@ -270,6 +270,10 @@ const char* rj_tmpdir();
 bool rj_dev_on_host(const Dev* dev, const char* host);
 /// rj_dev_on_host(dev, this host's name).
 bool rj_dev_is_this_host(const Dev* dev);
+/// Work of `job` appeared (put back, cut off, created): touches the pid file
+/// of every other host in the job's host list, once each, so that an idle
+/// daemon there takes it without waiting for its check interval.
+void Job_wake_other_hosts(const Job* job);
 
 void RJC_init_rndctl(const char* location);
 int64_t daemon_updatetime_set(const char* host);
