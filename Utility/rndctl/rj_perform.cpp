@@ -312,6 +312,9 @@ int rj_system(char* const argv[], const char* stream_path, const char* out_path,
   // well closes the window in which a kill of the group would find no group.
   setpgid(pid, pid);
   rndctl.running = rndctl.running + 1;
+  // Remembered outside the daemon, so that a daemon started after a crash
+  // of this one can end the render instead of letting it run unowned.
+  rj_render_started(pid);
   return pid;
 }
 

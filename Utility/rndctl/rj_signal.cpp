@@ -7,6 +7,7 @@
 // waits and never interrupts its file or list work.  That is what makes the
 // traces and the list walk inside the handler safe.
 #include <fcntl.h>
+#include <poll.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -33,6 +34,7 @@ int mask_op(int how, int sig) {
 // Decodes one reaped child into its running-task entry.
 void judge_child(int pid, int status) {
   rndctl.running = rndctl.running - 1;
+  rj_render_ended(pid);
   daemon_updatetime_set(rndctl.host.c_str());
   TASK* entry = Task_by_pid(pid);
   if (entry == nullptr) {
@@ -175,6 +177,19 @@ int RJ_pause() {
   sigdelset(&mask, SIGALRM);
   sigdelset(&mask, SIGCHLD);
   return sigsuspend(&mask);
+}
+
+int RJ_pause_for(long ms) {
+  // As RJ_pause, with a time limit: ppoll sets the mask and waits in one
+  // step, so a signal that is already pending ends the wait at once.
+  sigset_t mask;
+  sigprocmask(SIG_SETMASK, nullptr, &mask);
+  sigdelset(&mask, SIGALRM);
+  sigdelset(&mask, SIGCHLD);
+  struct timespec limit;
+  limit.tv_sec = ms / 1000;
+  limit.tv_nsec = (ms % 1000) * 1000000L;
+  return ppoll(nullptr, 0, &limit, &mask) < 0 && errno == EINTR ? 1 : 0;
 }
 
 int RJ_wait(int* status) { return wait(status); }

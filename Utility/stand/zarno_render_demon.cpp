@@ -131,6 +131,41 @@ void check_control_directory() {
 
 int interval_seconds() { return static_cast<int>(rndctl.interval_min * 60 + rndctl.interval_sec); }
 
+// How a wait ended.
+enum class Wake { kSignal, kTouched };
+
+// One wait of the service loop: until the 20-second alarm or another signal,
+// or until the pid file's update time moves (a touch by an editor or another
+// daemon, looked at every 200 ms).  `settled` is false while the last reload
+// saw a whole-second stamp in the file server's current second: a touch in
+// that same second leaves the same stamp, so the wait asks the server's
+// clock about once a second and ends for one more reload when it has moved on.
+Wake wait_for_wake(const char* host, bool* settled) {
+  RJ_alarm(20);
+  for (int polls = 1;; ++polls) {
+    if (RJ_pause_for(200) != 0) return Wake::kSignal;
+    if (daemon_updatetime_get(host) != rndctl.last_update) return Wake::kTouched;
+    if (!*settled && polls % 5 == 0 && rj_update_time_settled(rndctl.last_update, rj_heartbeat())) {
+      *settled = true;
+      return Wake::kTouched;
+    }
+  }
+}
+
+// About once a minute, by the monotonic clock: a host's death is judged over
+// minutes, and each look rewrites the task file.
+bool dead_host_check_due() {
+  static struct timespec last = {0, 0};
+  struct timespec now;
+  clock_gettime(CLOCK_MONOTONIC, &now);
+  if (last.tv_sec != 0 && now.tv_sec - last.tv_sec < 60) return false;
+  last = now;
+  return true;
+}
+
+// Leaving: nothing this daemon started may go on rendering unowned.
+void leave() { Task_release_own_renders(); }
+
 // The service loop.  Returns when the daemon is to exit.
 void zrd() {
   const char* host = rndctl.host.c_str();
@@ -140,8 +175,8 @@ void zrd() {
   // either case performs a transition.
   int locked = Dev_schedule_check(host);
 
-  // SIGALRM and SIGCHLD stay blocked from here on; RJ_pause lets them
-  // through only while it waits.
+  // SIGALRM and SIGCHLD are blocked since main's first line and stay so;
+  // the waits let them through only while they wait.
   RJ_sighold(SIGALRM);
   RJ_sighold(SIGCHLD);
   RJ_sigset(SIGALRM, sig_handler);
@@ -151,26 +186,34 @@ void zrd() {
   int idle = 10;
 
   for (;;) {
+    time_t server_now = rj_heartbeat();
     if (daemon_updatetime_get(host) != rndctl.last_update) Update_from_demon(0);
+    if (server_now != 0 && dead_host_check_due()) Task_reclaim_dead_hosts(server_now);
     UpdateRunningTasks();
     for (TASK* task = GetaPendingTask(); task != nullptr; task = GetaPendingTask()) {
       if (Perform_a_Task(task) == 0) SetTaskStatus(task, TASK_FAILED);
     }
     UpdateRunningTasks();
+    bool settled = rj_update_time_settled(rndctl.last_update, rj_heartbeat());
 
     time_t start = time(nullptr);
     bool reload = daemon_updatetime_get(host) != rndctl.last_update || interval < 0;
     while (!reload) {
-      RJ_alarm(20);
-      RJ_pause();
+      Wake wake = wait_for_wake(host, &settled);
       if (!self_check()) {
         wrt_logfile("Exiting due to self check failure");
+        leave();
         return;
       }
+      rj_heartbeat();
+      // A touch is work announced: straight to the reload.  Only the alarm
+      // and the other signals count as the idle wake-ups they always were.
+      if (wake == Wake::kTouched) break;
       if (work_check() == 0) {
         idle = idle - 1;
         if (idle < 0) {
           dbg_logfile("Exiting due to no work found");
+          leave();
           return;
         }
       } else {
@@ -213,6 +256,11 @@ void zrd() {
 }  // namespace
 
 int main(int argc, char* argv[]) {
+  // The wake-up signal of editors and tools may come before the handlers
+  // exist (while start-up waits for a lock): held, it ends the first wait
+  // instead of the process.
+  RJ_sighold(SIGALRM);
+  RJ_sighold(SIGCHLD);
   umask(2);
 
   const char* slash = strrchr(argv[0], '/');
@@ -263,6 +311,9 @@ int main(int argc, char* argv[]) {
   if (pid_file_startup_check() != 0) exit(1);
   open_log_file();
   RJC_in();
+  // Nothing of this host renders now: what the file says it does was left
+  // by a daemon that died.
+  Task_reclaim_this_host();
   zrd();
   exit(1);
 }
