@@ -358,7 +358,14 @@ time_t rj_heartbeat() {
 
 long rj_host_timeout() {
   const char* text = getenv("ZARNO_RNDCTL_HOST_TIMEOUT");
-  if (text == nullptr || *text == '\0') text = get_zarno_variable("ZARNO_RNDCTL_HOST_TIMEOUT");
+  if (text == nullptr || *text == '\0') {
+    // Asked once a minute: a farm without a preferences file would have the
+    // lookup's complaint in the log each time.
+    const char* prefs = find_variable_file(0, nullptr, nullptr);
+    text = prefs != nullptr && *prefs != '\0' && access(prefs, R_OK) == 0
+               ? get_zarno_variable("ZARNO_RNDCTL_HOST_TIMEOUT")
+               : nullptr;
+  }
   if (text != nullptr) {
     char* end = nullptr;
     long value = strtol(text, &end, 10);

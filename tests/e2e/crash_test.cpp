@@ -1,0 +1,204 @@
+// A daemon that crashes, dies with its host or exits loses no task and
+// leaves no render running: the real daemon, killed and restarted on the
+// same control directory.
+#include <dirent.h>
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <cstring>
+
+#include "tests/e2e/render_farm.h"
+#include "tests/support/task_text.h"
+
+namespace {
+
+struct FileRec {
+  int id;
+  float start, end, current;
+  int dev, retries;
+  std::string status;
+};
+
+// The records of the task file, of every group.
+std::vector<FileRec> task_records(Farm& farm) {
+  std::vector<FileRec> recs;
+  std::string text = farm.read("Render_Tasks");
+  size_t at = 0;
+  while ((at = text.find("\n\t", at)) != std::string::npos) {
+    FileRec r{};
+    char status[32];
+    if (sscanf(text.c_str() + at + 2, "%d %f %f %f %d %d %31s", &r.id, &r.start, &r.end, &r.current,
+               &r.dev, &r.retries, status) == 7) {
+      r.status = status;
+      recs.push_back(r);
+    }
+    ++at;
+  }
+  return recs;
+}
+
+bool any_held(Farm& farm) {
+  for (const FileRec& r : task_records(farm)) {
+    if (r.status == "STARTED" || r.status == "RUNNING") return true;
+  }
+  return false;
+}
+
+std::vector<std::string> lock_dirs(Farm& farm) {
+  std::vector<std::string> locks;
+  DIR* d = opendir(farm.dir().c_str());
+  if (d == nullptr) return locks;
+  while (struct dirent* e = readdir(d)) {
+    std::string name = e->d_name;
+    if (name.size() > 5 && name.compare(name.size() - 5, 5, ".lock") == 0) locks.push_back(name);
+  }
+  closedir(d);
+  return locks;
+}
+
+// Gone, or a zombie nobody has reaped yet.
+bool process_gone(int pid) {
+  std::string stat = read_text_file("/proc/" + std::to_string(pid) + "/stat");
+  size_t close = stat.rfind(')');
+  return close == std::string::npos || stat.compare(close + 1, 3, " Z ") == 0;
+}
+
+class CrashTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    host_ = this_host_name();
+    scene_ = make_project(farm_);
+  }
+  ResourceSpec resource(const std::string& name, int index, int max_frames) {
+    ResourceSpec r;
+    r.name = name;
+    r.index = index;
+    r.max_frames = max_frames;
+    r.num_processors = 1;
+    return r;
+  }
+  JobSpec job(float start, float end, const std::vector<std::string>& hosts,
+              const std::string& opts) {
+    JobSpec j;
+    j.start = start;
+    j.end = end;
+    j.hosts = hosts;
+    j.opts = opts;
+    return j;
+  }
+  std::string image(int frame) { return farm_.path("project/pix/spin." + std::to_string(frame)); }
+  bool rendered(int frame) { return access(image(frame).c_str(), F_OK) == 0; }
+  bool finished(Daemon& d) {
+    return wait_for([&] { return job_status(farm_, "spin") == "finished" || d.ended(); }, 120,
+                    &d) &&
+           job_status(farm_, "spin") == "finished";
+  }
+  // The one render program the daemon runs, once its task is RUNNING.
+  int running_render(Daemon& d) {
+    bool running = wait_for(
+        [&] {
+          std::string t = farm_.read("Render_Tasks");
+          return t.find("RUNNING") != std::string::npos && !children_of(d.pid).empty();
+        },
+        60, &d);
+    std::vector<int> kids = children_of(d.pid);
+    return running && kids.size() == 1 ? kids[0] : -1;
+  }
+
+  Farm farm_;
+  std::string host_;
+  std::string scene_;
+};
+
+TEST_F(CrashTest, ARestartedDaemonEndsTheOldRenderAndRendersTheRestFromTheFrameReached) {
+  farm_.write("Render_Resource_Control", resource_file({resource(host_, 1, 6)}));
+  farm_.write("Render_Job_Control", job_file({job(1, 6, {host_}, "slow=1")}, scene_));
+  Daemon& first = farm_.start_on_farm({}, "", render_env());
+  int render = running_render(first);
+  ASSERT_GT(render, 0) << first.log();
+
+  // Let the daemon record the frame reached (a touch of its pid file makes
+  // it look), then kill it while it waits.
+  ASSERT_TRUE(wait_for([&] { return rendered(2); }, 60)) << first.log();
+  utimensat(AT_FDCWD, farm_.path(host_ + ".pid").c_str(), nullptr, 0);
+  ASSERT_TRUE(wait_for(
+      [&] {
+        for (const FileRec& r : task_records(farm_)) {
+          if (r.status == "RUNNING" && r.current > r.start) return true;
+        }
+        return false;
+      },
+      30))
+      << farm_.read("Render_Tasks");
+  ASSERT_TRUE(wait_for(
+      [&] {
+        std::string log = first.log();
+        return lock_dirs(farm_).empty() && log.size() > 30 &&
+               log.rfind("done----UpdateRunningTasks\n") == log.size() - 27;
+      },
+      30));
+  kill(first.pid, SIGKILL);
+  ASSERT_TRUE(wait_for([&] { return first.ended(); }, 10));
+  EXPECT_FALSE(process_gone(render)) << "the render outlives its daemon";
+
+  // The same host again, with the same temporary directory.
+  Daemon& second = farm_.start_on_farm({}, "", {render_env()[0], "DRCTMPDIR=" + first.tmpdir});
+  second.tmpdir = first.tmpdir;
+  EXPECT_TRUE(wait_for([&] { return process_gone(render); }, 30));
+  ASSERT_TRUE(finished(second)) << second.log() << farm_.read("Render_Tasks");
+
+  for (int frame = 1; frame <= 6; ++frame) EXPECT_TRUE(rendered(frame)) << frame;
+  // The old task was cut where it had got to: done frames stay done.
+  std::string log = farm_.read("JOBLOG/spin");
+  EXPECT_EQ(log.find(" 1.000000 - 6.000000\t"), std::string::npos) << log;
+  EXPECT_NE(log.find("\t0\t 1.000000 - "), std::string::npos) << log;
+  EXPECT_FALSE(any_held(farm_)) << farm_.read("Render_Tasks");
+  // Only the live daemon's own passes may still take a lock now and then.
+  EXPECT_TRUE(wait_for([&] { return lock_dirs(farm_).empty(); }, 30));
+  EXPECT_FALSE(second.ended());
+}
+
+TEST_F(CrashTest, ACleanExitEndsItsRenderAndPutsTheTaskBack) {
+  farm_.write("Render_Resource_Control", resource_file({resource(host_, 1, 6)}));
+  farm_.write("Render_Job_Control", job_file({job(1, 6, {host_}, "slow=2")}, scene_));
+  Daemon& d = farm_.start_on_farm({}, "", render_env());
+  int render = running_render(d);
+  ASSERT_GT(render, 0) << d.log();
+
+  ASSERT_EQ(unlink(farm_.path(host_ + ".pid").c_str()), 0);
+  d.wake();
+  ASSERT_TRUE(wait_for([&] { return d.ended(); }, 30));
+  EXPECT_TRUE(wait_for([&] { return process_gone(render); }, 30));
+  EXPECT_FALSE(any_held(farm_)) << farm_.read("Render_Tasks");
+  EXPECT_NE(farm_.read("Render_Tasks").find("PENDING"), std::string::npos);
+  EXPECT_TRUE(lock_dirs(farm_).empty()) << "the exit left a lock behind";
+}
+
+TEST_F(CrashTest, TasksOfAHostWhoseHeartbeatStoppedAreCutAndRenderedHere) {
+  farm_.write("Render_Resource_Control",
+              resource_file({resource(host_, 1, 6), resource("ghost", 2, 6)}));
+  JobSpec spin = job(1, 4, {host_, "ghost"}, "");
+  spin.status = "started";
+  farm_.write("Render_Job_Control", job_file({spin}, scene_));
+  // The ghost had rendered frames 1 and 2 when its host went dark an hour ago.
+  farm_.write("Render_Tasks", group_line("spin", 1, 1, 1) + rec_line(0, 1, 4, 3, 2, 0, "RUNNING"));
+  ASSERT_EQ(mkdir(farm_.path("TSKSTAT").c_str(), 0775), 0);
+  farm_.write("TSKSTAT/ghost", "spin 1 2 -\n");
+  struct timespec old[2] = {{time(nullptr) - 3600, 0}, {time(nullptr) - 3600, 0}};
+  ASSERT_EQ(utimensat(AT_FDCWD, farm_.path("TSKSTAT/ghost").c_str(), old, 0), 0);
+
+  Daemon& d = farm_.start_on_farm({}, "", {render_env()[0], "ZARNO_RNDCTL_HOST_TIMEOUT=60"});
+  ASSERT_TRUE(finished(d)) << d.log() << farm_.read("Render_Tasks");
+  EXPECT_TRUE(rendered(3));
+  EXPECT_TRUE(rendered(4));
+  EXPECT_FALSE(rendered(1)) << "frames the ghost had done are not rendered again";
+  std::string access = farm_.read("Render_Access");
+  EXPECT_NE(access.find("* put back task 0 of \"spin\" from host ghost: no heartbeat for 36"),
+            std::string::npos)
+      << access;
+}
+
+}  // namespace
