@@ -1,9 +1,13 @@
 // The daemon as a process: singleton per host, its pid file, its log, its
 // service loop's wake-ups and its ways to exit.
+#include <fcntl.h>
+#include <signal.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include "tests/e2e/e2e_support.h"
+#include <thread>
+
+#include "tests/e2e/render_farm.h"
 
 namespace {
 
@@ -109,6 +113,45 @@ TEST(DaemonLifecycle, APlantedLinkDoesNotRedirectTheLog) {
   struct stat st;
   ASSERT_EQ(lstat((tmp + "/zarno_render_demon.LOG").c_str(), &st), 0);
   EXPECT_TRUE(S_ISREG(st.st_mode));
+}
+
+TEST(DaemonLifecycle, WakeUpsWhileStartUpWaitsForALockAreSurvived) {
+  Farm farm;
+  std::string lock = farm.path("Render_Resource_Control.lock");
+  ASSERT_EQ(mkdir(lock.c_str(), 0777), 0);
+  Daemon& d = farm.start_on_farm();
+  // The log is opened just before the first load, which waits for the lock.
+  ASSERT_TRUE(wait_for([&] { return access(d.log_path().c_str(), F_OK) == 0; }, 20));
+  for (int i = 0; i < 5; ++i) {
+    kill(d.pid, SIGALRM);
+    std::this_thread::sleep_for(std::chrono::milliseconds(100));
+  }
+  EXPECT_FALSE(d.ended()) << "status " << d.status;
+  EXPECT_FALSE(d.in_loop());
+  ASSERT_EQ(rmdir(lock.c_str()), 0);
+  EXPECT_TRUE(started(farm, d));
+}
+
+TEST(DaemonLifecycle, ATouchOfThePidFileWakesAnIdleDaemonWithoutASignal) {
+  Farm farm;
+  std::string host = this_host_name();
+  std::string scene = make_project(farm);
+  ResourceSpec here{host, 1, 3, 1, "AVAILABLE", ""};
+  farm.write("Render_Resource_Control", resource_file({here}));
+  farm.write("Render_Job_Control", job_file({}, scene));
+  Daemon& d = farm.start_on_farm({"-u", "3600"}, "", render_env());
+  ASSERT_TRUE(started(farm, d));
+  // Preparation and the first pass are over: it waits.
+  ASSERT_TRUE(wait_for([&] { return count_of(d.log(), "done----UpdateRunningTasks") >= 3; }, 20));
+
+  JobSpec spin;
+  spin.start = spin.end = 1;
+  spin.hosts = {host};
+  ASSERT_TRUE(edit_job_file(farm, "End\n", job_file({spin}, scene).substr(21), host));
+  // Never woken by a signal: the 20-second alarm would show as a pause line.
+  ASSERT_TRUE(wait_for([&] { return job_status(farm, "spin") == "finished"; }, 120)) << d.log();
+  std::string log = d.log();
+  EXPECT_EQ(log.substr(0, log.find("Perform_a_Task")).find("pause "), std::string::npos) << log;
 }
 
 TEST(DaemonLifecycle, DebugOptionWinsOverTheEnvironment) {
