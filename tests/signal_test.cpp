@@ -118,6 +118,18 @@ TEST_F(SignalTest, RemoteProbeRunsTheRemoteShellWithoutALocalShell) {
   unsetenv("ZARNO_RSH");
 }
 
+TEST_F(SignalTest, TimedPauseEndsAtItsLimitOrOnASignalThatCameWhileBlocked) {
+  RJ_sighold(SIGALRM);
+  RJ_sigset(SIGALRM, sig_handler);
+  last_signal = 0;
+  EXPECT_EQ(RJ_pause_for(20), 0);
+  raise(SIGALRM);  // held: waits for the pause
+  EXPECT_EQ(last_signal, 0);
+  EXPECT_EQ(RJ_pause_for(10000), 1);
+  EXPECT_EQ(last_signal, SIGALRM);
+  signal(SIGALRM, SIG_DFL);
+}
+
 TEST(SignalDescriptions, TableAndFallback) {
   EXPECT_STREQ(RGget_sig_desc(1), "recieved SIGHUP (Hangup)");
   EXPECT_STREQ(RGget_sig_desc(9), "SIGKILL (Killed)");

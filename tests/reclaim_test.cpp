@@ -1,0 +1,205 @@
+// Taking back held tasks: the put-back cut, the start-up and dead-host
+// cycles on a real task file, the heartbeat judgement and the render registry.
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <string>
+
+#include "tests/support/task_fixture.h"
+#include "tests/support/task_text.h"
+
+namespace {
+
+int count_of(const std::string& text, const std::string& needle) {
+  int n = 0;
+  for (size_t at = text.find(needle); at != std::string::npos; at = text.find(needle, at + 1)) ++n;
+  return n;
+}
+
+class ReclaimTest : public TaskFixture {
+ protected:
+  void SetUp() override {
+    TaskFixture::SetUp();
+    setenv("DRCTMPDIR", dir_.c_str(), 1);
+    far_ = Dev_new(nullptr, nullptr, "far1", 2);
+    far_->host_name.set("farhost");
+  }
+  void TearDown() override {
+    unsetenv("DRCTMPDIR");
+    unsetenv("ZARNO_RSH");
+    rj_render_kill_leftovers();  // forgets whatever a test registered
+    TaskFixture::TearDown();
+  }
+  void set_age(const std::string& name, time_t seconds) {
+    struct timespec t[2] = {{time(nullptr) - seconds, 0}, {time(nullptr) - seconds, 0}};
+    ASSERT_EQ(utimensat(AT_FDCWD, path(name).c_str(), t, 0), 0);
+  }
+  // A child in its own process group that waits to be killed.
+  static pid_t sleeper() {
+    pid_t pid = fork();
+    if (pid == 0) {
+      setpgid(0, 0);
+      for (;;) pause();
+    }
+    setpgid(pid, pid);
+    return pid;
+  }
+  static bool killed(pid_t pid) {
+    int status = 0;
+    for (int i = 0; i < 500; ++i) {
+      if (waitpid(pid, &status, WNOHANG) == pid) return WIFSIGNALED(status);
+      usleep(10000);
+    }
+    kill(pid, SIGKILL);
+    waitpid(pid, &status, 0);
+    return false;
+  }
+  Dev* far_ = nullptr;
+};
+
+struct CutCase {
+  const char* label;
+  float current;
+  const char* expected;  // the group's records after the put-back
+};
+
+class ReclaimPutBack : public ReclaimTest, public testing::WithParamInterface<CutCase> {};
+
+TEST_P(ReclaimPutBack, CutsAtTheFrameReachedKeepingRetries) {
+  TaskGroup* groups = TaskGroup_alloc(job_, 5);
+  TaskRec* rec = TaskRec_alloc(groups, 1, 6, GetParam().current, dev_, TASK_RUNNING, nullptr, 2);
+  rec->retries = 3;
+  Task_put_back(&groups, groups, rec);
+  std::string got;
+  for (TaskRec* r = groups->tasks; r != nullptr; r = r->next) {
+    got += rec_line(r->id, r->start, r->end, r->current, r->dev ? r->dev->index : 0, r->retries,
+                    GetTaskStatusStr(r->status));
+  }
+  EXPECT_EQ(got, GetParam().expected);
+  TaskGroup_free_all(&groups);
+}
+
+// clang-format off
+INSTANTIATE_TEST_SUITE_P(Progress, ReclaimPutBack, testing::Values(
+    CutCase{"none_goes_pending_whole_for_any_host", 1, "\t2\t 1.000000\t 6.000000\t 1.000000  0\t 3\tPENDING\n"},
+    CutCase{"midway_keeps_the_done_frames", 4, "\t2\t 1.000000\t 3.000000\t 3.000000  1\t 3\tFINISHED\n"
+                                               "\t5\t 4.000000\t 6.000000\t 4.000000  0\t 3\tPENDING\n"},
+    CutCase{"at_the_last_frame_leaves_it_pending", 6, "\t2\t 1.000000\t 5.000000\t 5.000000  1\t 3\tFINISHED\n"
+                                                      "\t5\t 6.000000\t 6.000000\t 6.000000  0\t 3\tPENDING\n"}),
+    [](const testing::TestParamInfo<CutCase>& info) { return std::string(info.param.label); });
+// clang-format on
+
+TEST_F(ReclaimTest, StartUpPutsBackOnlyThisHostsHeldTasks) {
+  std::string name = job_->name.c_str();
+  write_file("Render_Tasks", group_line(name, 1, 4, 4) + rec_line(0, 1, 2, 1, 1, 0, "STARTED") +
+                                 rec_line(1, 3, 6, 5, 1, 1, "RUNNING") +
+                                 rec_line(2, 7, 8, 7, 2, 0, "RUNNING") +
+                                 rec_line(3, 9, 10, 9, 0, 0, "PENDING"));
+  EXPECT_EQ(Task_reclaim_this_host(), 2);
+  EXPECT_EQ(read_file("Render_Tasks"),
+            group_line(name, 1, 5, 5) + rec_line(0, 1, 2, 1, 0, 0, "PENDING") +
+                rec_line(1, 3, 4, 4, 1, 1, "FINISHED") + rec_line(2, 7, 8, 7, 2, 0, "RUNNING") +
+                rec_line(3, 9, 10, 9, 0, 0, "PENDING") + rec_line(4, 5, 6, 5, 0, 1, "PENDING"));
+  EXPECT_EQ(access(path("Render_Tasks.lock").c_str(), F_OK), -1);
+}
+
+TEST_F(ReclaimTest, AnotherHostsTaskIsPutBackOnlyWhenItsHeartbeatIsOldAndItsDaemonGone) {
+  // A stand-in remote shell: runs the probe here, so this process counts
+  // as farhost's daemon when the pid file names it.
+  write_file("fake_rsh", "#!/bin/sh\nshift; shift\nexec /bin/sh -c \"$1\"\n");
+  chmod(path("fake_rsh").c_str(), 0755);
+  setenv("ZARNO_RSH", path("fake_rsh").c_str(), 1);
+  mkdir(path("TSKSTAT").c_str(), 0775);
+  std::string name = job_->name.c_str();
+  std::string held = group_line(name, 1, 1, 1) + rec_line(0, 1, 4, 1, 2, 0, "STARTED");
+  struct Case {
+    const char* label;
+    long heartbeat_age;  // -1: no heartbeat file
+    bool daemon_alive;
+    bool put_back;
+  } cases[] = {
+      {"young heartbeat", 30, false, false},
+      {"no heartbeat file", -1, false, false},
+      {"old heartbeat, daemon alive", 3600, true, false},
+      {"old heartbeat, daemon gone", 3600, false, true},
+  };
+  time_t now = time(nullptr);
+  for (const Case& c : cases) {
+    write_file("Render_Tasks", held);
+    unlink(path("TSKSTAT/farhost").c_str());
+    if (c.heartbeat_age >= 0) {
+      write_file("TSKSTAT/farhost", "");
+      set_age("TSKSTAT/farhost", c.heartbeat_age);
+    }
+    unlink(path("farhost.pid").c_str());
+    if (c.daemon_alive) {
+      int32_t me = getpid();
+      write_file("farhost.pid", std::string(reinterpret_cast<const char*>(&me), sizeof me));
+    }
+    EXPECT_EQ(Task_reclaim_dead_hosts(now), c.put_back ? 1 : 0) << c.label;
+    EXPECT_EQ(read_file("Render_Tasks").find("STARTED") == std::string::npos, c.put_back)
+        << c.label;
+  }
+  std::string access = read_file("Render_Access");
+  const std::string line = "put back task 0 of \"" + name + "\" from host farhost: ";
+  EXPECT_NE(access.find(line), std::string::npos) << access;
+  EXPECT_EQ(access.find(line), access.rfind(line)) << access;
+  EXPECT_NE(access.find("no heartbeat for 3600 seconds"), std::string::npos) << access;
+}
+
+TEST_F(ReclaimTest, HeartbeatCreatesTheStatusFileAndKeepsItsLines) {
+  time_t first = rj_heartbeat();
+  EXPECT_GE(first, time(nullptr) - 5);
+  EXPECT_EQ(read_file("TSKSTAT/testhost"), "");
+  write_file("TSKSTAT/testhost", "job 1 2 -\n");
+  set_age("TSKSTAT/testhost", 1000);
+  EXPECT_GE(rj_heartbeat(), first);
+  EXPECT_EQ(read_file("TSKSTAT/testhost"), "job 1 2 -\n");
+}
+
+TEST_F(ReclaimTest, RegistryKillsOnlyTheRendersItRecordedAndIgnoresAPlantedLink) {
+  write_file("victim", "untouched");
+  ASSERT_EQ(symlink(path("victim").c_str(), rj_render_registry_path()), 0);
+  pid_t render = sleeper();
+  pid_t other = sleeper();
+  rj_render_started(render);
+  rj_render_started(other);
+  const std::string both = read_text_file(rj_render_registry_path());
+  rj_render_ended(other);
+  EXPECT_EQ(read_file("victim"), "untouched");
+  struct stat st;
+  ASSERT_EQ(lstat(rj_render_registry_path(), &st), 0);
+  EXPECT_TRUE(S_ISREG(st.st_mode));
+  EXPECT_EQ(count_of(both, "\n"), 2) << both;
+
+  // A line that names a live process under another start time: its pid was
+  // reused, the process is not ours.
+  std::string text = read_text_file(rj_render_registry_path());
+  write_text_file(rj_render_registry_path(), text + std::to_string(other) + " 1\n");
+  EXPECT_EQ(rj_render_kill_leftovers(), 1);
+  EXPECT_TRUE(killed(render));
+  EXPECT_EQ(waitpid(other, nullptr, WNOHANG), 0) << "a reused pid was killed";
+  EXPECT_EQ(read_text_file(rj_render_registry_path()), "");
+
+  // A registry that others may write is not believed.
+  write_text_file(rj_render_registry_path(), both);
+  chmod(rj_render_registry_path(), 0666);
+  EXPECT_EQ(rj_render_kill_leftovers(), 0);
+  EXPECT_EQ(waitpid(other, nullptr, WNOHANG), 0);
+  kill(other, SIGKILL);
+  waitpid(other, nullptr, 0);
+}
+
+TEST(UpdateTimeSettled, AWholeSecondStampWaitsForTheServersNextSecond) {
+  const int64_t second = 1000000000;
+  EXPECT_TRUE(rj_update_time_settled(1700000000 * second + 123, 1700000000));
+  EXPECT_FALSE(rj_update_time_settled(1700000000 * second, 1700000000));
+  EXPECT_TRUE(rj_update_time_settled(1700000000 * second, 1700000001));
+  EXPECT_TRUE(rj_update_time_settled(0, 1700000000));
+}
+
+}  // namespace
