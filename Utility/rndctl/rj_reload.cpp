@@ -4,9 +4,14 @@
 // the control block's lists; its running-task entries point into those lists,
 // so every reload that replaces the lists must re-point the entries before the
 // old records are freed.
+#include <sys/stat.h>
+
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
+#include <string>
 #include <utility>
+#include <vector>
 
 #include "Utility/rndctl/rndctl.h"
 
@@ -100,17 +105,209 @@ int RJC_parse() {
 }
 
 namespace {
-// Reads one control file under its lock into the control block's lists.
-int reload_file(int index) {
-  int result = 0;
+
+// What this process last read from, or wrote to, one control file: the
+// file's identity then and its bytes.  While the file keeps that identity
+// its bytes are the ones held here, and reading it again is waste: one
+// change of a file costs one read however many reloads a pass makes.
+// Rewrites go through a new file renamed into place, so every rewrite gives
+// a new inode; in-place writers still change size or time stamps.
+struct Seen {
+  bool valid = false;
+  struct stat st {};
+  std::string bytes;
+};
+Seen seen[2];
+bool marks_valid = false;  // see take_marks
+
+bool same_identity(const struct stat& a, const struct stat& b) {
+  return a.st_ino == b.st_ino && a.st_dev == b.st_dev && a.st_size == b.st_size &&
+         a.st_mtim.tv_sec == b.st_mtim.tv_sec && a.st_mtim.tv_nsec == b.st_mtim.tv_nsec &&
+         a.st_ctim.tv_sec == b.st_ctim.tv_sec && a.st_ctim.tv_nsec == b.st_ctim.tv_nsec;
+}
+
+void remember(int index, const struct stat& st, const std::string& bytes) {
+  seen[index].valid = true;
+  seen[index].st = st;
+  seen[index].bytes = bytes;
+}
+
+void forget(int index) {
+  seen[index].valid = false;
+  seen[index].bytes.clear();
+}
+
+// True when the file still is what this process last read or wrote.
+bool unchanged(int index) {
+  if (!seen[index].valid) return false;
+  struct stat st;
+  const char* path = fileop_path(index);
+  return path != nullptr && stat(path, &st) == 0 && same_identity(st, seen[index].st);
+}
+
+// The whole of one control file: the bytes held when it has not changed,
+// else read under its lock (held for the read alone; parsing happens after
+// it is released).  The file is made when it does not exist.  Null when it
+// cannot be opened.
+const Seen* read_file(int index) {
+  if (unchanged(index)) return &seen[index];
+  std::string bytes;
+  struct stat st {};
   lock_fileop(index, 1);
-  if (read_fileop(index) != nullptr) {
-    result = RJC_parse();
+  FILE* fp = read_fileop(index);
+  bool ok = fp != nullptr && fstat(fileno(fp), &st) == 0;
+  if (fp != nullptr) {
+    char buf[1 << 16];
+    size_t n;
+    while (ok && (n = fread(buf, 1, sizeof buf, fp)) > 0) bytes.append(buf, n);
+    if (ferror(fp)) ok = false;
     close_fileop(index);
+  }
+  lock_fileop(index, 0);
+  if (!ok) {
+    forget(index);
+    return nullptr;
+  }
+  remember(index, st, bytes);
+  return &seen[index];
+}
+
+int parse_bytes(int index, const std::string& bytes) {
+  // An empty file (just made) is no syntax error: there is nothing to read.
+  if (bytes.empty()) return 0;
+  const char* saved_path = RJCpath;
+  RJCpath = fileop_path(index);
+  int result = RJC_parse_string(bytes.data(), bytes.size(), fileop_path(index));
+  RJCpath = saved_path;
+  return result;
+}
+
+// The text the writer makes of the control block's list for file `index`.
+std::string render(int index) {
+  char* buf = nullptr;
+  size_t size = 0;
+  FILE* fp = open_memstream(&buf, &size);
+  if (fp == nullptr) return std::string();
+  if (index == FILE_JOBS) {
+    Job_control_write_dev(fp);
+  } else {
+    Resource_control_write_dev(fp);
+  }
+  fclose(fp);
+  std::string text(buf != nullptr ? buf : "", size);
+  free(buf);  // made by open_memstream with the C library's allocator
+  return text;
+}
+
+// Replaces file `index` with `text` under its lock, when the file is still
+// the version `expected` describes.  Returns 1 written, 0 when somebody else
+// rewrote the file since (nothing written: the caller reads the newer
+// version), -1 when the write failed (reported by the file operations; the
+// old file stands).
+int write_if_unchanged(int index, const std::string& text, const struct stat& expected) {
+  lock_fileop(index, 1);
+  struct stat st;
+  const char* path = fileop_path(index);
+  int result;
+  if (path == nullptr || stat(path, &st) != 0 || !same_identity(st, expected)) {
+    result = 0;
+  } else {
+    FILE* fp = update_fileop(index);
+    if (fp == nullptr) {
+      result = -1;
+    } else {
+      rewind_fileop(index);
+      bool ok = fwrite(text.data(), 1, text.size(), fp) == text.size() && fflush(fp) == 0;
+      close_and_truncate_fileop(index);
+      result = ok ? 1 : -1;
+      if (ok && stat(path, &st) == 0) {
+        remember(index, st, text);
+      } else {
+        forget(index);
+      }
+    }
   }
   lock_fileop(index, 0);
   return result;
 }
+
+// Reads one control file into the control block's lists (a plain reload).
+// A file that is still what this process last read or wrote is not parsed
+// again: the lists already hold it.
+int reload_file(int index) {
+  if (unchanged(index)) return 0;
+  const Seen* file = read_file(index);
+  if (file == nullptr) return 0;
+  // The lists now hold what no sync settled (and a plain reload keeps the
+  // records that left the file): the next reconciling reload reads in full.
+  marks_valid = false;
+  return parse_bytes(index, file->bytes);
+}
+
+// The fields the reconciling reload settles, as they stood in the files at
+// the last sync, so that a pass that changed none of them costs no read and
+// no write.  The daemon changes job records only there (state, comment,
+// frames done, deletion mark) and its own resources' frames and processors.
+struct JobMark {
+  const Job* job;
+  int index;
+  Text status;
+  Text comment;
+  int doneframes;
+  int deleted;
+};
+struct DevMark {
+  const Dev* dev;
+  int index;
+  int max_frames;
+  int num_processors;
+};
+std::vector<JobMark> job_marks;
+std::vector<DevMark> dev_marks;
+
+void take_marks() {
+  job_marks.clear();
+  dev_marks.clear();
+  for (const Job* j = rndctl.jobs; j != nullptr; j = j->next) {
+    job_marks.push_back({j, j->index, j->status, j->comment, j->doneframes, j->deleted});
+  }
+  for (const Dev* d = rndctl.devs; d != nullptr; d = d->next) {
+    dev_marks.push_back({d, d->index, d->max_frames, d->num_processors});
+  }
+  marks_valid = true;
+}
+
+bool same_text(const Text& a, const Text& b) {
+  if (a.none() || b.none()) return a.none() == b.none();
+  return strcmp(a.c_str(), b.c_str()) == 0;
+}
+
+// True when the lists still hold exactly what the files held at the last sync.
+bool lists_clean() {
+  if (!marks_valid) return false;
+  size_t i = 0;
+  for (const Job* j = rndctl.jobs; j != nullptr; j = j->next, ++i) {
+    if (i >= job_marks.size()) return false;
+    const JobMark& m = job_marks[i];
+    if (m.job != j || m.index != j->index || m.doneframes != j->doneframes ||
+        m.deleted != j->deleted || !same_text(m.status, j->status) ||
+        !same_text(m.comment, j->comment)) {
+      return false;
+    }
+  }
+  if (i != job_marks.size()) return false;
+  i = 0;
+  for (const Dev* d = rndctl.devs; d != nullptr; d = d->next, ++i) {
+    if (i >= dev_marks.size()) return false;
+    const DevMark& m = dev_marks[i];
+    if (m.dev != d || m.index != d->index || m.max_frames != d->max_frames ||
+        m.num_processors != d->num_processors) {
+      return false;
+    }
+  }
+  return i == dev_marks.size();
+}
+
 }  // namespace
 
 int RJC_reload(int /*flag*/) {
@@ -161,27 +358,20 @@ void RJC_out() {
   Job_control_write(rndctl.location.c_str());
 }
 
-void Update_from_demon(int editor) {
-  dbgpnt("Update_from_demon................................%s\n", editor ? "TRUE" : "FALSE");
-  // The update time as it stands before the files are read is the one these
-  // files answer.  A touch that lands while they are being read or written
-  // must still read as a change afterwards, or an editor's change that came
-  // in during the pass would wait for the next timed check.
-  const int64_t seen_before = daemon_updatetime_get(rndctl.host.c_str());
+namespace {
 
+// One reconciling reload from the files' bytes: parse them into fresh lists,
+// carry the running-task entries and the settled fields over, drop the old
+// records.  The files are read and written outside this step.
+void reconcile_from(const std::string& resources, const std::string& jobs, int editor) {
   // Set the in-memory lists aside; the parse below fills fresh ones.
   Lists old;
   swap_lists(old);
   rndctl.current_job = nullptr;
   rndctl.current_dev = nullptr;
 
-  lock_fileop(FILE_JOBS, 1);
-  lock_fileop(FILE_RESOURCES, 1);
-
-  FILE* resources = update_fileop(FILE_RESOURCES);
-  if (resources != nullptr) RJC_parse();
-  FILE* jobs = update_fileop(FILE_JOBS);
-  if (jobs != nullptr) RJC_parse();
+  parse_bytes(FILE_RESOURCES, resources);
+  parse_bytes(FILE_JOBS, jobs);
 
   // Re-point every running-task entry at the fresh records (by index) while
   // the old ones still exist.  Entries of jobs or resources that left the
@@ -209,22 +399,71 @@ void Update_from_demon(int editor) {
   while (rndctl.jobs != nullptr) Job_del(rndctl.jobs);
   swap_lists(old);    // control block empty again (old is now empty too)
   swap_lists(fresh);  // fresh lists installed
-
   detach_tasks_of_deleted_jobs();
-  if (resources != nullptr) {
-    rewind_fileop(FILE_RESOURCES);
-    Resource_control_write_dev(resources);
-    close_and_truncate_fileop(FILE_RESOURCES);
-  }
-  if (jobs != nullptr) {
-    rewind_fileop(FILE_JOBS);
-    Job_control_write_dev(jobs);
-    close_and_truncate_fileop(FILE_JOBS);
+}
+
+// Writes the lists back where they differ from the bytes read.  Returns
+// false when a file was rewritten by somebody else since it was read.
+bool write_back(const std::string& resources, const struct stat& res_st, const std::string& jobs,
+                const struct stat& job_st) {
+  bool current = true;
+  std::string text = render(FILE_RESOURCES);
+  if (text != resources) current = write_if_unchanged(FILE_RESOURCES, text, res_st) != 0 && current;
+  text = render(FILE_JOBS);  // the writer drops the jobs marked for deletion
+  if (text != jobs) current = write_if_unchanged(FILE_JOBS, text, job_st) != 0 && current;
+  return current;
+}
+
+// Only the reload at the start of a pass (editor 0) may call a change of the
+// update time seen.  The write-back at the end of a pass (editor 1) comes
+// after this pass has picked its work: a touch that landed during the pass
+// (an editor releasing a paused job, a piece put back) would be folded into
+// the lists but never picked up, and with a check interval of 0:00 the host
+// would wait for ever.  Left unseen, it makes the next wait end at once.
+void mark_seen(int editor, int64_t update_time) {
+  if (editor == 0) rndctl.last_update = update_time;
+}
+
+}  // namespace
+
+void Update_from_demon(int editor) {
+  dbgpnt("Update_from_demon................................%s\n", editor ? "TRUE" : "FALSE");
+  // The update time as it stands before the files are read is the one these
+  // files answer.  A touch that lands while they are being read or written
+  // must still read as a change afterwards, or an editor's change that came
+  // in during the pass would wait for the next timed check.
+  const int64_t seen_before = daemon_updatetime_get(rndctl.host.c_str());
+
+  // Neither file changed since this process last read or wrote it, and the
+  // lists still hold what it held: reading them back and writing the same
+  // bytes again would change nothing.
+  if (unchanged(FILE_RESOURCES) && unchanged(FILE_JOBS) && lists_clean()) {
+    mark_seen(editor, seen_before);
+    dbgpnt("Update_from_demon done..........................\n\n");
+    return;
   }
 
-  lock_fileop(FILE_RESOURCES, 0);
-  lock_fileop(FILE_JOBS, 0);
+  // Each file's lock is held only to read it and, when the lists differ from
+  // it, to replace it; never both locks at once, never while parsing.  A file
+  // rewritten by somebody else between the read and the write is read again
+  // and settled against once more: the settling rules make that converge.
+  for (int attempt = 0; attempt < 8; ++attempt) {
+    const Seen* res = read_file(FILE_RESOURCES);
+    const Seen* job = read_file(FILE_JOBS);
+    // Copies: a write-back replaces what is remembered of the files.
+    const std::string resources = res != nullptr ? res->bytes : std::string();
+    const std::string jobs = job != nullptr ? job->bytes : std::string();
+    const struct stat res_st = res != nullptr ? res->st : (struct stat){};
+    const struct stat job_st = job != nullptr ? job->st : (struct stat){};
+    reconcile_from(resources, jobs, editor);
+    if (res == nullptr || job == nullptr) break;  // reported by the open; nothing to write to
+    if (write_back(resources, res_st, jobs, job_st)) break;
+    // In the daemon the files as they stand win: what it failed to write
+    // goes with the newer version, which the next read takes as it is.
+    if (editor == 0 && attempt > 0) break;
+  }
+  take_marks();
 
-  rndctl.last_update = seen_before;
+  mark_seen(editor, seen_before);
   dbgpnt("Update_from_demon done..........................\n\n");
 }
