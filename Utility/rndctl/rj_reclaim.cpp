@@ -49,9 +49,14 @@ int put_back_cycle(Pick pick) {
       if (!seen) touched.push_back(g->job);
     }
   }
-  rewind_fileop(FILE_TASKS);
-  Task_write(fp, groups);
-  close_and_truncate_fileop(FILE_TASKS);
+  if (count > 0) {
+    rewind_fileop(FILE_TASKS);
+    Task_write(fp, groups);
+    close_and_truncate_fileop(FILE_TASKS);
+  } else {
+    // Nothing put back: a rewrite would only turn the groups round.
+    close_fileop(FILE_TASKS);
+  }
   lock_fileop(FILE_TASKS, 0);
   TaskGroup_free_all(&groups);
   for (Job* j : touched) Job_wake_other_hosts(j);

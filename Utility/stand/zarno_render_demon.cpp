@@ -147,6 +147,9 @@ Wake wait_for_wake(const char* host, bool* settled) {
     if (daemon_updatetime_get(host) != rndctl.last_update) return Wake::kTouched;
     if (!*settled && polls % 5 == 0 && rj_update_time_settled(rndctl.last_update, rj_heartbeat())) {
       *settled = true;
+      // Forget the stamp: the reload must be the reconciling one, which
+      // takes the files as they stand, as for any other touch.
+      rndctl.last_update = -1;
       return Wake::kTouched;
     }
   }
