@@ -182,8 +182,8 @@ struct RndPathList {  // hangs from a job: one image search path
 // Tasks (rj_tskio, rj_task).
 struct TaskGroup {
   TaskGroup* next = nullptr;
-  Job* job = nullptr;        // non-owning
-  TaskRec* tasks = nullptr;  // records in creation order
+  Job* job = nullptr;         // non-owning
+  TaskRec* tasks = nullptr;   // records in creation order
   int next_task_id = 0;
 };
 
@@ -206,11 +206,11 @@ struct TaskRec {
 struct TASK {
   TASK* next = nullptr;
   TASK* prev = nullptr;
-  TaskRec* rec = nullptr;       // owned once the entry has taken it over
-  Job* job = nullptr;           // non-owning; null when the job left the file
-  volatile int pid = 0;         // written by the SIGCHLD handler
+  TaskRec* rec = nullptr;  // owned once the entry has taken it over
+  Job* job = nullptr;      // non-owning; null when the job left the file
+  volatile int pid = 0;        // written by the SIGCHLD handler
   volatile int waitstatus = 0;  // exit value, written by the SIGCHLD handler
-  FILE* stream = nullptr;       // owned: the task's log stream, open for reading
+  FILE* stream = nullptr;  // owned: the task's log stream, open for reading
   Text out_path;
   Text stream_path;
   Text output;
