@@ -42,7 +42,7 @@ const char* const kResourceKeywords[] = {"host_name",  "remote_location", "statu
 template <size_t N>
 bool listed(const char* const (&table)[N], const char* text) {
   for (const char* keyword : table)
-    if (strcmp(keyword, text) == 0) return true;
+    if (keyword[0] == text[0] && strcmp(keyword, text) == 0) return true;
   return false;
 }
 
