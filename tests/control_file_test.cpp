@@ -1,6 +1,6 @@
 // The control-file reader and writers: hand-written files with their exact
-// rewritten form, random record sets written, read back and written again,
-// and the ways a bad file ends the process.
+// rewritten form, records holding any text written, read back and written
+// again, and the ways a bad file ends the process.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <unistd.h>
@@ -14,24 +14,16 @@
 #include <utility>
 #include <vector>
 
+#include "Shared/memory/MA_rtns.h"
 #include "tests/support/test_support.h"
+#include "tests/support/text_records.h"
 
 namespace {
 
 using testing::HasSubstr;
 using testing::Not;
 
-std::string written(void (*writer)(FILE*)) {
-  char* buf = nullptr;
-  size_t size = 0;
-  FILE* fp = open_memstream(&buf, &size);
-  if (fp == nullptr) return "<open_memstream failed>";
-  writer(fp);
-  fclose(fp);
-  std::string text(buf, size);
-  free(buf);
-  return text;
-}
+using text_records::written;
 
 std::string written_jobs() { return written(Job_control_write_dev); }
 std::string written_devs() { return written(Resource_control_write_dev); }
@@ -41,20 +33,7 @@ int parse(const std::string& text, const char* file = "Render_Job_Control") {
 }
 int parse_devs(const std::string& text) { return parse(text, "Render_Resource_Control"); }
 
-void delete_lists() {
-  while (rndctl.jobs != nullptr) Job_del(rndctl.jobs);
-  while (rndctl.devs != nullptr) Dev_del(rndctl.devs);
-}
-
-// Everything a reload replaces, so that a file can be read into empty lists
-// while the records it was written from are kept for comparison.
-void swap_lists(RndCtl& a, RndCtl& b) {
-  std::swap(a.jobs, b.jobs);
-  std::swap(a.devs, b.devs);
-  std::swap(a.job_index, b.job_index);
-  std::swap(a.dev_index, b.dev_index);
-  std::swap(a.dev_name_index, b.dev_name_index);
-}
+using text_records::delete_lists;
 
 int fatal_status = 0;  // what the last syntax or lexical error ended with
 
@@ -280,169 +259,204 @@ TEST_F(ControlFileTest, LexicalErrorExitsWithMinusOne) {
   RJCreadfile = nullptr;
 }
 
-// Round trip: random records written, read back into empty lists and written
-// again give the same text and the same records, but for what the format
-// drops on purpose.
-class RoundTripTest : public ControlFileTest, public testing::WithParamInterface<unsigned> {
- protected:
-  std::mt19937 rng{GetParam()};
+// Every text a record may hold, whatever its bytes, reads back as the
+// writer's form of it, and what is read back writes as the same text.
+class HostileTextTest : public ControlFileTest, public testing::WithParamInterface<const char*> {};
 
-  int pick(int lo, int hi) { return std::uniform_int_distribution<int>(lo, hi)(rng); }
-  bool chance(int percent) { return pick(1, 100) <= percent; }
+TEST_P(HostileTextTest, ReadsBackAsWritten) {
+  survive_errors();
+  EXPECT_EQ(text_records::check({GetParam()}), "");
+  EXPECT_EQ(fatal_status, 0);
+}
 
-  // A bare word that is no keyword and no number: it starts with a letter
-  // and ends with a digit, which no keyword does.
-  std::string word() {
-    static const char tail[] =
-        "abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789._#@-";
-    std::string w(1, static_cast<char>(pick(0, 1) ? pick('a', 'z') : pick('A', 'Z')));
-    for (int n = pick(0, 10); n > 0; --n) w += tail[pick(0, sizeof tail - 2)];
-    return w + static_cast<char>(pick('0', '9'));
+// clang-format off
+INSTANTIATE_TEST_SUITE_P(Texts, HostileTextTest, testing::Values(
+    "", "plain", "10.1.2.3", "12", "1.5", "-1", "-render", "1-2", "12abc", ".5", "render farm",
+    "status", "user", "host_name", "End", "TRUE", "to", "RenderJobControl", "users",
+    "a\"b", "\"", "\"\"status\"", "*/", "a*/b*/c", "**/", "*", "/*", "x*", "line\nbreak",
+    "tab\there", "bell\a\x1b[31m", "\x7f", "caf\xc3\xa9", "\xff\xfe\x80", "a;b", "{", "}",
+    "a,b", "=", "#x", "@", "new_resource", "dir/sub/name", "dir/", "/", "a/\"b c\"",
+    "Error: frame 12 */ \"bad\" \x01\x02 done"));
+// clang-format on
+
+TEST_F(ControlFileTest, LongTextsAreCutWhereTheReaderCutsThem) {
+  survive_errors();
+  for (size_t length :
+       {RJC_STRING_LIMIT - 1, RJC_STRING_LIMIT, RJC_STRING_LIMIT + 1, size_t{5000}}) {
+    SCOPED_TRACE(length);
+    EXPECT_EQ(text_records::check({std::string(length, 'w')}), "");
+    EXPECT_EQ(text_records::check({std::string(length, ' ')}), "");
+    // Quotes are dropped before the cut: the reader counts what is between them.
+    EXPECT_EQ(text_records::check({std::string(length, '"') + std::string(length, 'q')}), "");
   }
-  const char* word_or_none() { return chance(70) ? (word_ = word()).c_str() : nullptr; }
+  EXPECT_EQ(RJC_string_form(std::string(3000, 'x').c_str()).size(), RJC_STRING_LIMIT);
+  EXPECT_EQ(fatal_status, 0);
+}
 
-  // Free text: anything printable but a quote (a comment may hold quotes but
-  // never closes itself), with blanks, tabs, newlines, and now and then right
-  // at the length limit.
-  std::string text(bool comment = false) {
-    std::string t;
-    for (int i = chance(5) ? 1023 : pick(0, 40); i > 0; --i) {
-      int c = pick(0, 99);
-      char ch = c < 5 ? '\n' : c < 8 ? '\t' : static_cast<char>(pick(' ', '~'));
-      if (ch == '"' && !comment) ch = '\'';
-      if (ch == '/' && comment && !t.empty() && t.back() == '*') ch = '|';
-      t += ch;
+// Random bytes, weighted towards the characters the format cares about.
+TEST_F(ControlFileTest, RandomTextsReadBackAsWritten) {
+  survive_errors();
+  std::mt19937 rng(20240611);
+  auto pick = [&](int lo, int hi) { return std::uniform_int_distribution<int>(lo, hi)(rng); };
+  static const char special[] = "\"*/ \t\n;,={}-.#@_0123456789";
+  for (int round = 0; round < 300; ++round) {
+    std::vector<std::string> texts;
+    for (int i = pick(1, 20); i > 0; --i) {
+      std::string t;
+      for (int n = pick(0, 3) == 0 ? pick(1000, 1100) : pick(0, 12); n > 0; --n)
+        t += pick(0, 1) ? special[pick(0, sizeof special - 2)] : static_cast<char>(pick(1, 255));
+      texts.push_back(t);
     }
-    return t;
+    ASSERT_EQ(text_records::check(texts), "") << "round " << round;
   }
+  EXPECT_EQ(fatal_status, 0);
+}
 
-  void grid(int* week) {
-    std::fill(week, week + RJ_WEEK, 0);
-    if (chance(30)) return;
-    if (chance(30)) {
-      for (int i = 0; i < RJ_WEEK; ++i) week[i] = chance(40) ? 1 : 0;
-      return;
-    }
-    for (int n = pick(1, 4); n > 0; --n) {
-      int d0 = pick(0, 6), d1 = pick(d0, 6), s0 = pick(0, 47), s1 = pick(s0, 47);
-      for (int d = d0; d <= d1; ++d)
-        for (int s = s0; s <= s1; ++s) week[d * 48 + s] = 1;
-    }
-  }
-
-  void make_records() {
-    std::vector<Dev*> devs;
-    for (int i = pick(0, 6); i > 0; --i) {
-      Dev* dev = Add_a_dev(nullptr, (word() + "_" + std::to_string(i)).c_str(), 1000 + i);
-      ASSERT_NE(dev, nullptr);
-      dev->lock_pid = chance(50) ? 0 : pick(-5, 99999);
-      if (chance(50)) dev->comment.set(text(true).c_str());
-      dev->host_name.set(word().c_str());
-      dev->remote_location.set(text().c_str());
-      dev->status = pick(LOCK_LOCKED, LOCK_SCHEDULE);
-      dev->max_frames = pick(-3, 500);
-      dev->num_processors = pick(0, 64);
-      dev->default_dev = pick(0, 1);
-      grid(dev->locks);
-      devs.push_back(dev);
-    }
-    for (int i = pick(0, 12); i > 0; --i) {
-      Job* job = Add_a_job(nullptr, (word() + ".sdl").c_str(), i * 7 + pick(0, 6));
-      ASSERT_NE(job, nullptr);
-      if (chance(60)) job->comment.set(text(true).c_str());
-      job->lock_pid = chance(50) ? 0 : pick(1, 99999);
-      job->del_when_done = pick(0, 1);
-      job->user.set(word_or_none());
-      job->status.set(text().c_str());
-      job->priority = pick(-100, 100);
-      job->executable.set(word_or_none());
-      for (Text* field : {&job->sdl, &job->pix, &job->matte, &job->rnd_opts})
-        field->set(chance(70) ? text().c_str() : nullptr);
-      job->use_sdl_paths = pick(0, 1);
-      job->output_mask = pick(0, 1);
-      job->animate = chance(60) ? 1 : 0;
-      // Multiples of 1/64 print exactly with six decimals.
-      for (float& f : job->frames) f = static_cast<float>(pick(-64000, 640000)) / 64.0f;
-      job->extension = chance(50) ? 0 : pick(1, 300);
-      job->ext_start = pick(-10, 1000);
-      job->ext_by = pick(-2, 10);
-      job->ext_size = pick(0, 8);
-      job->save_out = pick(0, 1);
-      job->ctrl = pick(0, 5);
-      job->fields = pick(0, 3);
-      job->totalframes = pick(0, 100000);
-      job->doneframes = pick(0, 100000);
-      std::vector<Dev*> order = devs;
-      std::shuffle(order.begin(), order.end(), rng);
-      for (Dev* dev : order)
-        if (chance(50)) RndDevList_add(job, dev);
-      for (int n = pick(0, 3); n > 0; --n) RndPathList_add(job, text().c_str());
-      grid(job->runs);
-      job->deleted = chance(10) ? 1 : 0;
-    }
-  }
-
-  std::string word_;
+// What the file shows: valid names keep their bytes, the rest is quoted.
+struct Shown {
+  const char* text;
+  const char* line;
 };
 
-// What the format leaves out on purpose, applied to the records written.
-void drop_unwritten(Job* jobs, Dev* devs) {
-  for (Dev* dev = devs; dev != nullptr; dev = dev->next) dev->comment.reset();
-  for (Job* job = jobs; job != nullptr; job = job->next) {
-    if (job->animate == 0) {
-      job->frames[0] = job->frames[1] = job->frames[2] = 0.0f;
-      job->extension = job->save_out = job->fields = job->doneframes = 0;
-      job->ctrl = RUN_AVAILABLE;
-      job->rnd_opts.reset();
-      job->totalframes = 1;
-    } else if (job->ctrl != RUN_PAUSED && job->ctrl != RUN_SCHEDULE && job->ctrl != RUN_NOW) {
-      job->ctrl = RUN_AVAILABLE;
-    }
-    if (job->extension == 0) {
-      job->ext_start = 0;
-      job->ext_by = job->ext_size = 1;
+class WrittenFormTest : public ControlFileTest, public testing::WithParamInterface<Shown> {};
+
+TEST_P(WrittenFormTest, HostNameLine) {
+  Dev* dev = Add_a_dev(nullptr, "box", 1);
+  ASSERT_NE(dev, nullptr);
+  dev->host_name.set(GetParam().text);
+  EXPECT_THAT(written_devs(), HasSubstr(GetParam().line));
+}
+
+// clang-format off
+INSTANTIATE_TEST_SUITE_P(Names, WrittenFormTest, testing::Values(
+    Shown{"hostA", "\thost_name\t\t= hostA;\n"},
+    Shown{"12abc", "= 12abc;"}, Shown{".5", "= .5;"}, Shown{"a-b#c@d", "= a-b#c@d;"},
+    Shown{"runs", "= runs;"},  // a keyword of the other file only
+    Shown{"10.1.2.3", "= \"10.1.2.3\";"}, Shown{"42", "= \"42\";"},
+    Shown{"-x", "= \"-x\";"}, Shown{"render farm", "= \"render farm\";"},
+    Shown{"status", "= \"status\";"}, Shown{"End", "= \"End\";"}, Shown{"", "= \"\";"},
+    Shown{"a\"b", "= ab;"}, Shown{"sta\"tus", "= \"status\";"}));
+// clang-format on
+
+TEST_F(ControlFileTest, CommentsBreakTheirClosingMark) {
+  Job* job = Add_a_job(nullptr, "c.sdl", 3);
+  Dev* dev = Add_a_dev(nullptr, "box", 1);
+  ASSERT_TRUE(job && dev);
+  job->comment.set("a*/b**/");
+  dev->comment.set("*/");
+  EXPECT_THAT(written_jobs(), HasSubstr("\t/*a* /b** /*/\n"));
+  EXPECT_THAT(written_devs(), HasSubstr("/* * / */\n"));
+}
+
+// The check interval: what the loop cannot wait for is refused, reported
+// once, and the interval in force stays.
+TEST_F(ControlFileTest, BadCheckIntervalsAreRefusedOnce) {
+  ASSERT_EQ(parse("RenderJobControl 3 7\nEnd\n"), 0);
+  struct {
+    const char* header;
+    bool refused;
+  } const cases[] = {{"-1 0", true},         {"0 -1", true},       {"1 60", true},
+                     {"2147483647 0", true}, {"35791394 8", true}, {"0 0", false},
+                     {"35791394 7", false}};
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.header);
+    const unsigned min = rndctl.interval_min, sec = rndctl.interval_sec;
+    const std::string text = std::string("RenderJobControl ") + c.header + "\nEnd\n";
+    testing::internal::CaptureStderr();
+    ASSERT_EQ(parse(text), 0);
+    ASSERT_EQ(parse(text), 0);  // a reload of the same file
+    const std::string log = testing::internal::GetCapturedStderr();
+    if (c.refused) {
+      EXPECT_EQ(rndctl.interval_min, min);
+      EXPECT_EQ(rndctl.interval_sec, sec);
+      char expected[256];
+      snprintf(expected, sizeof expected,
+               " from Render_Job_Control: out of range, keeping %u:%02u\n", min, sec);
+      EXPECT_THAT(log, HasSubstr(expected));
+      EXPECT_EQ(log.find("ignoring check interval"), log.rfind("ignoring check interval"));
     } else {
-      job->extension = 291;
+      EXPECT_EQ(log.find("ignoring"), std::string::npos) << log;
+      EXPECT_NE(written_jobs().find(std::string("RenderJobControl ") + c.header + "\n"),
+                std::string::npos);
     }
   }
+  testing::internal::CaptureStderr();
+  EXPECT_EQ(RJC_set_check_interval(-1, 59, "-u"), 0);
+  EXPECT_THAT(
+      testing::internal::GetCapturedStderr(),
+      HasSubstr("ignoring check interval -1:59 from -u: out of range, keeping 35791394:07"));
 }
 
-TEST_P(RoundTripTest, WriteReadWriteIsStable) {
-  ASSERT_NO_FATAL_FAILURE(make_records());
-  rndctl.interval_min = static_cast<unsigned>(pick(0, 60));
-  rndctl.interval_sec = static_cast<unsigned>(pick(0, 59));
+// A render program's output goes into the job's comment: whatever it holds,
+// the job file still parses and keeps the line's readable text.
+class ErrorLineTest : public ControlFileTest, public testing::WithParamInterface<std::string> {};
 
-  const std::string res_text = written_devs();
-  const std::string job_text = written_jobs();
-  EXPECT_THAT(res_text + job_text, Not(HasSubstr("(null)")));
-  for (Job* job = rndctl.jobs; job != nullptr; job = job->next) EXPECT_EQ(job->deleted, 0);
-  drop_unwritten(rndctl.jobs, rndctl.devs);
-  // Without the comments nothing reads back; the jobs lose nothing written.
-  const std::string res_expected = written_devs();
-  EXPECT_EQ(written_jobs(), job_text);
+TEST_P(ErrorLineTest, CommentReadsBack) {
+  Job* job = Add_a_job(nullptr, "e.sdl", 5);
+  Dev* dev = Add_a_dev(nullptr, "box", 1);
+  ASSERT_TRUE(job && dev);
+  dev->host_name.set("boxhost");
+  job->comment.set("earlier */ note");
+  write_file("out.log", GetParam());
+  auto* rec = MA_new<TaskRec>(__LINE__, "tests/control_file_test");
+  rec->dev = dev;
+  rec->start = 12.0f;
+  TASK entry;
+  entry.rec = rec;
+  entry.job = job;
+  entry.out_path.set(path("out.log").c_str());
+  entry.waitstatus = 1;
+  Job_Error_Update(&entry);
+  entry.rec = nullptr;
+  MA_delete(rec, __LINE__, "tests/control_file_test");
+  ASSERT_TRUE(job->comment);
+  EXPECT_THAT(job->comment.c_str(), HasSubstr("ERROR: box (boxhost) frame 12.0\n"));
 
-  RndCtl aside;
-  swap_lists(rndctl, aside);
-  ASSERT_EQ(parse_devs(res_text), 0);
-  ASSERT_EQ(parse(job_text), 0);
-  EXPECT_EQ(written_devs(), res_expected);
-  EXPECT_EQ(written_jobs(), job_text);
-
-  Dev* a = aside.devs;
-  Dev* b = rndctl.devs;
-  for (; a != nullptr && b != nullptr; a = a->next, b = b->next)
-    EXPECT_EQ(ISA_devdif(a, b), 0) << a->name.or_else("noname");
-  EXPECT_TRUE(a == nullptr && b == nullptr) << "resource lists differ in length";
-  Job* x = aside.jobs;
-  Job* y = rndctl.jobs;
-  for (; x != nullptr && y != nullptr; x = x->next, y = y->next)
-    EXPECT_EQ(ISA_jobdif(x, y), 0) << x->name.or_else("noname");
-  EXPECT_TRUE(x == nullptr && y == nullptr) << "job lists differ in length";
-
+  const std::string jobs = written_jobs();
   delete_lists();
-  swap_lists(rndctl, aside);
+  survive_errors();
+  ASSERT_EQ(parse(jobs), 0) << jobs;
+  ASSERT_NE(Job_by_index(5), nullptr);
+  const std::string comment = Job_by_index(5)->comment.or_else("");
+  EXPECT_THAT(comment, HasSubstr("earlier * / note"));
+  EXPECT_THAT(comment, HasSubstr("Error"));
+  EXPECT_THAT(comment, HasSubstr("frame 12 failed"));
 }
 
-INSTANTIATE_TEST_SUITE_P(Seeds, RoundTripTest, testing::Range(1u, 41u));
+// clang-format off
+INSTANTIATE_TEST_SUITE_P(Outputs, ErrorLineTest, testing::Values(
+    std::string("rendering\nError: frame 12 failed */ now\n"),
+    std::string("Error \"quoted\" frame 12 failed \"\n"),
+    std::string("\x1b[31mError\x1b[0m frame 12 failed\a\r\n"),
+    std::string("junk\x01\x02\xff") + std::string(1, '\0') + "Error frame 12 failed\0tail\n",
+    "Error frame 12 failed " + std::string(280, 'x') + "\n",
+    std::string(300, '*') + "/Error frame 12 failed\n"));
+// clang-format on
+
+// The task status file is read back by "%s": a job name with blanks must
+// not shift the fields after it.
+TEST_F(ControlFileTest, StatusFileNamesAreOneToken) {
+  Job* job = Add_a_job(nullptr, "x.sdl", 5);
+  Job* other = Add_a_job(nullptr, "y.sdl", 6);
+  Dev* dev = Add_a_dev(nullptr, "box", 1);
+  ASSERT_TRUE(job && other && dev);
+  job->name.set("my shot\tv2\n");
+  other->name.set("");
+  dev->host_name.set("testhost");
+  TASK* entries[2] = {};
+  Job* jobs[2] = {job, other};
+  for (int i = 0; i < 2; ++i) {
+    auto* rec = MA_new<TaskRec>(__LINE__, "tests/control_file_test");
+    rec->dev = dev;
+    rec->status = TASK_RUNNING;
+    entries[i] = Task_add(jobs[i], rec);
+    ASSERT_NE(entries[i], nullptr);
+    entries[i]->output.set(i == 0 ? "/pix/a.0001" : "/pix/b.0001");
+  }
+  Task_update_status();
+  EXPECT_EQ(read_file("TSKSTAT/testhost"), "my_shot_v2_ 5 2 /pix/a.0001\n- 6 2 /pix/b.0001\n");
+  EXPECT_STREQ(Task_current_filenames(other, dev), "/pix/b.0001 ");
+  EXPECT_EQ(RJC_label_form("caf\xc3\xa9"), "caf\xc3\xa9");
+}
 
 }  // namespace

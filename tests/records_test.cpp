@@ -161,20 +161,71 @@ TEST_F(RecordsTest, PickListsStayMirrored) {
   EXPECT_EQ(b->jobs, nullptr);
 }
 
-TEST_F(RecordsTest, ManyJobsOnOneResourceKeepOrder) {
+// Appends go through the tail each list keeps: after any mix of adds and
+// deletes (head, middle, tail, the only entry, a clone's own lists) every
+// list must still end where its tail says and hold what a plain model holds.
+template <class E>
+void expect_tail(E* head, E* tail) {
+  expect_back_links(head);
+  E* last = nullptr;
+  for (E* e = head; e != nullptr; e = e->next) last = e;
+  EXPECT_EQ(tail, last);
+}
+
+TEST_F(RecordsTest, ListsAppendAtTheirTailAfterAnyDelete) {
   Dev* host = Dev_new(nullptr, nullptr, "host", 1);
-  for (int i = 1; i <= 200; i++) RndDevList_add(Job_new(nullptr, nullptr, "j", i), host);
-  // Delete from the middle and the tail, then append again.
-  Job_del(Job_by_index(200));
-  Job_del(Job_by_index(100));
-  RndDevList_add(Job_new(nullptr, nullptr, "j", 201), host);
-  expect_back_links(host->jobs);
+  Dev* other = Dev_new(nullptr, nullptr, "other", 2);
+  Job* job = Job_new(nullptr, nullptr, "j", 1);
+  std::vector<int> jobs_model;
+  std::vector<std::string> paths_model;
+  unsigned seed = 7;
+  auto next = [&seed](unsigned n) { return (seed = seed * 1103515245u + 12345u) / 65536u % n; };
+  for (int step = 0; step < 400; ++step) {
+    if (next(3) != 0 || jobs_model.empty()) {
+      int index = step + 10;
+      RndDevList_add(Job_new(nullptr, nullptr, "j", index), host);
+      jobs_model.push_back(index);
+      std::string p = "/p/" + std::to_string(step);
+      RndPathList_add(job, p.c_str());
+      paths_model.push_back(p);
+    } else {
+      size_t at = next(static_cast<unsigned>(jobs_model.size()));
+      Job_del(Job_by_index(jobs_model[at]));
+      jobs_model.erase(jobs_model.begin() + static_cast<long>(at));
+      RndPathList_del(job, paths_model[at].c_str());
+      paths_model.erase(paths_model.begin() + static_cast<long>(at));
+    }
+    expect_tail(host->jobs, host->jobs_tail);
+    expect_tail(job->searchpath, job->searchpath_tail);
+  }
   std::vector<int> seen;
   for (RndJobList* e = host->jobs; e != nullptr; e = e->next) seen.push_back(e->job->index);
-  ASSERT_EQ(seen.size(), 199u);
-  EXPECT_EQ(seen[98], 99);
-  EXPECT_EQ(seen[99], 101);
-  EXPECT_EQ(seen.back(), 201);
+  EXPECT_EQ(seen, jobs_model);
+  std::vector<std::string> paths;
+  for (RndPathList* p = job->searchpath; p != nullptr; p = p->next)
+    paths.push_back(p->path.c_str());
+  EXPECT_EQ(paths, paths_model);
+
+  // A job's resource list down to nothing and back; a clone owns its lists.
+  RndDevList_add(job, host);
+  RndDevList_add(job, other);
+  RndDevList_del(job, other);
+  RndDevList_del(job, host);
+  EXPECT_TRUE(job->resources == nullptr && job->resources_tail == nullptr);
+  RndDevList_add(job, other);
+  Job* copy = Job_clone(job);
+  ASSERT_NE(copy, nullptr);
+  RndPathList_add(copy, "/copy");
+  RndDevList_add(copy, host);
+  expect_tail(job->searchpath, job->searchpath_tail);
+  expect_tail(copy->searchpath, copy->searchpath_tail);
+  expect_tail(copy->resources, copy->resources_tail);
+  EXPECT_STREQ(copy->searchpath_tail->path.c_str(), "/copy");
+  EXPECT_EQ(job->resources_tail->dev, other);
+  Dev_del(other);
+  expect_tail(job->resources, job->resources_tail);
+  expect_tail(copy->resources, copy->resources_tail);
+  EXPECT_EQ(job->resources, nullptr);
 }
 
 TEST(StateWords, DecodeCaseSensitively) {

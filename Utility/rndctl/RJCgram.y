@@ -37,6 +37,7 @@
 
 void RJC_lex_begin();
 void RJC_lex_end();
+static const char* message_file();
 
 namespace {
 
@@ -179,6 +180,7 @@ int RJClex();
 
 %type <ival> flag
 %type <rval> number
+%type <sval> name
 
 %initial-action {
   mode = MODE_NONE;
@@ -198,9 +200,10 @@ file
 job_header
   : TK_JOBCONTROL TK_INTEGER TK_INTEGER
       {
-        rndctl.interval_min = static_cast<unsigned>($2);
-        rndctl.interval_sec = static_cast<unsigned>($3);
+        // A value the daemon cannot wait for is refused and reported; the
+        // interval in force stays.
         mode = MODE_JOBS;
+        (void)RJC_set_check_interval($2, $3, message_file());
       }
   ;
 
@@ -226,7 +229,7 @@ job_block
   ;
 
 job_open
-  : TK_WORD TK_INTEGER '{' { begin_job($1, $2); }
+  : name TK_INTEGER '{' { begin_job($1, $2); }
   ;
 
 job_stmts
@@ -236,8 +239,8 @@ job_stmts
 
 job_stmt
   : TK_COMMENT                              { job_text(&Job::comment, $1); }
-  | TK_USER '=' TK_WORD ';'                 { job_text(&Job::user, $3); }
-  | TK_EXECUTABLE '=' TK_WORD ';'           { job_text(&Job::executable, $3); }
+  | TK_USER '=' name ';'                    { job_text(&Job::user, $3); }
+  | TK_EXECUTABLE '=' name ';'              { job_text(&Job::executable, $3); }
   | TK_STATUS '=' TK_STRING ';'             { job_text(&Job::status, $3); }
   | TK_SDL '=' TK_STRING ';'                { job_text(&Job::sdl, $3); }
   | TK_PIX '=' TK_STRING ';'                { job_text(&Job::pix, $3); }
@@ -284,6 +287,13 @@ job_stmt
   | TK_RUNS '=' run_blocks ';'
   ;
 
+/* A name that is no single word (a blank, a quote, a number such as a host
+ * address, a keyword) is written as a string. */
+name
+  : TK_WORD    { $$ = $1; }
+  | TK_STRING  { $$ = $1; }
+  ;
+
 flag
   : TK_TRUE   { $$ = 1; }
   | TK_FALSE  { $$ = 0; }
@@ -303,7 +313,7 @@ dev_names
 
 /* A resource the resource file does not hold drops out of the job. */
 dev_name
-  : TK_WORD
+  : name
       {
         if (cur_job != nullptr) {
           Dev* dev = Dev_by_name($1);
@@ -327,7 +337,7 @@ res_block
   ;
 
 res_open
-  : TK_WORD TK_INTEGER '{' { begin_dev($1, $2); }
+  : name TK_INTEGER '{' { begin_dev($1, $2); }
   ;
 
 res_stmts
@@ -339,7 +349,7 @@ res_stmts
  * it back into the record. */
 res_stmt
   : TK_COMMENT
-  | TK_HOST_NAME '=' TK_WORD ';'            { dev_text(&Dev::host_name, $3); }
+  | TK_HOST_NAME '=' name ';'               { dev_text(&Dev::host_name, $3); }
   | TK_REMOTE_LOCATION '=' TK_STRING ';'    { dev_text(&Dev::remote_location, $3); }
   | TK_RSTATUS '=' TK_WORD ';'
       {

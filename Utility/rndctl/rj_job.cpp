@@ -207,8 +207,9 @@ Job* Job_clone(Job* job) {
   copy->listitem = nullptr;
   copy->pick_level = 0;
   copy->lock_pid = 0;
-  copy->resources = nullptr;
+  copy->resources = copy->resources_tail = nullptr;
   copy->searchpath = nullptr;
+  copy->searchpath_tail = nullptr;
 
   char name[256];
   snprintf(name, sizeof name, "%s.clone", job->name.or_else("noname"));

@@ -24,6 +24,25 @@ bool reports_error(const char* line) {
          strstr(line, "Error") != nullptr;
 }
 
+// One line of a render program's output, at most 254 characters with its
+// newline (a longer line comes in pieces), as fgets would give it.  Output
+// is not always text: a NUL would hide the rest of the line from the search
+// and from the comment, and terminal controls are noise in a file people
+// read, so every control character but the tab and the newline reads as a
+// blank.  False at the end of the output.
+bool read_line(FILE* fp, std::string* line) {
+  constexpr size_t kLineMax = 254;
+  line->clear();
+  int c;
+  while (line->size() < kLineMax && (c = getc_unlocked(fp)) != EOF) {
+    auto byte = static_cast<unsigned char>(c);
+    if ((byte < ' ' && byte != '\t' && byte != '\n') || byte == 0x7f) byte = ' ';
+    line->push_back(static_cast<char>(byte));
+    if (byte == '\n') break;
+  }
+  return !line->empty();
+}
+
 }  // namespace
 
 void Job_Error_Update(TASK* entry) {
@@ -48,8 +67,9 @@ void Job_Error_Update(TASK* entry) {
     reason += '\n';
   } else {
     reason = kUnknownReason;
-    char line[255];
-    while (fgets(line, sizeof line, log.get()) != nullptr) {
+    std::string text;
+    while (read_line(log.get(), &text)) {
+      const char* line = text.c_str();
       if (reports_error(line)) {
         report = line;
         break;

@@ -2,8 +2,6 @@
 // mirror the jobs that name a resource (hanging from the resource), and a
 // job's image search paths.  A resource entry and its mirror point at each
 // other; removing either removes both.
-#include <unordered_map>
-
 #include "Shared/memory/MA_rtns.h"
 #include "Utility/rndctl/rndctl.h"
 
@@ -14,69 +12,39 @@ const char* const kUnit = "Utility/rndctl/rj_lst";
 // The allocator trace names resource entries by this tag.
 constexpr int kDevEntryTag = 122;
 
+// Each list keeps its last entry in the owner, so that an append is one
+// step: the reader appends every search path, resource and job of a file,
+// and walking to the end for each made a job of 200,000 search paths take
+// half a minute to read, under the lock.  append and unlink are the only
+// places that change a list's links, and they keep the tail right.
 template <class E>
-void append(E*& head, E* entry) {
-  if (head == nullptr) {
+void append(E*& head, E*& tail, E* entry) {
+  entry->next = nullptr;
+  entry->prev = tail;
+  if (tail != nullptr)
+    tail->next = entry;
+  else
     head = entry;
-    return;
-  }
-  E* last = head;
-  while (last->next != nullptr) last = last->next;
-  last->next = entry;
-  entry->prev = last;
+  tail = entry;
 }
 
 template <class E>
-void unlink(E*& head, E* entry) {
+void unlink(E*& head, E*& tail, E* entry) {
   if (entry->prev != nullptr)
     entry->prev->next = entry->next;
   else if (head == entry)
     head = entry->next;
-  if (entry->next != nullptr) entry->next->prev = entry->prev;
+  if (entry->next != nullptr)
+    entry->next->prev = entry->prev;
+  else if (tail == entry)
+    tail = entry->prev;
   entry->next = entry->prev = nullptr;
-}
-
-// A resource named by every job has ten thousand entries in its job list;
-// appending by walking would make reading the job file quadratic.  The tail
-// of each resource's job list is remembered here and checked before use.
-std::unordered_map<const Dev*, RndJobList*>& job_list_tails() {
-  static auto* tails = new std::unordered_map<const Dev*, RndJobList*>;
-  return *tails;
-}
-
-void append_job_entry(Dev* dev, RndJobList* entry) {
-  auto& tails = job_list_tails();
-  auto it = tails.find(dev);
-  RndJobList* last = dev->jobs;
-  if (it != tails.end() && it->second->next == nullptr &&
-      (it->second->prev != nullptr || dev->jobs == it->second))
-    last = it->second;
-  if (last == nullptr) {
-    dev->jobs = entry;
-  } else {
-    while (last->next != nullptr) last = last->next;
-    last->next = entry;
-    entry->prev = last;
-  }
-  if (it != tails.end())
-    it->second = entry;
-  else
-    tails.emplace(dev, entry);
 }
 
 // Takes one entry out of a resource's job list and frees it; the other half
 // of the pair is left to the caller.
 void drop_job_entry(Dev* dev, RndJobList* entry) {
-  auto& tails = job_list_tails();
-  auto it = tails.find(dev);
-  if (it != tails.end() && it->second == entry) {
-    if (entry->prev != nullptr)
-      it->second = entry->prev;
-    else
-      tails.erase(it);
-  }
-  unlink(dev->jobs, entry);
-  if (dev->jobs == nullptr) tails.erase(dev);
+  unlink(dev->jobs, dev->jobs_tail, entry);
   if (entry->mirror != nullptr) entry->mirror->mirror = nullptr;
   entry->mirror = nullptr;
   entry->picked = -1;
@@ -84,7 +52,7 @@ void drop_job_entry(Dev* dev, RndJobList* entry) {
 }
 
 void drop_dev_entry(Job* job, RndDevList* entry) {
-  unlink(job->resources, entry);
+  unlink(job->resources, job->resources_tail, entry);
   if (entry->mirror != nullptr) entry->mirror->mirror = nullptr;
   entry->mirror = nullptr;
   entry->picked = -1;
@@ -107,7 +75,7 @@ RndDevList* RndDevList_add(Job* job, Dev* dev) {
     MA_delete(entry, __LINE__, kUnit);
     return nullptr;
   }
-  append(job->resources, entry);
+  append(job->resources, job->resources_tail, entry);
   return entry;
 }
 
@@ -158,7 +126,7 @@ RndJobList* RndJobList_add(Dev* dev, Job* job, RndDevList* mirror) {
     if (entry == nullptr) return nullptr;
     entry->job = job;
     entry->picked = 0;
-    append_job_entry(dev, entry);
+    append(dev->jobs, dev->jobs_tail, entry);
   }
   if (mirror != nullptr) {
     entry->mirror = mirror;
@@ -200,7 +168,7 @@ RndPathList* RndPathList_add(Job* job, const char* path) {
   RndPathList* entry = MA_new<RndPathList>(__LINE__, kUnit);
   if (entry == nullptr) return nullptr;
   entry->path.set(path);
-  append(job->searchpath, entry);
+  append(job->searchpath, job->searchpath_tail, entry);
   return entry;
 }
 
@@ -208,7 +176,7 @@ void RndPathList_del(Job* job, const char* path) {
   if (job == nullptr) return;
   for (RndPathList* e = job->searchpath; e != nullptr; e = e->next) {
     if (rj_strcmp(e->path.c_str(), path) == 0) {
-      unlink(job->searchpath, e);
+      unlink(job->searchpath, job->searchpath_tail, e);
       MA_delete(e, __LINE__, kUnit);
       return;
     }

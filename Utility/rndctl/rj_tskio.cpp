@@ -444,7 +444,13 @@ TaskGroup* read_all(TokenSource& in) {
 
 void format_group(TextOut& out, const TaskGroup* group, int numrecs) {
   put_literal(out, "\n", 1);
-  out.put(group->job->name.or_else("(null)"));
+  // The group is found again by the job index; the name is a label, and one
+  // with a blank in it would shift every field after it.
+  const char* name = group->job->name.or_else("(null)");
+  if (RJC_label_needs_form(name))
+    out.put(RJC_label_form(name).c_str());
+  else
+    out.put(name);
   char* p = out.room(48);
   *p++ = '\t';
   *p++ = ' ';
@@ -975,7 +981,8 @@ void Task_update_status() {
   for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
     if (e->job == nullptr || e->rec == nullptr || e->stale) continue;
     if (!on_this_host(e->rec->dev)) continue;
-    fprintf(fp, "%s %d %d %s\n", e->job->name.or_else("(null)"), e->job->index, e->rec->status,
+    const std::string label = RJC_label_form(e->job->name.or_else("(null)"));
+    fprintf(fp, "%s %d %d %s\n", label.c_str(), e->job->index, e->rec->status,
             e->output.or_else("-"));
   }
   if (fclose(fp) != 0) perror("in Task_update_status");

@@ -3,19 +3,118 @@
 // every line is kept exactly as it has always been written, oddities
 // included (tabs against blanks, the resource comment that nothing reads
 // back, the two-blank default_dev line, the indented resource brace).
+//
+// The texts inside the lines are another matter.  A render program's error
+// line ends up in a job's comment, and a host may be called 10.1.2.3: one
+// "*/" or quote in the wrong place, one name that lexes as a number, and
+// the file no longer parses, and every daemon that reads it stops on the
+// syntax error.  So every text goes through the forms below, which pass
+// what the reader takes as it is and change only what it could not take.
 #include <algorithm>
 #include <cmath>
 #include <cstdio>
 #include <cstring>
+#include <string>
 
 #include "Utility/rndctl/rndctl.h"
 
 namespace {
 
-const char* truth(int flag) { return flag != 0 ? "TRUE" : "FALSE"; }
+bool word_start(unsigned char c) {
+  return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') || c == '.' ||
+         c == '_';
+}
+bool word_char(unsigned char c) { return word_start(c) || c == '-' || c == '#' || c == '@'; }
 
-// glibc prints a null "%s" as "(null)"; say so rather than rely on it.
-const char* shown(const Text& text) { return text.or_else("(null)"); }
+// Keywords lex as keywords only as whole words, so a name equal to one is
+// read as that keyword.  "End" ends the file; the headers switch the file.
+const char* const kEveryKeyword[] = {
+    "RenderJobControl", "RenderResourceControl", "End", "lock_pid", "TRUE", "FALSE", "to"};
+const char* const kJobKeywords[] = {
+    "user",          "status",    "priority",    "executable", "use_sdl_paths", "output_mask",
+    "save_out",      "sdl",       "pix",         "matte",      "animate",       "fields",
+    "frames",        "extension", "totalframes", "doneframes", "resources",     "searchpath",
+    "del_when_done", "rnd_opts",  "ctrl",        "runs"};
+const char* const kResourceKeywords[] = {"host_name",  "remote_location", "status",
+                                         "max_frames", "num_processors",  "locks",
+                                         "default_dev"};
+
+template <size_t N>
+bool listed(const char* const (&table)[N], const char* text) {
+  for (const char* keyword : table)
+    if (keyword[0] == text[0] && strcmp(keyword, text) == 0) return true;
+  return false;
+}
+
+// Word characters only and no number: what the word rule of the lexer takes
+// whole.  A run of digits, points and minus signs that starts with a digit
+// is a number however long (the number rules win a tie).
+bool plain_word(const char* text) {
+  const auto* p = reinterpret_cast<const unsigned char*>(text);
+  if (p == nullptr || !word_start(p[0])) return false;
+  bool numeric = p[0] >= '0' && p[0] <= '9';
+  for (; *p != '\0'; ++p) {
+    if (!word_char(*p)) return false;
+    if (!((*p >= '0' && *p <= '9') || *p == '.' || *p == '-')) numeric = false;
+  }
+  return !numeric;
+}
+
+bool label_char_ok(unsigned char c) { return c > ' ' && c != 0x7f; }
+
+}  // namespace
+
+bool RJC_is_word(const char* text, int section) {
+  if (!plain_word(text)) return false;
+  if (listed(kEveryKeyword, text)) return false;
+  if (section == RJC_JOB_SECTION) return !listed(kJobKeywords, text);
+  if (section == RJC_RESOURCE_SECTION) return !listed(kResourceKeywords, text);
+  return !listed(kJobKeywords, text) && !listed(kResourceKeywords, text);
+}
+
+std::string RJC_string_form(const char* text) {
+  std::string form;
+  if (text == nullptr) return form;
+  // The reader counts the characters between the quotes, so the quotes go
+  // first and the cut comes after.
+  for (const char* p = text; *p != '\0' && form.size() < RJC_STRING_LIMIT; ++p)
+    if (*p != '"') form += *p;
+  return form;
+}
+
+std::string RJC_comment_form(const char* text) {
+  std::string form;
+  if (text == nullptr) return form;
+  for (const char* p = text; *p != '\0'; ++p) {
+    form += *p;
+    if (p[0] == '*' && p[1] == '/') form += ' ';
+  }
+  return form;
+}
+
+std::string RJC_name_form(const char* text) {
+  if (text == nullptr) return std::string();
+  return plain_word(text) ? std::string(text) : RJC_string_form(text);
+}
+
+bool RJC_label_needs_form(const char* text) {
+  if (text == nullptr || *text == '\0') return true;
+  for (const auto* p = reinterpret_cast<const unsigned char*>(text); *p != '\0'; ++p)
+    if (!label_char_ok(*p)) return true;
+  return false;
+}
+
+std::string RJC_label_form(const char* text) {
+  if (text == nullptr || *text == '\0') return "-";
+  std::string form(text);
+  for (char& c : form)
+    if (!label_char_ok(static_cast<unsigned char>(c))) c = '_';
+  return form;
+}
+
+namespace {
+
+const char* truth(int flag) { return flag != 0 ? "TRUE" : "FALSE"; }
 
 // The text of a file is put together here and handed to the stream in large
 // pieces: a file of ten thousand jobs is some hundred thousand lines, and one
@@ -63,6 +162,37 @@ class Out {
     if (length < 0) return *this;
     return n(text, std::min(static_cast<size_t>(length), sizeof text - 1));
   }
+  Out& str(const std::string& text) { return n(text.data(), text.size()); }
+
+  /// A quoted string.  Nearly every text is taken as it is; only the rare
+  /// one with a quote or beyond the limit is copied.
+  Out& quoted(const char* text) {
+    size_t length = strlen(text);
+    lit("\"");
+    if (length <= RJC_STRING_LIMIT && memchr(text, '"', length) == nullptr)
+      n(text, length);
+    else
+      str(RJC_string_form(text));
+    return lit("\"");
+  }
+
+  /// The text of a comment, between marks the caller writes.
+  Out& comment(const char* text) {
+    if (strstr(text, "*/") == nullptr) return s(text);
+    return str(RJC_comment_form(text));
+  }
+
+  /// A name: bare when it reads back as one word of the section, else quoted.
+  /// A text that is a word only once its quotes are gone is written bare,
+  /// so that the next write of what is read back writes the same.
+  Out& name(const char* text, int section) {
+    if (RJC_is_word(text, section)) return s(text);
+    if (plain_word(text)) return quoted(text);  // a keyword: no quote to drop
+    std::string form = RJC_string_form(text);
+    if (RJC_is_word(form.c_str(), section)) return str(form);
+    return quoted(form.c_str());
+  }
+
   void flush() {
     if (used_ > 0) fwrite(buf_, 1, used_, fp_);
     used_ = 0;
@@ -118,17 +248,22 @@ void write_frames(Out& out, const float* frames) {
 }
 
 void write_job(Out& out, const Job* job) {
-  out.s(shown(job->name)).lit(" ").d(job->index).lit(" {\n");
-  if (job->comment) out.lit("\t/*").s(job->comment.c_str()).lit("*/\n");
+  // The reader names a job after the last part of the text, as it names a
+  // job after its scene file; written that way, the name reads back as it is.
+  const char* name = job->name.or_else("");
+  const char* slash = strrchr(name, '/');
+  out.name(slash != nullptr ? slash + 1 : name, RJC_JOB_SECTION).lit(" ").d(job->index).lit(" {\n");
+  if (job->comment) out.lit("\t/*").comment(job->comment.c_str()).lit("*/\n");
   if (job->lock_pid != 0) out.lit("\tlock_pid \t= ").d(job->lock_pid).lit(";\n");
   if (job->del_when_done != 0) out.lit("\tdel_when_done \t= TRUE;\n");
-  if (job->user) out.lit("\tuser\t \t= ").s(job->user.c_str()).lit(";\n");
-  if (job->status) out.lit("\tstatus \t\t= \"").s(job->status.c_str()).lit("\";\n");
+  if (job->user) out.lit("\tuser\t \t= ").name(job->user.c_str(), RJC_JOB_SECTION).lit(";\n");
+  if (job->status) out.lit("\tstatus \t\t= ").quoted(job->status.c_str()).lit(";\n");
   out.lit("\tpriority \t= ").d(job->priority).lit(";\n");
-  if (job->executable) out.lit("\texecutable \t= ").s(job->executable.c_str()).lit(";\n");
-  if (job->sdl) out.lit("\tsdl \t\t= \"").s(job->sdl.c_str()).lit("\";\n");
-  if (job->pix) out.lit("\tpix \t\t= \"").s(job->pix.c_str()).lit("\";\n");
-  if (job->matte) out.lit("\tmatte \t\t= \"").s(job->matte.c_str()).lit("\";\n");
+  if (job->executable)
+    out.lit("\texecutable \t= ").name(job->executable.c_str(), RJC_JOB_SECTION).lit(";\n");
+  if (job->sdl) out.lit("\tsdl \t\t= ").quoted(job->sdl.c_str()).lit(";\n");
+  if (job->pix) out.lit("\tpix \t\t= ").quoted(job->pix.c_str()).lit(";\n");
+  if (job->matte) out.lit("\tmatte \t\t= ").quoted(job->matte.c_str()).lit(";\n");
   out.lit("\tuse_sdl_paths = ").s(truth(job->use_sdl_paths)).lit(";\n\toutput_mask = ");
   out.s(truth(job->output_mask)).lit(";\n");
 
@@ -157,35 +292,36 @@ void write_job(Out& out, const Job* job) {
         break;
     }
     if (job->fields != 0) out.lit("\tfields\t\t= ").d(job->fields).lit(";\n");
-    if (job->rnd_opts) out.lit("\trnd_opts\t= \"").s(job->rnd_opts.c_str()).lit("\";\n");
+    if (job->rnd_opts) out.lit("\trnd_opts\t= ").quoted(job->rnd_opts.c_str()).lit(";\n");
     out.lit("\ttotalframes\t= ").d(job->totalframes).lit(";\n\tdoneframes\t= ");
     out.d(job->doneframes).lit(";\n");
   }
 
-  if (job->resources != nullptr) {
-    out.lit("\tresources\t=");
-    bool first = true;
-    for (const RndDevList* e = job->resources; e != nullptr; e = e->next) {
-      const char* name = e->dev != nullptr ? e->dev->name.or_else("(null)") : "(null)";
-      out.s(first ? " " : ", ").s(name);
-      first = false;
-    }
-    out.lit(";\n");
+  // A resource without a name is not in the resource file, so the reader
+  // would drop it from the job anyway; a line of nothing but such resources
+  // would not parse at all.
+  bool first = true;
+  for (const RndDevList* e = job->resources; e != nullptr; e = e->next) {
+    if (e->dev == nullptr || e->dev->name.none()) continue;
+    out.s(first ? "\tresources\t= " : ", ").name(e->dev->name.c_str(), RJC_JOB_SECTION);
+    first = false;
   }
+  if (!first) out.lit(";\n");
   for (const RndPathList* p = job->searchpath; p != nullptr; p = p->next) {
-    if (p->path) out.lit("\tsearchpath\t= \"").s(p->path.c_str()).lit("\";\n");
+    if (p->path) out.lit("\tsearchpath\t= ").quoted(p->path.c_str()).lit(";\n");
   }
   write_week(out, "\truns\t\t=", job->runs);
   out.lit("}\n\n");
 }
 
 void write_dev(Out& out, const Dev* dev) {
-  out.s(shown(dev->name)).lit(" ").d(dev->index).lit(" {\n");
+  out.name(dev->name.c_str(), RJC_RESOURCE_SECTION).lit(" ").d(dev->index).lit(" {\n");
   out.lit("\tlock_pid \t= ").d(dev->lock_pid).lit(";\n");
-  if (dev->comment) out.lit("/* ").s(dev->comment.c_str()).lit(" */\n");
-  if (dev->host_name) out.lit("\thost_name\t\t= ").s(dev->host_name.c_str()).lit(";\n");
+  if (dev->comment) out.lit("/* ").comment(dev->comment.c_str()).lit(" */\n");
+  if (dev->host_name)
+    out.lit("\thost_name\t\t= ").name(dev->host_name.c_str(), RJC_RESOURCE_SECTION).lit(";\n");
   if (dev->remote_location)
-    out.lit("\tremote_location\t= \"").s(dev->remote_location.c_str()).lit("\";\n");
+    out.lit("\tremote_location\t= ").quoted(dev->remote_location.c_str()).lit(";\n");
   switch (dev->status) {
     case LOCK_LOCKED:
       out.lit("\tstatus \t\t\t= LOCKED;\n");

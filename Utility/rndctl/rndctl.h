@@ -121,6 +121,10 @@ struct Job {
   Text user;
   RndDevList* resources = nullptr;    // owned pick list
   RndPathList* searchpath = nullptr;  // owned path list
+  // Last entries of the two lists, so that an append does not walk the list
+  // (a job may have hundreds of thousands of search paths); kept by rj_lst.
+  RndDevList* resources_tail = nullptr;    // non-owning
+  RndPathList* searchpath_tail = nullptr;  // non-owning
   int lock_pid = 0;
   int deleted = 0;  // deletion mark: the next write of the job file drops it
   int del_when_done = 0;
@@ -148,8 +152,9 @@ struct Dev {
   int lock_pid = 0;
   int word2 = 0;
   int default_dev = 0;
-  RndJobList* jobs = nullptr;  // owned mirror of the jobs' pick lists
-  TASK* last_task = nullptr;   // last task started on it; non-owning
+  RndJobList* jobs = nullptr;       // owned mirror of the jobs' pick lists
+  RndJobList* jobs_tail = nullptr;  // its last entry, kept by rj_lst; non-owning
+  TASK* last_task = nullptr;        // last task started on it; non-owning
 };
 
 // Pick lists (rj_lst).
@@ -276,6 +281,14 @@ bool rj_dev_is_this_host(const Dev* dev);
 void Job_wake_other_hosts(const Job* job);
 
 void RJC_init_rndctl(const char* location);
+/// Sets the check interval to `minutes`:`seconds` and returns 1, or refuses
+/// a value the service loop cannot wait for (either part negative, seconds
+/// above 59, a total beyond an int of seconds) and returns 0, keeping the
+/// interval in force.  A refusal is reported on stderr (the daemon's log)
+/// once per distinct bad value, naming `from` (a file name, "-u"), so that a
+/// bad header reread at every reload does not fill the log.  0:00 is valid:
+/// no timed pass.
+[[nodiscard]] int RJC_set_check_interval(long minutes, long seconds, const char* from);
 int64_t daemon_updatetime_set(const char* host);
 int64_t daemon_updatetime_get(const char* host);
 int64_t editor_updatetime_get();
@@ -366,6 +379,32 @@ extern void (*RJC_fatal_exit)(int status);
 int RJC_parse_string(const char* text, size_t length, const char* file_name);
 void Job_control_write_dev(FILE* fp);
 void Resource_control_write_dev(FILE* fp);
+
+/// The text forms of the control files (rj_write).  Every text a daemon or
+/// editor writes into a control file goes through these, so that whatever a
+/// record holds, the file reads back: the reader has no escapes, so what it
+/// cannot read is dropped or broken up rather than escaped.  Each *_form
+/// function returns exactly what the reader gives back for the text written.
+enum { RJC_JOB_SECTION = 1, RJC_RESOURCE_SECTION = 2 };
+/// Longest quoted string the reader takes.
+constexpr size_t RJC_STRING_LIMIT = 1023;
+/// True when `text` lexes back, in that file's section, as one word token:
+/// word characters only, starting with a letter, digit, point or underscore,
+/// no number, no keyword of the section.
+bool RJC_is_word(const char* text, int section);
+/// A quoted string: without its '"' characters, cut at RJC_STRING_LIMIT.
+std::string RJC_string_form(const char* text);
+/// A comment: every "*/" inside broken to "* /".
+std::string RJC_comment_form(const char* text);
+/// A name (user, executable, host, resource or block name), written bare
+/// when it is a word and quoted otherwise: the text itself when it is a
+/// word, else its string form.  The same in both sections.
+std::string RJC_name_form(const char* text);
+/// A job name in the task and status files, which read it back with "%s":
+/// blanks and control characters become '_', an empty name "-".
+std::string RJC_label_form(const char* text);
+/// Whether RJC_label_form would change `text` (the common case is no).
+bool RJC_label_needs_form(const char* text);
 
 // ---------------------------------------------------------------------------
 // Job records (rj_job).

@@ -275,7 +275,7 @@ int main(int argc, char* argv[]) {
   debug = 0;
   rndctl.single_pass = 0;
 
-  int interval = 0;
+  long interval = 0;
   const char* location = nullptr;
   bool debug_given = false;
   opterr = 0;  // unknown options are ignored without a word
@@ -283,7 +283,8 @@ int main(int argc, char* argv[]) {
   while ((c = getopt(argc, argv, "u:l:d:s")) != -1) {
     switch (c) {
       case 'u':
-        interval = atoi(optarg);
+        // Read wide, so that a huge value is refused rather than wrapped.
+        interval = strtol(optarg, nullptr, 10);
         break;
       case 'l':
         location = optarg;
@@ -306,10 +307,7 @@ int main(int argc, char* argv[]) {
 
   RJC_init_rndctl(location);
   check_control_directory();
-  if (interval != 0) {
-    rndctl.interval_min = static_cast<unsigned>(interval / 60);
-    rndctl.interval_sec = static_cast<unsigned>(interval % 60);
-  }
+  if (interval != 0) (void)RJC_set_check_interval(interval / 60, interval % 60, "-u");
 
   if (pid_file_startup_check() != 0) exit(1);
   open_log_file();

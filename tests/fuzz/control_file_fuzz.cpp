@@ -4,6 +4,10 @@
 // again: the writer's output must always be readable, and after one rewrite
 // (which settles unknown states to their defaults and drops the resource
 // comments) the text must not change any more.
+//
+// The same bytes, cut at their NULs into texts, then fill every string field
+// of a job, a resource and a task group: whatever they hold, the files must
+// read back as the writer's forms of them and write the same again.
 #include <unistd.h>
 
 #include <cstdint>
@@ -11,8 +15,10 @@
 #include <cstdlib>
 #include <cstring>
 #include <string>
+#include <vector>
 
 #include "Utility/rndctl/rndctl.h"
+#include "tests/support/text_records.h"
 
 namespace {
 
@@ -79,6 +85,20 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   (void)ready;
 
   clear_lists();
+  std::vector<std::string> texts(1);
+  for (size_t i = 0; i < size; ++i) {
+    if (data[i] == '\0')
+      texts.emplace_back();
+    else
+      texts.back() += static_cast<char>(data[i]);
+  }
+  failed = false;
+  std::string failure = text_records::check(texts);
+  if (!failure.empty() || failed) {
+    fprintf(stderr, "%s\n", failure.c_str());
+    abort();
+  }
+
   if (!parse(kResources, "Render_Resource_Control")) abort();
   if (!parse(std::string(reinterpret_cast<const char*>(data), size), "Render_Job_Control")) {
     clear_lists();
