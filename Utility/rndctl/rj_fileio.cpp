@@ -47,6 +47,7 @@ struct UpdateStream {
   std::string out;  // the new contents, from the start of the file
   int64_t pos = 0;  // the stream's position
   bool written = false;
+  bool rewound = false;  // rewound and written nothing: the new contents are empty
   ~UpdateStream() {
     if (old_fd >= 0) close(old_fd);
   }
@@ -156,6 +157,7 @@ int update_seek(void* cookie, off64_t* offset, int whence) {
   }
   u->pos = base + *offset;
   *offset = u->pos;
+  if (whence == SEEK_SET) u->rewound = true;
   return 0;
 }
 
@@ -274,7 +276,7 @@ int close_record(int index, bool cut_at_position) {
     report_write_failure(rec.path, error);
     return -1;
   }
-  if (update && update->written) {
+  if (update && (update->written || update->rewound)) {
     int64_t end = update->pos;
     if (!cut_at_position) {
       int64_t size = old_size(*update);

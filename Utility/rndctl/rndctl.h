@@ -343,7 +343,7 @@ void rewind_fileop(int index);
 int close_fileop(int index);
 /// Closes the stream; the new contents of an update stream end at the
 /// stream's position and replace the file atomically (see above); a stream
-/// that was never written is closed without a rewrite.  0 ok (also when
+/// that was neither rewound nor written is closed without a rewrite.  0 ok (also when
 /// nothing changed), -1 when the rewrite failed: the old file stands, the
 /// temporary is gone, and the path with the system's reason was reported to
 /// the user and the trace.
