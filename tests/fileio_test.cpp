@@ -83,7 +83,9 @@ class FileopTest : public ControlDirTest {
     DIR* d = opendir(dir_.c_str());
     while (struct dirent* e = d != nullptr ? readdir(d) : nullptr) {
       std::string n = e->d_name;
-      if (n != "." && n != ".." && n != "Render_Access") names.push_back(n);
+      if (n != "." && n != ".." && n != "Render_Access" && n != ".clock.testhost") {
+        names.push_back(n);
+      }
     }
     if (d != nullptr) closedir(d);
     return names;
@@ -203,6 +205,27 @@ TEST_F(FileopTest, BackoffStartsInMillisecondsGrowsAndNeverPausesOverFiveSeconds
   // 181 s of waiting in a few tens of attempts, not thousands.
   EXPECT_LE(pauses.size(), 100u);
   EXPECT_GE(fake_server - kLockMade, 181);
+}
+
+TEST_F(FileopTest, ServerClockIsTheTimeOfATouchedFileReadAtMostOnceASecond) {
+  fileop_server_clock = saved_server_;
+  ASSERT_EQ(init_fileop(), 1);
+  fake_mono = 0;
+  time_t first = fileop_server_clock();
+  const std::string clock_file = path(".clock.testhost");
+  struct stat st;
+  ASSERT_EQ(stat(clock_file.c_str(), &st), 0);
+  EXPECT_EQ(first, st.st_mtime);
+  // Within a second the reading is carried forward, the file left alone.
+  struct timespec times[2] = {{kLockMade, 0}, {kLockMade, 0}};
+  ASSERT_EQ(utimensat(AT_FDCWD, clock_file.c_str(), times, 0), 0);
+  fake_mono += kSecond / 2;
+  EXPECT_EQ(fileop_server_clock(), first);
+  fake_mono += kSecond;
+  time_t later = fileop_server_clock();
+  ASSERT_EQ(stat(clock_file.c_str(), &st), 0);
+  EXPECT_EQ(later, st.st_mtime);
+  EXPECT_GE(later, first);
 }
 
 TEST_F(FileopTest, StaleLockWithoutItsHolderFileIsBrokenAllTheSame) {

@@ -13,7 +13,10 @@
 // whose holder file is missing or empty is broken when 5 s old; any other
 // lock when 181 s old, both judged by the directory's access time against
 // the file server's clock (the hosts' own clocks disagree).  A break renames
-// the lock away first, so of several waiters only one breaks it.
+// the lock away first, so of several waiters only one breaks it; a broken
+// lock that cannot be removed (another user's, in the retry mode without
+// search permission) stays under its "NAME.lock.broken.HOST.PID.N" name,
+// out of everybody's way.
 #include <dirent.h>
 #include <fcntl.h>
 #include <signal.h>
