@@ -45,6 +45,9 @@ constexpr long kStaleSeconds = 181;
 constexpr long kGraceSeconds = 5;
 // The first pause of a waiter; each further one may be twice as long.
 constexpr int64_t kFirstPauseNs = 2000000;
+// Once past the first quick retries a waiter never pauses shorter than at
+// this level (32-64 ms): about twenty attempts a second at most.
+constexpr unsigned kSteadyLevel = 5;
 
 void nanosleep_pause(int64_t ns) {
   struct timespec ts = {static_cast<time_t>(ns / kNsPerSecond),
@@ -265,13 +268,13 @@ struct Aside {
   }
 };
 
-// The pause before attempt `attempt` (0 = the first retry): exponential
-// from 2 ms, at most fileop_poll_seconds, half of it fixed and half random,
-// so waiters that met at one lock do not meet again at the next attempt.
-int64_t backoff_pause(unsigned attempt, uint64_t* seed) {
+// The pause at back-off level `level`: exponential from 2 ms, at most
+// fileop_poll_seconds, half of it fixed and half random, so waiters that met
+// at one lock do not meet again at the next attempt.
+int64_t backoff_pause(unsigned level, uint64_t* seed) {
   int64_t cap = static_cast<int64_t>(fileop_poll_seconds) * kNsPerSecond;
   if (cap <= 0) return 0;
-  int64_t ceiling = attempt >= 40 ? cap : kFirstPauseNs << attempt;
+  int64_t ceiling = level >= 40 ? cap : kFirstPauseNs << level;
   if (ceiling > cap || ceiling <= 0) ceiling = cap;
   // xorshift64: no global random state to disturb.
   *seed ^= *seed << 13;
@@ -283,10 +286,12 @@ int64_t backoff_pause(unsigned attempt, uint64_t* seed) {
 
 // One look at a busy lock: breaks it when its holder is gone.  1 when it
 // was broken (try again at once), 0 when it stands.  `listed` remembers the
-// lock directory already listed in this wait.
-int judge_busy_lock(const char* lock_path, ino_t* listed) {
+// lock directory already listed in this wait; `seen` gets the one looked at.
+int judge_busy_lock(const char* lock_path, ino_t* listed, ino_t* seen) {
   struct stat st;
+  *seen = 0;
   if (stat(lock_path, &st) != 0) return errno == ENOENT ? 1 : 0;
+  *seen = st.st_ino;
   char entry[NAME_MAX + 1] = "";
 
   int pid = 0;
@@ -389,7 +394,9 @@ int lock_fileop(int index, int take) {
                   (static_cast<uint64_t>(rndctl.pid) << 32) ^ 0x9e3779b97f4a7c15ull;
   if (seed == 0) seed = 1;
   ino_t listed = 0;
-  unsigned attempt = 0;
+  ino_t seen = 0;
+  ino_t seen_before = 0;
+  unsigned level = 0;
   unsigned at_once = 0;
   for (bool retry = false;; retry = true) {
     if (aside.try_take(lock_path, retry)) break;
@@ -398,11 +405,21 @@ int lock_fileop(int index, int take) {
     // when others keep winning it.  A missing control directory lands here
     // too (no aside can be made): the waiter keeps trying, pausing, until
     // the directory is back.
-    if (judge_busy_lock(lock_path, &listed) == 1 && aside.made && at_once++ < 8) continue;
+    if (judge_busy_lock(lock_path, &listed, &seen) == 1 && aside.made && at_once++ < 8) continue;
     // Editors do not wait: the user sees no delay.
     if (is_editor()) continue;
-    int64_t pause = backoff_pause(attempt++, &seed);
+    int64_t pause = backoff_pause(level, &seed);
     if (pause > 0) fileop_sleep(pause);
+    // The same holder still there: it holds long, pause longer.  Another
+    // one since: the lock changes hands quickly, and a waiter grown used to
+    // long pauses would only leave it idle; pause shorter, down to the
+    // steady level.  The pauses then follow the hold times.
+    if (seen_before == 0 || seen == seen_before) {
+      level++;
+    } else if (level > kSteadyLevel) {
+      level--;
+    }
+    seen_before = seen;
   }
   umask(previous);
   held_locks[index].held = true;
