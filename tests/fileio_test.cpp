@@ -1,9 +1,14 @@
+#include <dirent.h>
 #include <fcntl.h>
+#include <signal.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <cstdio>
 #include <string>
+#include <vector>
 
 #include "tests/support/test_support.h"
 
@@ -15,28 +20,43 @@ bool exists(const std::string& p) {
 }
 
 // A fixed point in the past for planted lock directories; the fake clocks
-// below count from it, so no test depends on the wall clock.
+// count from it, so no test depends on the wall clock or sleeps.
 constexpr time_t kLockMade = 1000000000;
-time_t fake_now = 0;
-time_t fixed_clock() { return fake_now; }
+constexpr int64_t kSecond = 1000000000;
 
-// Advances one second per look, so a waiter walks through the ages one by one.
-int ticks = 0;
-time_t ticking_clock() {
-  // Bounded: a waiter that never breaks the lock gets an absurd age and the
-  // test fails on the reported age instead of hanging.
-  if (++ticks > 50) return kLockMade + 100000;
-  return kLockMade + 178 + ticks;
+time_t fake_server = 0;
+int64_t fake_mono = 0;
+std::vector<int64_t> pauses;
+
+time_t server_clock() { return fake_server; }
+int64_t mono_clock() { return fake_mono; }
+// Sleeps by moving both clocks.  Bounded: a waiter that never breaks the
+// lock gets an absurd age and the test fails on it instead of hanging.
+void fake_sleep(int64_t ns) {
+  pauses.push_back(ns);
+  fake_mono += ns;
+  fake_server = kLockMade + static_cast<time_t>(fake_mono / kSecond);
+  if (pauses.size() > 1000) fake_server = kLockMade + 100000;
 }
 
 class FileopTest : public ControlDirTest {
  protected:
   void SetUp() override {
     ControlDirTest::SetUp();
-    fileop_poll_seconds = 0;
+    fileop_poll_seconds = 5;
+    fileop_sleep = fake_sleep;
+    fileop_monotonic_ns = mono_clock;
+    fileop_server_clock = server_clock;
+    fake_server = kLockMade;
+    fake_mono = 0;
+    pauses.clear();
   }
   void TearDown() override {
-    rj_clock = saved_clock_;
+    fileop_release_held_locks();
+    fileop_poll_seconds = saved_poll_;
+    fileop_sleep = saved_sleep_;
+    fileop_monotonic_ns = saved_mono_;
+    fileop_server_clock = saved_server_;
     debug_fileacc = 0;
     ControlDirTest::TearDown();
   }
@@ -45,69 +65,358 @@ class FileopTest : public ControlDirTest {
     return path(std::string(control_names[index]) + ".lock");
   }
 
-  // Plants a lock left by a dead process, optionally with its holder file.
-  void plant_lock(int index, bool with_holder) {
+  // Plants a lock made at kLockMade, with a holder file when `holder` is set.
+  void plant_lock(int index, const char* holder, const std::string& content) {
     std::string lock = lock_dir(index);
     ASSERT_EQ(mkdir(lock.c_str(), 0777), 0);
-    if (with_holder) write_file(std::string(control_names[index]) + ".lock/otherhost", "4242\n");
+    if (holder != nullptr) {
+      write_file(std::string(control_names[index]) + ".lock/" + holder, content);
+    }
     // The age of a lock is its access time; the modification time is left alone.
     struct timespec times[2] = {{kLockMade, 0}, {0, UTIME_OMIT}};
     ASSERT_EQ(utimensat(AT_FDCWD, lock.c_str(), times, 0), 0) << lock;
   }
 
-  time_t (*saved_clock_)() = rj_clock;
+  // Every name in the control directory but the access log and the clock file.
+  std::vector<std::string> entries() const {
+    std::vector<std::string> names;
+    DIR* d = opendir(dir_.c_str());
+    while (struct dirent* e = d != nullptr ? readdir(d) : nullptr) {
+      std::string n = e->d_name;
+      if (n != "." && n != ".." && n != "Render_Access" && n != ".clock.testhost") {
+        names.push_back(n);
+      }
+    }
+    if (d != nullptr) closedir(d);
+    return names;
+  }
+
+  static mode_t mode_of(const std::string& p) {
+    struct stat st;
+    return stat(p.c_str(), &st) == 0 ? st.st_mode & 07777 : 0;
+  }
+
+  unsigned saved_poll_ = fileop_poll_seconds;
+  void (*saved_sleep_)(int64_t) = fileop_sleep;
+  int64_t (*saved_mono_)() = fileop_monotonic_ns;
+  time_t (*saved_server_)() = fileop_server_clock;
 };
 
 TEST_F(FileopTest, FreeLockHoldsHostFileWithPidAndReleaseRemovesBoth) {
   ASSERT_EQ(lock_fileop(FILE_TASKS, 1), 1);
   std::string holder = lock_dir(FILE_TASKS) + "/testhost";
   EXPECT_EQ(read_text_file(holder), std::to_string(getpid()) + "\n");
+  EXPECT_EQ(mode_of(lock_dir(FILE_TASKS)), 0777u);
+  // Made aside and renamed into place: nothing else is left beside it.
+  EXPECT_EQ(entries(), std::vector<std::string>{"Render_Tasks.lock"});
+  EXPECT_TRUE(pauses.empty());
 
   // The lock path is built on first use and the access log is opened with it.
   EXPECT_EQ(std::string(fileop_path(FILE_TASKS)), path("Render_Tasks"));
   EXPECT_EQ(read_file("Render_Access"), "\n\n *** Start of new process entries ***\n\n");
 
+  long before = fileop_hold_stats(FILE_TASKS).count;
+  fake_mono += 3 * kSecond / 1000;
   ASSERT_EQ(lock_fileop(FILE_TASKS, 0), 1);
-  EXPECT_FALSE(exists(holder));
   EXPECT_FALSE(exists(lock_dir(FILE_TASKS)));
+  FileopHoldStats stats = fileop_hold_stats(FILE_TASKS);
+  EXPECT_EQ(stats.count, before + 1);
+  EXPECT_GE(stats.longest_ns, 3 * kSecond / 1000);
 }
 
-TEST_F(FileopTest, WaiterRespectsLockUntil181SecondsThenTakesIt) {
-  plant_lock(FILE_RESOURCES, true);
-  ticks = 0;
-  rj_clock = ticking_clock;
+// A busy lock as a waiter finds it, and when the waiter may break it.
+struct BusyLock {
+  const char* name;
+  const char* holder;    // holder file name, or none
+  std::string content;   // its content; "DEAD" = a pid that has exited
+  long broken_at_age;    // server-clock age at which it is broken; 0 = at once
+  const char* log_line;  // what the access log says of the break
+};
+
+class BusyLockTest : public FileopTest, public testing::WithParamInterface<BusyLock> {};
+
+TEST_P(BusyLockTest, WaiterBreaksItOnlyWhenItsHolderIsGone) {
+  const BusyLock& c = GetParam();
+  std::string content = c.content;
+  if (content == "DEAD") {
+    pid_t child = fork();
+    if (child == 0) _exit(0);
+    ASSERT_EQ(waitpid(child, nullptr, 0), child);
+    content = std::to_string(child) + "\n";
+  }
+  plant_lock(FILE_RESOURCES, c.holder, content);
+  debug_fileacc = 1;
+  ASSERT_EQ(init_fileop(), 1);
   testing::internal::CaptureStderr();
   ASSERT_EQ(lock_fileop(FILE_RESOURCES, 1), 1);
   std::string err = testing::internal::GetCapturedStderr();
 
-  // Ages 179 and 180 were seen and left alone; 181 broke it.
-  EXPECT_EQ(ticks, 3);
-  const std::string message =
-      "181 second timed out on \"otherhost\" in \"" + lock_dir(FILE_RESOURCES) + "\" removed";
-  EXPECT_EQ(err, message + "\n");
-  EXPECT_FALSE(exists(lock_dir(FILE_RESOURCES) + "/otherhost"));
+  long age = static_cast<long>(fake_server - kLockMade);
+  if (c.broken_at_age == 0) {
+    EXPECT_TRUE(pauses.empty()) << age;
+  } else {
+    // Respected until then, and taken within one (at most 5 s) pause after.
+    EXPECT_GE(age, c.broken_at_age);
+    EXPECT_LE(age, c.broken_at_age + 5);
+    // Taken by a retry: the retry mode, which other tools look for.
+    EXPECT_EQ(mode_of(lock_dir(FILE_RESOURCES)), 0664u);
+  }
+  EXPECT_EQ(read_text_file(lock_dir(FILE_RESOURCES) + "/testhost"),
+            std::to_string(getpid()) + "\n");
+  if (c.holder != nullptr && std::string(c.holder) != "testhost") {
+    EXPECT_FALSE(exists(lock_dir(FILE_RESOURCES) + "/" + c.holder));
+  }
+  EXPECT_NE(read_file("Render_Access").find(c.log_line), std::string::npos)
+      << read_file("Render_Access");
+  if (c.broken_at_age == 181) {
+    EXPECT_EQ(err, std::to_string(age) + " second timed out on \"" + c.holder + "\" in \"" +
+                       lock_dir(FILE_RESOURCES) + "\" removed\n");
+  }
+  ASSERT_EQ(lock_fileop(FILE_RESOURCES, 0), 1);
+  EXPECT_EQ(entries(), std::vector<std::string>{});
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Holders, BusyLockTest,
+    testing::Values(
+        BusyLock{"OwnHostDeadPid", "testhost", "DEAD", 0, "left by dead process"},
+        BusyLock{"OwnHostLivePid", "testhost", "1\n", 181, "second timed out on \"testhost\""},
+        BusyLock{"OtherHost", "otherhost", "1\n", 181, "second timed out on \"otherhost\""},
+        BusyLock{"EmptyHolderFile", "otherhost", "", 5, "abandoned without a holder pid"},
+        BusyLock{"OwnHostNoPid", "testhost", "garbage\n", 5, "abandoned without a holder pid"},
+        // An empty directory is replaced by the rename that takes the lock.
+        BusyLock{"NoHolderFile", nullptr, "", 0, "Start of new process entries"}),
+    [](const testing::TestParamInfo<BusyLock>& info) { return std::string(info.param.name); });
+
+TEST_F(FileopTest, BackoffStartsInMillisecondsGrowsAndNeverPausesOverFiveSeconds) {
+  plant_lock(FILE_TASKS, "otherhost", "1\n");
+  testing::internal::CaptureStderr();
+  ASSERT_EQ(lock_fileop(FILE_TASKS, 1), 1);
+  testing::internal::GetCapturedStderr();
+  ASSERT_GE(pauses.size(), 10u);
+  EXPECT_LE(pauses[0], 2 * kSecond / 1000);
+  for (size_t i = 0; i < pauses.size(); i++) {
+    EXPECT_LE(pauses[i], 5 * kSecond) << i;
+    // Each pause is at least half its doubling ceiling: two steps on, longer.
+    if (i >= 2 && pauses[i - 2] < 2 * kSecond) {
+      EXPECT_GT(pauses[i], pauses[i - 2]) << i;
+    }
+  }
+  // 181 s of waiting in a few tens of attempts, not thousands.
+  EXPECT_LE(pauses.size(), 100u);
+  EXPECT_GE(fake_server - kLockMade, 181);
+}
+
+TEST_F(FileopTest, ServerClockIsTheTimeOfATouchedFileReadAtMostOnceASecond) {
+  fileop_server_clock = saved_server_;
+  ASSERT_EQ(init_fileop(), 1);
+  fake_mono = 0;
+  time_t first = fileop_server_clock();
+  const std::string clock_file = path(".clock.testhost");
   struct stat st;
-  ASSERT_EQ(stat(lock_dir(FILE_RESOURCES).c_str(), &st), 0);
-  EXPECT_TRUE(S_ISDIR(st.st_mode));
-  lock_fileop(FILE_RESOURCES, 0);
-  EXPECT_FALSE(exists(lock_dir(FILE_RESOURCES)));
+  ASSERT_EQ(stat(clock_file.c_str(), &st), 0);
+  EXPECT_EQ(first, st.st_mtime);
+  // Within a second the reading is carried forward, the file left alone.
+  struct timespec times[2] = {{kLockMade, 0}, {kLockMade, 0}};
+  ASSERT_EQ(utimensat(AT_FDCWD, clock_file.c_str(), times, 0), 0);
+  fake_mono += kSecond / 2;
+  EXPECT_EQ(fileop_server_clock(), first);
+  fake_mono += kSecond;
+  time_t later = fileop_server_clock();
+  ASSERT_EQ(stat(clock_file.c_str(), &st), 0);
+  EXPECT_EQ(later, st.st_mtime);
+  EXPECT_GE(later, first);
 }
 
 TEST_F(FileopTest, StaleLockWithoutItsHolderFileIsBrokenAllTheSame) {
-  plant_lock(FILE_TASKS, false);
-  fake_now = kLockMade + 181;
-  rj_clock = fixed_clock;
+  plant_lock(FILE_TASKS, nullptr, "");
+  fake_server = kLockMade + 180;
   debug_fileacc = 1;
   ASSERT_EQ(init_fileop(), 1);
   const std::string lock = lock_dir(FILE_TASKS);
+  EXPECT_EQ(fileop_break_stale_lock(lock.c_str()), 0);
+  fake_server = kLockMade + 181;
   const std::string message = "181 second timed out on \"\" in \"" + lock + "\" removed";
   testing::internal::CaptureStderr();
   EXPECT_EQ(fileop_break_stale_lock(lock.c_str()), 1);
   EXPECT_EQ(testing::internal::GetCapturedStderr(), message + "\n");
-  EXPECT_FALSE(exists(lock));
+  EXPECT_EQ(entries(), std::vector<std::string>{});
   // The access log records it too, with the host that broke it.
   EXPECT_NE(read_file("Render_Access").find("* " + message + " --  testhost:"), std::string::npos);
 }
+
+// Forked waiters at one stale lock: one breaks it, all get it in turn, and
+// no two hold it at once.
+TEST_F(FileopTest, WaitersRacingAtAStaleLockBreakItOnceAndTakeItInTurn) {
+  plant_lock(FILE_TASKS, "otherhost", "1\n");
+  fake_server = kLockMade + 200;
+  fileop_sleep = saved_sleep_;  // real, short pauses: the children really wait
+  fileop_monotonic_ns = saved_mono_;
+  fileop_poll_seconds = 1;
+  debug_fileacc = 1;
+  ASSERT_EQ(init_fileop(), 1);
+  int go[2];
+  ASSERT_EQ(pipe(go), 0);
+  const std::string inside = path("inside");
+  std::vector<pid_t> children;
+  for (int i = 0; i < 4; i++) {
+    pid_t child = fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+      rndctl.pid = getpid();
+      close(go[1]);
+      char byte;
+      if (read(go[0], &byte, 1) != 0) _exit(3);
+      if (freopen("/dev/null", "w", stderr) == nullptr) _exit(4);
+      lock_fileop(FILE_TASKS, 1);
+      int fd = open(inside.c_str(), O_WRONLY | O_CREAT | O_EXCL, 0666);
+      if (fd < 0) _exit(2);  // somebody else is inside
+      close(fd);
+      usleep(2000);
+      unlink(inside.c_str());
+      lock_fileop(FILE_TASKS, 0);
+      fflush(nullptr);
+      _exit(0);
+    }
+    children.push_back(child);
+  }
+  close(go[0]);
+  close(go[1]);  // all start together
+  for (pid_t child : children) {
+    int status = 0;
+    ASSERT_EQ(waitpid(child, &status, 0), child);
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+  }
+  std::string log = read_file("Render_Access");
+  size_t breaks = 0;
+  for (size_t at = log.find("second timed out"); at != std::string::npos;
+       at = log.find("second timed out", at + 1)) {
+    breaks++;
+  }
+  EXPECT_EQ(breaks, 1u) << log;
+  EXPECT_EQ(entries(), std::vector<std::string>{});
+}
+
+TEST_F(FileopTest, ReleaseRemovesOnlyLocksThisProcessHolds) {
+  // Another holder's lock, by host or by pid, stays on release.
+  plant_lock(FILE_JOBS, "otherhost", "1\n");
+  plant_lock(FILE_RESOURCES, "testhost", "1\n");
+  ASSERT_EQ(lock_fileop(FILE_JOBS, 0), 1);
+  ASSERT_EQ(lock_fileop(FILE_RESOURCES, 0), 1);
+  EXPECT_TRUE(exists(lock_dir(FILE_JOBS) + "/otherhost"));
+  EXPECT_TRUE(exists(lock_dir(FILE_RESOURCES) + "/testhost"));
+
+  ASSERT_EQ(lock_fileop(FILE_TASKS, 1), 1);
+  ASSERT_EQ(lock_fileop(FILE_DEV_INDEX, 1), 1);
+  ASSERT_EQ(lock_fileop(FILE_JOB_INDEX, 1), 1);
+  ASSERT_EQ(lock_fileop(FILE_JOB_INDEX, 0), 1);
+  // A syntax error ends the process; on its way out it lets go of its locks.
+  void (*saved_exit)(int) = RJC_fatal_exit;
+  RJC_fatal_exit = [](int) {};
+  testing::internal::CaptureStdout();
+  RJC_parse_string("RenderJobControl {{{", 20, "Render_Job_Control");
+  testing::internal::GetCapturedStdout();
+  RJC_fatal_exit = saved_exit;
+  EXPECT_FALSE(exists(lock_dir(FILE_TASKS)));
+  EXPECT_FALSE(exists(lock_dir(FILE_DEV_INDEX)));
+  EXPECT_TRUE(exists(lock_dir(FILE_JOBS) + "/otherhost"));
+  EXPECT_TRUE(exists(lock_dir(FILE_RESOURCES) + "/testhost"));
+}
+
+// One rewrite through each calling shape: the classic one (read, rewind,
+// write to the same stream, close with truncation), the writer that writes
+// straight after the open, and fileop_rewrite.
+enum class Shape { kRewind, kWriteAtOnce, kRewriteHelper };
+
+int rewrite(int index, Shape shape, const std::string& text) {
+  if (shape == Shape::kRewriteHelper) {
+    return fileop_rewrite(index, [&](FILE* in, FILE* out) {
+      while (fgetc(in) != EOF) {
+      }
+      return fwrite(text.data(), 1, text.size(), out) == text.size();
+    });
+  }
+  lock_fileop(index, 1);
+  FILE* fp = update_fileop(index);
+  if (fp == nullptr) return -2;
+  if (shape == Shape::kRewind) {
+    while (fgetc(fp) != EOF) {
+    }
+    rewind_fileop(index);
+  }
+  fwrite(text.data(), 1, text.size(), fp);
+  int result = close_and_truncate_fileop(index);
+  lock_fileop(index, 0);
+  return result;
+}
+
+class RewriteTest : public FileopTest, public testing::WithParamInterface<Shape> {
+ protected:
+  struct stat look(const std::string& name) const {
+    struct stat st = {};
+    EXPECT_EQ(stat(path(name).c_str(), &st), 0);
+    return st;
+  }
+};
+
+TEST_P(RewriteTest, UnchangedContentsLeaveTheFileAloneChangedOnesReplaceItWhole) {
+  const std::string old_text = "123456789\nold tail that must go\n";
+  write_file("Render_Job_next_index", old_text);
+  struct timespec times[2] = {{kLockMade, 0}, {kLockMade, 0}};
+  ASSERT_EQ(utimensat(AT_FDCWD, path("Render_Job_next_index").c_str(), times, 0), 0);
+  struct stat before = look("Render_Job_next_index");
+
+  int same = rewrite(FILE_JOB_INDEX, GetParam(), old_text);
+  EXPECT_EQ(same, 0);
+  struct stat after = look("Render_Job_next_index");
+  EXPECT_EQ(after.st_ino, before.st_ino);
+  EXPECT_EQ(after.st_mtime, kLockMade);
+
+  // Shorter contents: nothing of the old tail stays, the mode is kept.
+  ASSERT_EQ(chmod(path("Render_Job_next_index").c_str(), 0640), 0);
+  int changed = rewrite(FILE_JOB_INDEX, GetParam(), "7\n");
+  EXPECT_EQ(changed, GetParam() == Shape::kRewriteHelper ? 1 : 0);
+  EXPECT_EQ(read_file("Render_Job_next_index"), "7\n");
+  EXPECT_NE(look("Render_Job_next_index").st_ino, before.st_ino);
+  EXPECT_EQ(mode_of(path("Render_Job_next_index")), 0640u);
+  EXPECT_EQ(entries(), std::vector<std::string>{"Render_Job_next_index"});
+}
+
+TEST_P(RewriteTest, AFailedWriteLeavesTheOldFileAndNoTemporary) {
+  const std::string old_text = "old contents\n";
+  write_file("Render_Tasks", old_text);
+  int err[2];
+  ASSERT_EQ(pipe(err), 0);
+  pid_t child = fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    // A file-size limit makes the write fail part way (EFBIG).
+    dup2(err[1], 2);
+    signal(SIGXFSZ, SIG_IGN);
+    struct rlimit limit = {64, 64};
+    setrlimit(RLIMIT_FSIZE, &limit);
+    int result = rewrite(FILE_TASKS, GetParam(), std::string(4096, 'x'));
+    fflush(nullptr);
+    _exit(result == -1 ? 0 : 1);
+  }
+  close(err[1]);
+  int status = 0;
+  ASSERT_EQ(waitpid(child, &status, 0), child);
+  std::string reported(512, '\0');
+  ssize_t n = read(err[0], &reported[0], reported.size());
+  close(err[0]);
+  reported.resize(n > 0 ? static_cast<size_t>(n) : 0);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+  EXPECT_EQ(read_file("Render_Tasks"), old_text);
+  EXPECT_EQ(entries(), std::vector<std::string>{"Render_Tasks"});
+  EXPECT_NE(reported.find("ERROR: failed to write " + path("Render_Tasks") + ": File too large"),
+            std::string::npos)
+      << reported;
+}
+
+INSTANTIATE_TEST_SUITE_P(Shapes, RewriteTest,
+                         testing::Values(Shape::kRewind, Shape::kWriteAtOnce,
+                                         Shape::kRewriteHelper));
 
 TEST_F(FileopTest, ReadingAMissingFileCreatesItEmptyAndFeedsTheParser) {
   ASSERT_EQ(lock_fileop(FILE_JOBS, 1), 1);
@@ -116,26 +425,11 @@ TEST_F(FileopTest, ReadingAMissingFileCreatesItEmptyAndFeedsTheParser) {
   EXPECT_EQ(fgetc(fp), EOF);
   EXPECT_EQ(RJCin, fp);
   EXPECT_STREQ(RJCreadfile, path("Render_Job_Control").c_str());
-  close_fileop(FILE_JOBS);
+  EXPECT_EQ(close_fileop(FILE_JOBS), 0);
   lock_fileop(FILE_JOBS, 0);
   struct stat st;
   ASSERT_EQ(stat(path("Render_Job_Control").c_str(), &st), 0);
   EXPECT_EQ(st.st_size, 0);
-}
-
-TEST_F(FileopTest, ShorterRewriteInPlaceLeavesNoTail) {
-  write_file("Render_Job_next_index", "123456789\nold tail that must go\n");
-  ASSERT_EQ(lock_fileop(FILE_JOB_INDEX, 1), 1);
-  FILE* fp = update_fileop(FILE_JOB_INDEX);
-  ASSERT_NE(fp, nullptr);
-  int value = 0;
-  ASSERT_EQ(fscanf(fp, "%d", &value), 1);
-  EXPECT_EQ(value, 123456789);
-  rewind_fileop(FILE_JOB_INDEX);
-  fprintf(fp, "%d\n", 7);
-  close_and_truncate_fileop(FILE_JOB_INDEX);
-  lock_fileop(FILE_JOB_INDEX, 0);
-  EXPECT_EQ(read_file("Render_Job_next_index"), "7\n");
 }
 
 TEST_F(FileopTest, OriginalUmaskSurvivesReinitialisation) {

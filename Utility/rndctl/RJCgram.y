@@ -402,6 +402,7 @@ void RJCerror(const char* message) {
   fprintf(stdout, "******** %s: line %d of %s file\n", message, RJCcurrent_lineno, file);
   fflush(stdout);
   wrt_logfile("Exiting ******** %s: line %d of %s file", message, RJCcurrent_lineno, file);
+  fileop_release_held_locks();  // the other hosts go on once the file is repaired
   if (RJC_fatal_exit != nullptr) {
     RJC_fatal_exit(-1);
     return;

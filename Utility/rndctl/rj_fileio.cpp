@@ -1,26 +1,27 @@
-// Locked file operations on the shared control directory.
+// Shared files: the path table, the open and close operations, and the
+// atomic rewrite that every writer goes through.  The lock directories are
+// rj_lockdir's.
 //
-// Every shared file has a fixed index; its path and the path of its lock
-// directory are built once per process.  A lock is a directory made with
-// mkdir (the atomic test-and-set that works across hosts on a shared file
-// system) holding one file named after the holder's host, with the holder's
-// pid in it.
-//
-// What a crash leaves behind: a process that dies while holding a lock leaves
-// the lock directory and its holder file.  Nobody cleans it up on purpose;
-// the next waiter breaks it once the directory's access time is 181 seconds
-// old.  Locks are held only for one read or one rewrite, far below that.
-#include <dirent.h>
+// An update stream is a stdio stream over our own functions: reads come
+// from the file as it was at the open (its descriptor stays open), writes
+// land in memory.  The close compares the new contents with the old ones
+// (sizes first) and only when they differ writes them to a temporary file
+// beside the old one, forces it to disk and renames it over the old one.
+// Callers keep their shape (read, rewind, write to the same stream, close
+// with truncation) and still can never leave a torn file: a torn control
+// file stops every daemon of the farm.
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
-#include <climits>
 #include <cstdint>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <memory>
+#include <new>
+#include <string>
 
 #include "Shared/memory/MA_rtns.h"
 #include "Utility/rndctl/rndctl.h"
@@ -29,21 +30,34 @@ const char* const control_names[FILE_COUNT] = {
     "Render_Job_Control",    "Render_Resource_Control", "Render_Tasks",  "RndCtl_EditPids",
     "Render_Dev_next_index", "Render_Job_next_index",   "Render_Access", "Render_Status"};
 
-unsigned fileop_poll_seconds = 5;
-
 namespace {
 
 constexpr const char* kUnit = "Utility/rndctl/rj_fileio";
-// A lock this old (by its directory's access time) is taken to be left by a
-// dead holder.
-constexpr long kStaleSeconds = 181;
+
+struct FdCloser {
+  int fd = -1;
+  ~FdCloser() {
+    if (fd >= 0) close(fd);
+  }
+};
+
+// The state behind an update stream.
+struct UpdateStream {
+  int old_fd = -1;  // the file as it was at the open (owned)
+  std::string out;  // the new contents, from the start of the file
+  int64_t pos = 0;  // the stream's position
+  bool written = false;
+  bool rewound = false;  // rewound and written nothing: the new contents are empty
+  ~UpdateStream() {
+    if (old_fd >= 0) close(old_fd);
+  }
+};
 
 struct FileRecord {
-  char* path = nullptr;       // "%s/%s": control directory, file name (owned)
-  char* lock_path = nullptr;  // "%s/%s.lock" (owned)
-  FILE* stream = nullptr;     // open between an open and a close operation (owned)
-  int fd = -1;                // descriptor of `stream`, for fsync and ftruncate
-  bool for_update = false;    // opened by update_fileop: its close forces it to disk
+  char* path = nullptr;                  // "%s/%s": control directory, file name (owned)
+  char* lock_path = nullptr;             // "%s/%s.lock" (owned)
+  FILE* stream = nullptr;                // open between an open and a close operation (owned)
+  std::unique_ptr<UpdateStream> update;  // behind `stream` after update_fileop
 };
 
 FileRecord files[FILE_COUNT];
@@ -62,51 +76,258 @@ char* make_path(const char* dir, const char* name, const char* suffix, int line)
   return p;
 }
 
-void close_stream(FileRecord& rec) {
-  if (rec.stream != nullptr) {
-    // The access log is opened by init_fileop only; other records are
-    // closed by their close operation.  Reaching here means forgetting.
-    fclose(rec.stream);
+ssize_t pread_full(int fd, char* buf, size_t size, int64_t at) {
+  size_t done = 0;
+  while (done < size) {
+    ssize_t n =
+        pread(fd, buf + done, size - done, static_cast<off_t>(at) + static_cast<off_t>(done));
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0) return -1;
+    if (n == 0) break;
+    done += static_cast<size_t>(n);
   }
-  rec.stream = nullptr;
-  rec.fd = -1;
+  return static_cast<ssize_t>(done);
 }
 
-struct DirCloser {
-  void operator()(DIR* d) const { closedir(d); }
-};
-using ScopedDIR = std::unique_ptr<DIR, DirCloser>;
-
-// Waits between two attempts at a busy lock.  Editors do not wait: they
-// retry at once so that the user sees no delay.
-void poll_pause() {
-  if (is_editor()) return;
-  if (fileop_poll_seconds > 0) sleep(fileop_poll_seconds);
+// Appends the old file's bytes [from, to) to `out`; past the old end, zeros
+// (what a write past the end of a file leaves between).
+bool append_old(const UpdateStream& u, std::string& out, int64_t from, int64_t to) {
+  char chunk[65536];
+  while (from < to) {
+    size_t want = static_cast<size_t>(to - from) < sizeof chunk ? static_cast<size_t>(to - from)
+                                                                : sizeof chunk;
+    ssize_t n = pread_full(u.old_fd, chunk, want, from);
+    if (n < 0) return false;
+    if (n == 0) {
+      out.append(static_cast<size_t>(to - from), '\0');
+      return true;
+    }
+    out.append(chunk, static_cast<size_t>(n));
+    from += n;
+  }
+  return true;
 }
 
-// Opens the stream of a record for reading or rewriting; shared by the two
-// open operations.  `modes` are tried in order.
-FILE* open_record(int index, const char* first_mode, const char* second_mode) {
+int64_t old_size(const UpdateStream& u) {
+  struct stat st;
+  return fstat(u.old_fd, &st) == 0 ? static_cast<int64_t>(st.st_size) : 0;
+}
+
+ssize_t update_read(void* cookie, char* buf, size_t size) {
+  auto* u = static_cast<UpdateStream*>(cookie);
+  ssize_t n = pread_full(u->old_fd, buf, size, u->pos);
+  if (n > 0) u->pos += n;
+  return n;
+}
+
+ssize_t update_write(void* cookie, const char* buf, size_t size) {
+  auto* u = static_cast<UpdateStream*>(cookie);
+  // Never let an exception out into stdio: a write that cannot be kept is
+  // a write error of the stream, and its close reports it.
+  try {
+    if (static_cast<int64_t>(u->out.size()) < u->pos &&
+        !append_old(*u, u->out, static_cast<int64_t>(u->out.size()), u->pos)) {
+      return -1;
+    }
+    size_t at = static_cast<size_t>(u->pos);
+    if (at + size > u->out.size()) u->out.resize(at + size);
+    memcpy(&u->out[at], buf, size);
+  } catch (const std::bad_alloc&) {
+    errno = ENOMEM;
+    return -1;
+  }
+  u->pos += static_cast<int64_t>(size);
+  u->written = true;
+  return static_cast<ssize_t>(size);
+}
+
+int update_seek(void* cookie, off64_t* offset, int whence) {
+  auto* u = static_cast<UpdateStream*>(cookie);
+  int64_t base = 0;
+  if (whence == SEEK_CUR) base = u->pos;
+  if (whence == SEEK_END) {
+    int64_t size = old_size(*u);
+    base = u->written && static_cast<int64_t>(u->out.size()) > size
+               ? static_cast<int64_t>(u->out.size())
+               : size;
+  }
+  if (base + *offset < 0) {
+    errno = EINVAL;
+    return -1;
+  }
+  u->pos = base + *offset;
+  *offset = u->pos;
+  if (whence == SEEK_SET) u->rewound = true;
+  return 0;
+}
+
+// The record owns the state; the stream's close leaves it to the record.
+int update_close(void*) { return 0; }
+
+const cookie_io_functions_t kUpdateFunctions = {update_read, update_write, update_seek,
+                                                update_close};
+
+void report_write_failure(const char* path, int error) {
+  EDuprintf("ERROR: failed to write %s: %s", path, strerror(error));
+  dbgpnt("ERROR: failed to write %s: %s\n", path, strerror(error));
+}
+
+// Whether `data` equals the file behind `fd`, sizes first.
+bool same_contents(int fd, const struct stat& st, const std::string& data) {
+  if (static_cast<uint64_t>(st.st_size) != data.size()) return false;
+  char chunk[65536];
+  size_t at = 0;
+  while (at < data.size()) {
+    size_t want = data.size() - at < sizeof chunk ? data.size() - at : sizeof chunk;
+    ssize_t n = pread_full(fd, chunk, want, static_cast<int64_t>(at));
+    if (n != static_cast<ssize_t>(want) || memcmp(chunk, data.data() + at, want) != 0) return false;
+    at += want;
+  }
+  return true;
+}
+
+// Forces a directory entry change (a rename) to disk.  Failing that, the new
+// contents are in place but might not survive a crash of the file server;
+// nothing the caller could do about it, so it is traced, not returned.
+void sync_directory(const char* path) {
+  std::string dir(path);
+  size_t slash = dir.rfind('/');
+  dir = slash == std::string::npos ? "." : slash == 0 ? "/" : dir.substr(0, slash);
+  FdCloser d{open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC)};
+  if (d.fd < 0 || (fsync(d.fd) != 0 && errno != EINVAL)) {
+    dbgpnt("fsync of directory %s: %s\n", dir.c_str(), strerror(errno));
+  }
+}
+
+// Replaces the file `path` (open as `old_fd`) by `data`: 1 written,
+// 0 unchanged (nothing touched), -1 failed and reported (old file stands).
+int replace_file(const char* path, int old_fd, const std::string& data) {
+  struct stat st;
+  bool have_old = fstat(old_fd, &st) == 0;
+  if (have_old && same_contents(old_fd, st, data)) return 0;
+
+  std::string temp = std::string(path) + ".new.XXXXXX";
+  int fd = mkostemp(&temp[0], O_CLOEXEC);
+  if (fd < 0) {
+    report_write_failure(path, errno);
+    return -1;
+  }
+  int error = 0;
+  if (have_old) {
+    // The file keeps its mode (and, where we may, its owner): other users'
+    // daemons and editors must still be able to rewrite it.
+    if (fchmod(fd, st.st_mode & 07777) != 0)
+      dbgpnt("fchmod %s: %s\n", temp.c_str(), strerror(errno));
+    if (geteuid() == 0 && fchown(fd, st.st_uid, st.st_gid) != 0) {
+      dbgpnt("fchown %s: %s\n", temp.c_str(), strerror(errno));
+    }
+  }
+  size_t done = 0;
+  while (error == 0 && done < data.size()) {
+    ssize_t n = write(fd, data.data() + done, data.size() - done);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0)
+      error = n < 0 ? errno : EIO;
+    else
+      done += static_cast<size_t>(n);
+  }
+  if (error == 0 && fsync(fd) != 0) error = errno;
+  // A network file system may report a failed write only here.
+  if (close(fd) != 0 && error == 0) error = errno;
+  if (error == 0 && rename(temp.c_str(), path) != 0) error = errno;
+  if (error != 0) {
+    unlink(temp.c_str());
+    report_write_failure(path, error);
+    errno = error;
+    return -1;
+  }
+  sync_directory(path);
+  return 1;
+}
+
+void report_open_failure(int index, const char* verb) {
+  // "ERROR: failed to <verb> <path>" to the user, stdout and the trace, with
+  // the system's reason; both open paths say "in read_fileop", which log
+  // readers match.
+  const char* path = files[index].path != nullptr ? files[index].path : "";
+  int saved_errno = errno;
+  EDuprintf("ERROR: failed to %s %s", verb, path);
+  printf("ERROR: failed to %s %s\n", verb, path);
+  errno = saved_errno;
+  perror("in read_fileop");
+  dbgpnt("ERROR: failed to %s %s\n", verb, path);
+}
+
+// Closes the stream of a record.  The new contents of an update stream that
+// was written end at the stream's position (a close with truncation) or
+// where the longer of old and new ends (a plain close, which cuts nothing).
+int close_record(int index, bool cut_at_position) {
+  if (!valid_index(index) || index == FILE_ACCESS) return 0;
   FileRecord& rec = files[index];
-  if (rec.path == nullptr) init_fileop();
-  if (rec.path == nullptr) return nullptr;
+  if (rec.stream == nullptr) return 0;
+  int result = 0;
+  int error = 0;
+  errno = 0;
+  if (fflush(rec.stream) != 0 || ferror(rec.stream)) error = errno != 0 ? errno : EIO;
+  std::unique_ptr<UpdateStream> update = std::move(rec.update);
+  if (fclose(rec.stream) != 0 && error == 0 && !update) error = errno;
+  rec.stream = nullptr;
+  if (error != 0) {
+    report_write_failure(rec.path, error);
+    return -1;
+  }
+  if (update && (update->written || update->rewound)) {
+    int64_t end = update->pos;
+    if (!cut_at_position) {
+      int64_t size = old_size(*update);
+      end = static_cast<int64_t>(update->out.size()) > size
+                ? static_cast<int64_t>(update->out.size())
+                : size;
+    }
+    std::string& data = update->out;
+    try {
+      if (static_cast<int64_t>(data.size()) > end) data.resize(static_cast<size_t>(end));
+      if (static_cast<int64_t>(data.size()) < end &&
+          !append_old(*update, data, static_cast<int64_t>(data.size()), end)) {
+        report_write_failure(rec.path, errno);
+        return -1;
+      }
+    } catch (const std::bad_alloc&) {
+      report_write_failure(rec.path, ENOMEM);
+      return -1;
+    }
+    if (replace_file(rec.path, update->old_fd, data) < 0) result = -1;
+  }
+  return result;
+}
+
+// Opens (creating it when absent) the file as it stands, for an update.
+int open_old(int index) {
+  int fd;
+  do {
+    fd = open(files[index].path, O_RDONLY | O_CREAT | O_CLOEXEC, 0666);
+  } while (fd < 0 && errno == EINTR);
+  return fd;
+}
+
+bool ensure_paths(int index) {
+  if (files[index].path == nullptr) init_fileop();
+  return files[index].path != nullptr;
+}
+
+void forget_stream(FileRecord& rec) {
   if (rec.stream != nullptr) {
     // A previous open of the same file was never closed: do not leak it.
     fclose(rec.stream);
-    rec.stream = nullptr;
   }
-  FILE* fp = fopen(rec.path, first_mode);
-  if (fp == nullptr) fp = fopen(rec.path, second_mode);
-  rec.stream = fp;
-  rec.fd = fp != nullptr ? fileno(fp) : -1;
-  rec.for_update = false;
-  return fp;
+  rec.stream = nullptr;
+  rec.update.reset();
 }
 
 void after_open(int index, FILE* fp) {
   // Fully buffered: whole files are read or rewritten under their lock, and
   // a line-buffered stream would cost one system call per line of a large
-  // job file.  Nobody reads a locked file half-written either way.
+  // job file.
   setvbuf(fp, nullptr, _IOFBF, 1 << 16);
   if (index == FILE_JOBS || index == FILE_RESOURCES) {
     RJCin = fp;
@@ -146,7 +367,6 @@ int init_fileop() {
       errno = saved_errno;
       perror("in init_fileop");
     } else {
-      log.fd = fileno(log.stream);
       fprintf(log.stream, "\n\n *** Start of new process entries ***\n\n");
       fflush(log.stream);
     }
@@ -154,127 +374,35 @@ int init_fileop() {
   return 1;
 }
 
-int fileop_break_stale_lock(const char* lock_path) {
-  // The access time is read before the directory is listed: listing may
-  // itself refresh it, and the age must be that of the lock, not of our look.
-  struct stat st;
-  if (lock_path == nullptr || stat(lock_path, &st) != 0) return 0;
-  long age = static_cast<long>(rj_now() - st.st_atime);
-  if (age < kStaleSeconds) return 0;
-
-  char entry[NAME_MAX + 1] = "";
-  {
-    ScopedDIR dir(opendir(lock_path));
-    if (dir) {
-      // Another waiter may have broken this lock and a new holder taken it
-      // since the stat: then it is not the stale lock any more.
-      struct stat now_st;
-      if (fstat(dirfd(dir.get()), &now_st) == 0 &&
-          (now_st.st_ino != st.st_ino || now_st.st_dev != st.st_dev)) {
-        return 0;
-      }
-      while (struct dirent* d = readdir(dir.get())) {
-        if (strcmp(d->d_name, ".") == 0 || strcmp(d->d_name, "..") == 0) continue;
-        snprintf(entry, sizeof entry, "%s", d->d_name);
-      }
-    }
-  }
-  if (entry[0] != '\0') {
-    char holder[PATH_MAX];
-    if (snprintf(holder, sizeof holder, "%s/%s", lock_path, entry) <
-        static_cast<int>(sizeof holder)) {
-      unlink(holder);
-    }
-  }
-  rmdir(lock_path);
-  EDuprintf("%d second timed out on \"%s\" in \"%s\" removed", static_cast<int>(age), entry,
-            lock_path);
-  dbg_logfile("%d second timed out on \"%s\" in \"%s\" removed", static_cast<int>(age), entry,
-              lock_path);
-  sounder(0);
-  return 1;
-}
-
-int lock_fileop(int index, int take) {
-  if (!valid_index(index)) return 0;
-  FileRecord& rec = files[index];
-  if (rec.lock_path == nullptr) init_fileop();
-  if (rec.lock_path == nullptr) return 0;
-
-  char holder[PATH_MAX];
-  snprintf(holder, sizeof holder, "%s/%s", rec.lock_path, rndctl.host.or_else(""));
-
-  if (take == 0) {
-    // No ownership check: when the lock was broken and retaken by another
-    // host, its holder file stays, the rmdir fails and the other keeps it.
-    unlink(holder);
-    rmdir(rec.lock_path);
-    return 1;
-  }
-
-  mode_t previous = umask(0);
-  if (mkdir(rec.lock_path, 0777) != 0) {
-    dbgpnt(":::::: WAITING on %s\n", rec.lock_path);
-    for (;;) {
-      poll_pause();
-      // The retry mode differs from the first attempt's on purpose (without
-      // search permission the retaker usually gets no holder file); other
-      // tools depend on seeing exactly these modes.
-      if (mkdir(rec.lock_path, 0664) == 0) break;
-      // A missing control directory lands here too: stat fails, nothing is
-      // broken and the waiter keeps trying until the directory is back.
-      fileop_break_stale_lock(rec.lock_path);
-    }
-  }
-
-  // The lock directory is world-writable: never follow a planted link.
-  int fd = open(holder, O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0666);
-  if (fd >= 0) {
-    char text[32];
-    int n = snprintf(text, sizeof text, "%d\n", rndctl.pid);
-    ssize_t written;
-    do {
-      written = write(fd, text, static_cast<size_t>(n));
-    } while (written < 0 && errno == EINTR);
-    close(fd);
-  }
-  umask(previous);
-  return 1;
-}
-
-// "ERROR: failed to <verb> <path>" to the user, stdout and the trace, with
-// the system's reason; both open paths say "in read_fileop", which log
-// readers match.
-static void report_open_failure(int index, const char* verb) {
-  const char* path = files[index].path != nullptr ? files[index].path : "";
-  int saved_errno = errno;
-  EDuprintf("ERROR: failed to %s %s", verb, path);
-  printf("ERROR: failed to %s %s\n", verb, path);
-  errno = saved_errno;
-  perror("in read_fileop");
-  dbgpnt("ERROR: failed to %s %s\n", verb, path);
-}
-
 FILE* read_fileop(int index) {
-  if (!valid_index(index)) return nullptr;
-  FILE* fp = open_record(index, "r+e", "w+e");
+  if (!valid_index(index) || !ensure_paths(index)) return nullptr;
+  FileRecord& rec = files[index];
+  forget_stream(rec);
+  FILE* fp = fopen(rec.path, "r+e");
+  if (fp == nullptr) fp = fopen(rec.path, "w+e");
   if (fp == nullptr) {
     report_open_failure(index, "open");
     return nullptr;
   }
+  rec.stream = fp;
   after_open(index, fp);
   return fp;
 }
 
 FILE* update_fileop(int index) {
-  if (!valid_index(index)) return nullptr;
-  FILE* fp = open_record(index, "rb+e", "w+e");
+  if (!valid_index(index) || !ensure_paths(index)) return nullptr;
+  FileRecord& rec = files[index];
+  forget_stream(rec);
+  auto update = std::make_unique<UpdateStream>();
+  update->old_fd = open_old(index);
+  FILE* fp = update->old_fd >= 0 ? fopencookie(update.get(), "r+", kUpdateFunctions) : nullptr;
   if (fp == nullptr) {
     report_open_failure(index, "create");
     sounder(3);
     return nullptr;
   }
-  files[index].for_update = true;
+  rec.stream = fp;
+  rec.update = std::move(update);
   after_open(index, fp);
   return fp;
 }
@@ -286,50 +414,70 @@ void rewind_fileop(int index) {
   rewind(fp);
 }
 
-void close_fileop(int index) {
-  if (!valid_index(index) || index == FILE_ACCESS) return;
-  FileRecord& rec = files[index];
-  if (rec.stream == nullptr) return;
-  fflush(rec.stream);
-  // Forcing a file that was only read costs a journal commit (its access
-  // time) and protects nothing.
-  if (rec.for_update) fsync(rec.fd);
-  fclose(rec.stream);
-  rec.stream = nullptr;
-  rec.fd = -1;
-}
+int close_fileop(int index) { return close_record(index, false); }
 
-void close_and_truncate_fileop(int index) {
-  if (!valid_index(index) || index == FILE_ACCESS) return;
-  FileRecord& rec = files[index];
-  if (rec.stream == nullptr) return;
-  // The rewrite went over the old content in place; cutting at the current
-  // position drops the old tail.  The file is never seen empty in between.
-  fflush(rec.stream);
-  fsync(rec.fd);
-  long position = ftell(rec.stream);
-  if (position >= 0) {
-    while (ftruncate(rec.fd, position) != 0 && errno == EINTR) {
-    }
+int close_and_truncate_fileop(int index) { return close_record(index, true); }
+
+int fileop_rewrite(int index, bool (*change)(FILE* in, FILE* out, void* context), void* context) {
+  if (!valid_index(index) || index == FILE_ACCESS || change == nullptr || !ensure_paths(index)) {
+    return -1;
   }
-  fclose(rec.stream);
-  rec.stream = nullptr;
-  rec.fd = -1;
+  FileopLock lock(index);
+  if (!lock.held()) return -1;
+  FdCloser old{open_old(index)};
+  if (old.fd < 0) {
+    report_open_failure(index, "create");
+    return -1;
+  }
+  // The reader gets its own descriptor: closing `in` must not close `old`.
+  int in_fd = dup(old.fd);
+  struct InCloser {
+    void operator()(FILE* f) const { fclose(f); }
+  };
+  std::unique_ptr<FILE, InCloser> in(in_fd >= 0 ? fdopen(in_fd, "r") : nullptr);
+  if (!in) {
+    if (in_fd >= 0) close(in_fd);
+    report_open_failure(index, "open");
+    return -1;
+  }
+  char* buffer = nullptr;
+  size_t length = 0;
+  FILE* out = open_memstream(&buffer, &length);
+  if (out == nullptr) {
+    report_write_failure(files[index].path, errno);
+    return -1;
+  }
+  errno = 0;
+  bool changed = change(in.get(), out, context);
+  bool out_failed = ferror(out) != 0;
+  int close_result = fclose(out);  // sets buffer and length
+  std::unique_ptr<char, decltype(&free)> owned(buffer, &free);
+  if (!changed) return 0;
+  if (out_failed || close_result != 0) {
+    report_write_failure(files[index].path, errno != 0 ? errno : ENOMEM);
+    return -1;
+  }
+  std::string data(buffer != nullptr ? buffer : "", length);
+  return replace_file(files[index].path, old.fd, data);
 }
 
 mode_t get_original_umask() { return saved_umask; }
 
 const char* fileop_path(int index) {
-  if (!valid_index(index)) return nullptr;
-  if (files[index].path == nullptr) init_fileop();
+  if (!valid_index(index) || !ensure_paths(index)) return nullptr;
   return files[index].path;
+}
+
+const char* fileop_lock_path(int index) {
+  if (!valid_index(index) || !ensure_paths(index)) return nullptr;
+  return files[index].lock_path;
 }
 
 FILE* fileop_access_stream() { return files[FILE_ACCESS].stream; }
 
 void fileop_reset() {
   for (FileRecord& rec : files) {
-    close_stream(rec);
+    forget_stream(rec);
     MA_free(rec.path, __LINE__, kUnit);
     MA_free(rec.lock_path, __LINE__, kUnit);
     rec.path = nullptr;
