@@ -39,6 +39,7 @@ pids=()
 stop_all() {
   local p
   for p in "${pids[@]}"; do kill -KILL "$p" 2>/dev/null || true; done
+  for p in "${pids[@]}"; do wait "$p" 2>/dev/null || true; done
   pkill_renders
   pids=()
 }
@@ -46,7 +47,7 @@ stop_all() {
 pkill_renders() {
   local p
   for p in /proc/[0-9]*; do
-    if tr '\0' ' ' <"$p/cmdline" 2>/dev/null | grep -q "^$render_bin/stamp_render .*$root"; then
+    if { tr '\0' ' ' <"$p/cmdline"; } 2>/dev/null | grep -qE "^([^ ]*/)?stamp_render .*$root"; then
       kill -KILL "${p#/proc/}" 2>/dev/null || true
     fi
   done
@@ -54,7 +55,7 @@ pkill_renders() {
 cleanup() {
   stop_all
   [ -n "$sshd_pid" ] && kill "$sshd_pid" 2>/dev/null || true
-  rm -rf "$root"
+  [ -n "${FARM_BENCH_KEEP:-}" ] || rm -rf "$root"
 }
 trap cleanup EXIT
 
@@ -124,7 +125,7 @@ END
 
 job_state() {
   awk '/^\tstatus / { s = $0; sub(/^[^"]*"/, "", s); sub(/".*$/, "", s); print s; exit }' \
-    "$farm/Render_Job_Control" 2>/dev/null || true
+    "$farm/ctl/Render_Job_Control" 2>/dev/null || true
 }
 
 # run_setting H N T P MODE  (MODE: local or sshfs); prints one report block
