@@ -193,10 +193,11 @@ bool SshServer::start(const std::string& dir, std::string* why) {
   // still refuse (no privileges in a container, say).
   std::string trial = dir + "/trial";
   mkdir(trial.c_str(), 0755);
-  std::string cmd = "timeout 30 unshare -m --propagation private sh -c \"" +
-                    sshfs_command(dir, trial) + " & for i in $(seq 200); do [ -e '" + trial +
-                    "/sshd_config' ] && exit 0; sleep 0.05; done; exit 1\" >'" + dir +
-                    "/trial.log' 2>&1";
+  write_text_file(dir + "/trial.sh", sshfs_command(dir, trial) +
+                                         " &\nfor i in $(seq 200); do\n  [ -e '" + trial +
+                                         "/sshd_config' ] && exit 0\n  sleep 0.05\ndone\nexit 1\n");
+  std::string cmd = "timeout 30 unshare -m --propagation private sh '" + dir + "/trial.sh' >'" +
+                    dir + "/trial.log' 2>&1";
   if (!shell(cmd)) {
     *why = "an sshfs trial mount failed: " + read_text_file(dir + "/trial.log");
     return false;
