@@ -13,6 +13,10 @@ have_cmd bison || need+=(bison)
 have_cmd faketime || need+=(faketime)
 have_cmd ps || need+=(procps)
 have_cmd unshare || need+=(util-linux)
+# Network-mount variants of the farm tests: each host mounts the control
+# directory over sshfs from an sshd on the loopback.
+have_cmd sshfs || need+=(sshfs)
+[ -x /usr/sbin/sshd ] || need+=(openssh-server)
 have_pkg libgtest-dev || need+=(libgtest-dev)
 have_pkg libgmock-dev || need+=(libgmock-dev)
 have_pkg libbenchmark-dev || need+=(libbenchmark-dev)

@@ -1,0 +1,53 @@
+// Eight hosts race for the one-frame tasks of one job of very short frames:
+// the task file's lock is all that keeps two hosts from taking the same task.
+#include <map>
+
+#include "tests/e2e/farm_hosts.h"
+#include "tests/e2e/render_farm.h"
+
+namespace {
+
+TEST(Contention, EightHostsRenderEveryFrameOfOneJobExactlyOnce) {
+  if (!is_root()) GTEST_SKIP() << "needs root: daemons run in UTS namespaces of their own";
+  constexpr int kFrames = 64;
+  Farm farm;
+  std::string scene = make_project(farm);
+  FarmHosts hosts(farm, nullptr);
+  std::vector<std::string> names;
+  std::vector<ResourceSpec> resources;
+  for (int i = 0; i < 8; ++i) {
+    names.push_back("race" + std::to_string(i));
+    resources.push_back({names.back(), i + 1, 1, 1, "AVAILABLE", ""});
+  }
+  std::string stamps = farm.path("../stamps");
+  JobSpec job;
+  job.name = "race";
+  job.end = kFrames;
+  job.opts = "sleep=0.05 stamp=" + stamps;
+  job.hosts = names;
+  std::string text = job_file({job}, scene);
+  text.replace(text.find("= frame_painter;"), 16, "= stamp_render;");
+  farm.write("Render_Resource_Control", resource_file(resources));
+  farm.write("Render_Job_Control", text);
+
+  for (const auto& h : names) ASSERT_TRUE(hosts.start(h)) << h;
+  bool finished = hosts.wait_until([&] { return job_status(farm, "race") == "finished"; }, 150);
+  EXPECT_TRUE(finished) << "job is \"" << job_status(farm, "race") << "\"\n"
+                        << farm.read("Render_Tasks");
+
+  std::map<int, std::string> where;
+  std::string twice, missing;
+  for (const Stamp& s : read_stamps(stamps)) {
+    int f = static_cast<int>(s.frame);
+    if (where.count(f) != 0) twice += " " + std::to_string(f) + "(" + where[f] + "," + s.host + ")";
+    where[f] += s.host;
+  }
+  for (int f = 1; f <= kFrames; ++f) {
+    if (where.count(f) == 0) missing += " " + std::to_string(f);
+  }
+  EXPECT_TRUE(twice.empty()) << "frames rendered twice:" << twice;
+  EXPECT_TRUE(missing.empty()) << "frames never rendered:" << missing;
+  EXPECT_TRUE(hosts.shut_down(30).empty()) << "a daemon did not leave when stopped";
+}
+
+}  // namespace
