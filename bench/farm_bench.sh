@@ -180,7 +180,7 @@ run_setting() {
     END {
       # Gaps: per host in start order, each render takes the slot that came
       # free last before it started.
-      for (i = 1; i <= n_r; i++) order[i-1] = sprintf("%s %020d %d", rh[i], rs[i], i)
+      for (i = 1; i <= n_r; i++) order[i-1] = sprintf("%s %020.0f %d", rh[i], rs[i], i)
       sort(order, n_r)
       ng = 0
       for (k = 0; k < n_r; k++) {
