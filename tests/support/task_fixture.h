@@ -35,6 +35,7 @@ class TaskFixture : public ControlDirTest {
   void mkdir_p(const std::string& rel) const { std::filesystem::create_directories(path(rel)); }
 
   /// A running-task entry of `job` for start..end on `dev`, in `status`.
+  /// An entry on this host stands for a piece this daemon took.
   TASK* add_entry(Job* job, Dev* dev, float start, float end, int status, int id = 0) {
     auto* rec = MA_new<TaskRec>(__LINE__, "tests/task_fixture");
     rec->start = start;
@@ -43,7 +44,9 @@ class TaskFixture : public ControlDirTest {
     rec->status = status;
     rec->id = id;
     rec->dev = dev;
-    return Task_add(job, rec);
+    TASK* entry = Task_add(job, rec);
+    if (entry != nullptr) entry->taken = rj_dev_is_this_host(dev) ? 1 : 0;
+    return entry;
   }
 
   /// Waits for `pid` and returns its raw wait status.
