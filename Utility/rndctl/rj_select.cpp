@@ -194,6 +194,9 @@ class EntryIndex {
   /// A new entry of the selected job.
   void add(TASK* e) { entries_->push_back(e); }
 
+  /// The entries of the selected job (new ones included).
+  const std::vector<TASK*>& selected() const { return *entries_; }
+
   /// Every job that has entries (the null job of entries whose job left
   /// the file included).
   template <class F>
@@ -230,11 +233,13 @@ void retire_other_lives(TaskGroup* groups, TaskAfterLock* after) {
       if (job == nullptr) return;  // its job left the file: UpdateRunningTasks ends those
       auto it = in_file.find(job);
       const TaskGroup* g = it != in_file.end() ? it->second : nullptr;
-      if (g == nullptr || g->next_task_id < Task_seen_next_id(job)) {
+      index.select(job);
+      int seen = 0;
+      for (const TASK* e : index.selected()) seen = std::max(seen, e->seen_next_id);
+      if (g == nullptr || g->next_task_id < seen) {
         gone.push_back(job);
         return;
       }
-      index.select(job);
       for (const TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
         TASK* e = index.find(rec->id);
         if (e != nullptr && !Task_same_rec(e->rec, rec)) {
@@ -406,7 +411,7 @@ TASK* Task_get() {
       }
       if (e != nullptr) e->stale = 0;
     }
-    Task_note_group(job, g);
+    for (TASK* e : index.selected()) e->seen_next_id = std::max(e->seen_next_id, g->next_task_id);
   }
 
   rewind_fileop(FILE_TASKS);

@@ -44,12 +44,6 @@ bool owned_status(int status) {
   return status == TASK_STARTED || status == TASK_RUNNING || status == TASK_FAILED;
 }
 
-// Per job index: the highest next_task_id this host has seen of its group.
-std::unordered_map<int, int> seen_next_ids;
-// Jobs (by index) found in another life where their entries could not be
-// dropped at once.
-std::vector<int> rebuilt_jobs;
-
 void kill_here(int pid) { rj_kill_render(rndctl.host.c_str(), pid, 9); }
 
 }  // namespace
@@ -132,29 +126,31 @@ int Task_settle(TASK* entry, TaskRec* file_rec, TaskAfterLock* after) {
 }
 
 int Task_seen_next_id(const Job* job) {
-  if (job == nullptr) return 0;
-  auto it = seen_next_ids.find(job->index);
-  return it != seen_next_ids.end() ? it->second : 0;
+  int seen = 0;
+  for (const TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
+    if (e->job == job && job != nullptr) seen = std::max(seen, e->seen_next_id);
+  }
+  return seen;
 }
 
 void Task_note_group(const Job* job, const TaskGroup* group) {
-  if (job == nullptr) return;
-  if (group == nullptr) {
-    seen_next_ids.erase(job->index);
-    return;
+  if (job == nullptr || group == nullptr) return;
+  for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
+    if (e->job == job) e->seen_next_id = std::max(e->seen_next_id, group->next_task_id);
   }
-  int& seen = seen_next_ids[job->index];
-  seen = std::max(seen, group->next_task_id);
 }
 
 bool Task_group_rebuilt(const Job* job, const TaskGroup* group) {
   if (job == nullptr) return false;
   std::unordered_map<int, const TaskRec*> ids;
+  int seen = 0;
   for (const TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
-    if (e->job == job && e->rec != nullptr) ids.emplace(e->rec->id, e->rec);
+    if (e->job != job || e->rec == nullptr) continue;
+    ids.emplace(e->rec->id, e->rec);
+    seen = std::max(seen, e->seen_next_id);
   }
   if (ids.empty()) return false;  // nothing here that could belong to another life
-  if (group == nullptr || group->next_task_id < Task_seen_next_id(job)) return true;
+  if (group == nullptr || group->next_task_id < seen) return true;
   for (const TaskRec* rec = group->tasks; rec != nullptr; rec = rec->next) {
     auto it = ids.find(rec->id);
     if (it != ids.end() && !Task_same_rec(it->second, rec)) return true;
@@ -172,33 +168,27 @@ void Task_retire_job(const Job* job, TaskAfterLock* after) {
     Task_let_go(e, after);
     TASK_free(e);
   }
-  Task_note_group(job, nullptr);
 }
 
 void Task_mark_rebuilt(const Job* job) {
   if (job == nullptr) return;
-  if (std::find(rebuilt_jobs.begin(), rebuilt_jobs.end(), job->index) == rebuilt_jobs.end()) {
-    rebuilt_jobs.push_back(job->index);
+  for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
+    if (e->job == job) e->rebuilt = 1;
   }
 }
 
 int Task_retire_marked() {
-  if (rebuilt_jobs.empty()) return 0;
-  int before = 0;
-  for (const TASK* e = rndctl.tasks; e != nullptr; e = e->next) ++before;
-  std::vector<int> marked;
-  marked.swap(rebuilt_jobs);
-  for (int index : marked) {
-    const Job* job = nullptr;
-    for (const TASK* e = rndctl.tasks; e != nullptr && job == nullptr; e = e->next) {
-      if (e->job != nullptr && e->job->index == index) job = e->job;
-    }
-    Task_retire_job(job, nullptr);
-    seen_next_ids.erase(index);
+  int dropped = 0;
+  TASK* next = nullptr;
+  for (TASK* e = rndctl.tasks; e != nullptr; e = next) {
+    next = e->next;
+    if (!e->rebuilt) continue;
+    dbgpnt("freeing Task %x\n", px(e));
+    Task_let_go(e, nullptr);
+    TASK_free(e);
+    ++dropped;
   }
-  int after = 0;
-  for (const TASK* e = rndctl.tasks; e != nullptr; e = e->next) ++after;
-  return before - after;
+  return dropped;
 }
 
 TASK* Task_add(Job* job, TaskRec* rec) {

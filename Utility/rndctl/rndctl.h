@@ -218,7 +218,9 @@ struct TASK {
   // is judged; an entry made from the file for a record that names this host
   // (left by an earlier daemon) never is.
   int taken = 0;
-  int killed = 0;  // its job left the file and its render was killed; freed once reaped
+  int killed = 0;        // its job left the file and its render was killed; freed once reaped
+  int seen_next_id = 0;  // the highest next_task_id seen of its group
+  int rebuilt = 0;       // its group was found built again: dropped at the next safe point
 };
 
 // ---------------------------------------------------------------------------
@@ -503,18 +505,18 @@ int Task_settle(TASK* entry, TaskRec* file_rec, TaskAfterLock* after);
 /// no entry and is not judged, its stream and output files are removed.
 void Task_let_go(TASK* entry, TaskAfterLock* after);
 
-/// Lives of a task group.  This host remembers, per job, the highest
-/// next_task_id it has seen.  A group is a new life when it vanished from the
+/// Lives of a task group.  This host's entries of a job remember the highest
+/// next_task_id seen of its group.  A group is a new life when it vanished from the
 /// file, when its next_task_id went below what this host saw, or when one of
 /// its ids names another start frame than this host's entry of that id.
 /// Task_group_rebuilt answers for `job` against the groups read from the file
 /// (`group` is the job's group there or null); Task_note_group records what
 /// was seen.  Every entry of a job of another life is dropped with
 /// Task_retire_job; where entries cannot be freed at once (a caller walks
-/// the list) Task_mark_rebuilt notes the job and Task_retire_marked, at a
+/// the list) Task_mark_rebuilt marks its entries and Task_retire_marked, at a
 /// point where nobody walks the list, drops them.
 [[nodiscard]] bool Task_group_rebuilt(const Job* job, const TaskGroup* group);
-/// The highest next_task_id this host has seen for `job` (0: none).
+/// The highest next_task_id this host's entries of `job` have seen (0: none).
 int Task_seen_next_id(const Job* job);
 void Task_note_group(const Job* job, const TaskGroup* group);
 void Task_retire_job(const Job* job, TaskAfterLock* after);
