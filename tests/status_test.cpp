@@ -20,6 +20,12 @@ constexpr auto label_of = [](const auto& info) { return std::string(info.param.l
 
 class StatusTest : public TaskFixture {
  protected:
+  void SetUp() override {
+    TaskFixture::SetUp();
+    // The tests reap their own render stand-ins; a handler that an earlier
+    // test left in place must not take them first.
+    signal(SIGCHLD, SIG_DFL);
+  }
   /// An entry whose stream reads the file "stream" of the control directory.
   TASK* entry_with_stream(float start, float end) {
     TASK* entry = add_entry(job_, dev_, start, end, TASK_RUNNING);
@@ -140,6 +146,7 @@ TEST_F(StatusTest, StartedTaskTurnsRunningOnlyOnItsOwnHost) {
   TASK* theirs = add_entry(job_, other_host(), 4, 6, TASK_STARTED, 1);
   TASK* waiting = add_entry(job_, dev_, 7, 9, TASK_STARTED, 2);
   mine->pid = 4242;  // any pid of 2 or more counts as a process
+  write_task_file();
   TaskRec* recs[3] = {mine->rec, theirs->rec, waiting->rec};
   EXPECT_EQ(ISA_task_running(theirs), 1);
   EXPECT_EQ(ISA_task_running(waiting), 0);
@@ -158,6 +165,7 @@ TEST_F(StatusTest, AbortedJobStopsThisHostsTasksAndOthersPendingOnes) {
   TASK* started = add_entry(job_, other, 7, 9, TASK_STARTED, 2);
   give_sleeper(running);
   int pid = running->pid;
+  write_task_file();
   TaskRec* recs[3] = {running->rec, pending->rec, started->rec};
   EXPECT_EQ(UpdateRunningTasks(), 1);  // the other host's STARTED task
   expect_killed(pid);
@@ -185,6 +193,7 @@ TEST_P(EndOfProcess, ExitValueDecidesAndOutputGoesUnlessKept) {
   entry->rec->current = 4;
   entry->pid = 0;  // reaped
   entry->waitstatus = c.waitstatus;
+  write_task_file();
   TaskRec* rec = entry->rec;
 
   EXPECT_EQ(UpdateRunningTasks(), 0);
@@ -215,6 +224,7 @@ TEST_F(StatusTest, FailedTaskOfThisHostsJobEndsInTheJobFileWithItsError) {
   write_file("out", "loading scene\nshader did not build\nexiting\n");
   entry->out_path.set(path("out").c_str());
   entry->waitstatus = 1;
+  write_task_file();
 
   EXPECT_EQ(UpdateRunningTasks(), 0);
   Job* job = Job_by_index(1);

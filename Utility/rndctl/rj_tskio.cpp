@@ -516,6 +516,12 @@ int daemon_alive(const char* host) {
 
 bool on_this_host(const Dev* dev) { return rj_dev_is_this_host(dev); }
 
+// States in which the job's group leaves the task file.
+bool job_is_over(const Job* job) {
+  const Text& state = job->status;
+  return state.is("aborted") || state.is("failed") || state.is("finished") || state.is("restarted");
+}
+
 void status_file_path(char* out, size_t size, const char* host) {
   snprintf(out, size, "%s/TSKSTAT/%s", rndctl.location.or_else("."), host);
 }
@@ -868,13 +874,11 @@ void Task_file_update(Job* job) {
     dbgpnt("\"%s\" -> %s\n", g->job->name.or_else("(null)"), g->job->status.or_else("(null)"));
     if (job != nullptr && g->job == job) {
       job_seen = true;
-      const Text& state = job->status;
       if (Task_group_rebuilt(job, g)) {
         // Built again since this host last looked: nothing this host holds
         // belongs to it, not even the end of the job it knew.
         Task_mark_rebuilt(job);
-      } else if (state.is("aborted") || state.is("failed") || state.is("finished") ||
-                 state.is("restarted")) {
+      } else if (job_is_over(job)) {
         dbgpnt("free up task info\n");
         while (g->tasks != nullptr) TaskRec_freeOnly(g->tasks);
         TaskGroup_free(&groups, g);
@@ -896,8 +900,12 @@ void Task_file_update(Job* job) {
     }
     g = next;
   }
-  // The group left the file while this host still holds entries of it.
-  if (job != nullptr && !job_seen && Task_group_rebuilt(job, nullptr)) Task_mark_rebuilt(job);
+  // The group left the file while this host still holds entries of a job it
+  // thinks under way: the group was cleared behind its back (a restart it
+  // did not see).  A job over in this host's eyes dropped it itself.
+  if (job != nullptr && !job_seen && !job_is_over(job) && Task_group_rebuilt(job, nullptr)) {
+    Task_mark_rebuilt(job);
+  }
   rewind_fileop(FILE_TASKS);
   Task_write(fp, groups);
   close_and_truncate_fileop(FILE_TASKS);

@@ -5,11 +5,13 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdlib>
 #include <filesystem>
 #include <string>
 
 #include "Shared/memory/MA_rtns.h"
+#include "tests/support/task_text.h"
 #include "tests/support/test_support.h"
 
 class TaskFixture : public ControlDirTest {
@@ -47,6 +49,26 @@ class TaskFixture : public ControlDirTest {
     TASK* entry = Task_add(job, rec);
     if (entry != nullptr) entry->taken = rj_dev_is_this_host(dev) ? 1 : 0;
     return entry;
+  }
+
+  /// Writes Render_Tasks as the entries made so far came from it: the
+  /// updates of this host find the groups they belong to.
+  void write_task_file() const {
+    std::string text;
+    for (Job* job = rndctl.jobs; job != nullptr; job = job->next) {
+      std::string recs;
+      int n = 0, next_id = 0;
+      for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
+        if (e->job != job || e->rec == nullptr) continue;
+        const TaskRec* r = e->rec;
+        recs += rec_line(r->id, r->start, r->end, r->current, r->dev != nullptr ? r->dev->index : 0,
+                         r->retries, GetTaskStatusStr(r->status));
+        ++n;
+        next_id = std::max(next_id, r->id + 1);
+      }
+      if (n != 0) text += group_line(job->name.c_str(), job->index, n, next_id) + recs;
+    }
+    write_file("Render_Tasks", text);
   }
 
   /// Waits for `pid` and returns its raw wait status.
