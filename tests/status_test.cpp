@@ -212,6 +212,36 @@ INSTANTIATE_TEST_SUITE_P(
                     EndCase{"killed_fails_keeping_saved_output", 9, 1, TASK_FAILED, true}),
     label_of);
 
+TEST_F(StatusTest, OnlyARenderThisDaemonStartedIsJudged) {
+  // Made from the file: a record of this host that an earlier daemon ran.
+  TASK* entry = entry_with_stream(1, 10);
+  entry->taken = 0;
+  entry->pid = 0;
+  entry->waitstatus = 0;
+  write_task_file();
+  UpdateRunningTasks();
+  EXPECT_EQ(entry->rec->status, TASK_RUNNING);
+  EXPECT_NE(read_file("Render_Tasks").find("RUNNING"), std::string::npos);
+}
+
+TEST_F(StatusTest, RenderOfADeletedJobIsKilledAndEndedOnceReaped) {
+  TASK* entry = entry_with_stream(1, 10);
+  write_file("out", "rendering\n");
+  entry->out_path.set(path("out").c_str());
+  give_sleeper(entry);
+  int pid = entry->pid;
+  entry->job = nullptr;  // the reload found the job gone
+  UpdateRunningTasks();
+  expect_killed(pid);
+  ASSERT_EQ(rndctl.tasks, entry);  // still there until reaped
+  entry->pid = 0;                  // as the reaping side leaves it
+  UpdateRunningTasks();
+  EXPECT_EQ(rndctl.tasks, nullptr);
+  EXPECT_FALSE(exists(path("stream")));
+  EXPECT_FALSE(exists(path("out")));
+  EXPECT_EQ(read_file("TSKSTAT/testhost"), "");
+}
+
 TEST_F(StatusTest, FailedTaskOfThisHostsJobEndsInTheJobFileWithItsError) {
   // The resource is named after the host, as the reload matches them.
   Dev* host_dev = Dev_new(nullptr, nullptr, "testhost", 3);
