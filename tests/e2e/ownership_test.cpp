@@ -131,7 +131,22 @@ TEST_F(Ownership, RestartWhileAHostIsStoppedRendersEveryFrameAgain) {
       << da.log() << db.log();
 
   // hostA misses the whole restart window.
-  ASSERT_EQ(kill(da.daemon_pid(), SIGSTOP), 0);
+  // Stopped while it holds no lock: a stopped holder would keep the editor
+  // (and hostB) waiting until the lock counts as stale.
+  auto any_lock = [&] {
+    for (const char* f : {"Render_Tasks", "Render_Job_Control", "Render_Resource_Control"}) {
+      if (access(farm_.path(std::string(f) + ".lock").c_str(), F_OK) == 0) return true;
+    }
+    return false;
+  };
+  ASSERT_TRUE(wait_for(
+      [&] {
+        kill(da.daemon_pid(), SIGSTOP);
+        if (!any_lock()) return true;
+        kill(da.daemon_pid(), SIGCONT);
+        return false;
+      },
+      60));
   const size_t restart_at = farm_.read("renders.log").size();
   // A daemon that writes its own view of the job back before it has read
   // the edit undoes it; the editor says it again until hostB has stopped.
