@@ -313,6 +313,65 @@ TEST_F(SelectTest, EntriesFollowTheFileAndThisHostKeepsItsOwnStatus) {
   EXPECT_EQ(rndctl.tasks, nullptr);
 }
 
+// This host took 1..3 (id 0) and renders it; meanwhile the file changed
+// under it.  The next selection writes the record only while it is still
+// this host's, and never takes a record of a rebuilt group for its own.
+struct OwnerCase {
+  const char* label;
+  std::string file;  // the group as another host or an editor left it
+  int status;        // of the entry of id 0 afterwards
+  bool kept;         // the entry is still this daemon's piece
+  int entries;
+  std::string after;  // the file afterwards ("": unchanged)
+};
+
+class Owner : public SelectTest, public testing::WithParamInterface<OwnerCase> {};
+
+TEST_P(Owner, NextSelectionWritesOnlyWhatThisHostStillOwns) {
+  const OwnerCase& c = GetParam();
+  Job* job = make_job(1, "scene.sdl", 1, {here_, there_});
+  TASK* mine = Task_get();
+  ASSERT_TRUE(mine != nullptr && mine->rec->id == 0 && mine->taken);
+  mine->rec->status = TASK_RUNNING;
+  rndctl.running = 1;  // a job of priority 1 is not started now: nothing new is picked
+  write_file("Render_Tasks", c.file);
+  EXPECT_EQ(Task_get(), nullptr);
+  EXPECT_EQ(tasks(), c.after.empty() ? c.file : c.after);
+  EXPECT_EQ(count_entries(), c.entries);
+  TASK* e = entry_of(job, 0);
+  ASSERT_NE(e, nullptr);
+  EXPECT_EQ(e->rec->status, c.status);
+  EXPECT_EQ(e->taken != 0, c.kept);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Owners, Owner,
+    testing::Values(OwnerCase{"still_ours",
+                              scene(2, rec_line(0, 1, 3, 1, 1, 0, "STARTED") +
+                                           rec_line(1, 4, 10, 4, 0, 0, "PENDING")),
+                              TASK_RUNNING, true, 2,
+                              scene(2, rec_line(0, 1, 3, 1, 1, 0, "RUNNING") +
+                                           rec_line(1, 4, 10, 4, 0, 0, "PENDING"))},
+                    OwnerCase{"put_back",
+                              scene(2, rec_line(0, 1, 3, 1, 1, 0, "PENDING") +
+                                           rec_line(1, 4, 10, 4, 0, 0, "PENDING")),
+                              TASK_PENDING, false, 2, ""},
+                    OwnerCase{"taken_by_another_host",
+                              scene(2, rec_line(0, 1, 3, 1, 2, 0, "RUNNING") +
+                                           rec_line(1, 4, 10, 4, 0, 0, "PENDING")),
+                              TASK_RUNNING, false, 2, ""},
+                    OwnerCase{"rebuilt_from_id_0", scene(1, rec_line(0, 1, 10, 1, 0, 0, "PENDING")),
+                              TASK_PENDING, false, 1, ""},
+                    OwnerCase{"lost_elsewhere_and_left_by_an_earlier_daemon",
+                              scene(3, rec_line(0, 1, 3, 1, 2, 0, "FINISHED") +
+                                           rec_line(1, 4, 6, 4, 1, 0, "RUNNING") +
+                                           rec_line(2, 7, 10, 7, 0, 0, "PENDING")),
+                              TASK_FINISHED, false, 3,
+                              scene(3, rec_line(0, 1, 3, 1, 2, 0, "FINISHED") +
+                                           rec_line(1, 4, 6, 4, 1, 0, "PENDING") +
+                                           rec_line(2, 7, 10, 7, 0, 0, "PENDING"))}),
+    Label());
+
 // --- The service loop's call -------------------------------------------------------
 
 TEST_F(SelectTest, LockedHostPicksNothingAndSleepsUntilTheLockEnds) {

@@ -20,6 +20,12 @@ constexpr auto label_of = [](const auto& info) { return std::string(info.param.l
 
 class StatusTest : public TaskFixture {
  protected:
+  void SetUp() override {
+    TaskFixture::SetUp();
+    // The tests reap their own render stand-ins; a handler that an earlier
+    // test left in place must not take them first.
+    signal(SIGCHLD, SIG_DFL);
+  }
   /// An entry whose stream reads the file "stream" of the control directory.
   TASK* entry_with_stream(float start, float end) {
     TASK* entry = add_entry(job_, dev_, start, end, TASK_RUNNING);
@@ -140,6 +146,7 @@ TEST_F(StatusTest, StartedTaskTurnsRunningOnlyOnItsOwnHost) {
   TASK* theirs = add_entry(job_, other_host(), 4, 6, TASK_STARTED, 1);
   TASK* waiting = add_entry(job_, dev_, 7, 9, TASK_STARTED, 2);
   mine->pid = 4242;  // any pid of 2 or more counts as a process
+  write_task_file();
   TaskRec* recs[3] = {mine->rec, theirs->rec, waiting->rec};
   EXPECT_EQ(ISA_task_running(theirs), 1);
   EXPECT_EQ(ISA_task_running(waiting), 0);
@@ -158,6 +165,7 @@ TEST_F(StatusTest, AbortedJobStopsThisHostsTasksAndOthersPendingOnes) {
   TASK* started = add_entry(job_, other, 7, 9, TASK_STARTED, 2);
   give_sleeper(running);
   int pid = running->pid;
+  write_task_file();
   TaskRec* recs[3] = {running->rec, pending->rec, started->rec};
   EXPECT_EQ(UpdateRunningTasks(), 1);  // the other host's STARTED task
   expect_killed(pid);
@@ -185,6 +193,7 @@ TEST_P(EndOfProcess, ExitValueDecidesAndOutputGoesUnlessKept) {
   entry->rec->current = 4;
   entry->pid = 0;  // reaped
   entry->waitstatus = c.waitstatus;
+  write_task_file();
   TaskRec* rec = entry->rec;
 
   EXPECT_EQ(UpdateRunningTasks(), 0);
@@ -203,6 +212,36 @@ INSTANTIATE_TEST_SUITE_P(
                     EndCase{"killed_fails_keeping_saved_output", 9, 1, TASK_FAILED, true}),
     label_of);
 
+TEST_F(StatusTest, OnlyARenderThisDaemonStartedIsJudged) {
+  // Made from the file: a record of this host that an earlier daemon ran.
+  TASK* entry = entry_with_stream(1, 10);
+  entry->taken = 0;
+  entry->pid = 0;
+  entry->waitstatus = 0;
+  write_task_file();
+  UpdateRunningTasks();
+  EXPECT_EQ(entry->rec->status, TASK_RUNNING);
+  EXPECT_NE(read_file("Render_Tasks").find("RUNNING"), std::string::npos);
+}
+
+TEST_F(StatusTest, RenderOfADeletedJobIsKilledAndEndedOnceReaped) {
+  TASK* entry = entry_with_stream(1, 10);
+  write_file("out", "rendering\n");
+  entry->out_path.set(path("out").c_str());
+  give_sleeper(entry);
+  int pid = entry->pid;
+  entry->job = nullptr;  // the reload found the job gone
+  UpdateRunningTasks();
+  expect_killed(pid);
+  ASSERT_EQ(rndctl.tasks, entry);  // still there until reaped
+  entry->pid = 0;                  // as the reaping side leaves it
+  UpdateRunningTasks();
+  EXPECT_EQ(rndctl.tasks, nullptr);
+  EXPECT_FALSE(exists(path("stream")));
+  EXPECT_FALSE(exists(path("out")));
+  EXPECT_EQ(read_file("TSKSTAT/testhost"), "");
+}
+
 TEST_F(StatusTest, FailedTaskOfThisHostsJobEndsInTheJobFileWithItsError) {
   // The resource is named after the host, as the reload matches them.
   Dev* host_dev = Dev_new(nullptr, nullptr, "testhost", 3);
@@ -215,6 +254,7 @@ TEST_F(StatusTest, FailedTaskOfThisHostsJobEndsInTheJobFileWithItsError) {
   write_file("out", "loading scene\nshader did not build\nexiting\n");
   entry->out_path.set(path("out").c_str());
   entry->waitstatus = 1;
+  write_task_file();
 
   EXPECT_EQ(UpdateRunningTasks(), 0);
   Job* job = Job_by_index(1);

@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <cmath>
+#include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -194,23 +195,68 @@ TEST_F(TaskFileTest, FileUpdateDropsTheGroupOfAJobThatIsOver) {
   }
 }
 
-TEST_F(TaskFileTest, FileUpdateTakesThisHostsProgressFromItsEntries) {
-  write_file("Render_Tasks", group_line("alpha.sdl", 1, 4, 4) +
-                                 rec_line(0, 1, 3, 1, 1, 0, "STARTED") +   // here: follows entry
-                                 rec_line(1, 4, 6, 4, 2, 0, "RUNNING") +   // other host
-                                 rec_line(2, 7, 8, 7, 1, 0, "PENDING") +   // pending: left alone
-                                 rec_line(3, 9, 10, 9, 1, 0, "RUNNING"));  // no entry
+// One record in the file, this host's entry of id 0 (frames 4..6, RUNNING,
+// at frame 5) holding a live render: what the next update writes and what
+// becomes of the entry and its render.
+struct OwnCase {
+  const char* label;
+  float file_start;  // 4: the same task; anything else: a group built again
+  int file_dev;      // 1: this host, 2: another host
+  const char* file_status;
+  bool taken;           // this daemon took the piece (else the entry was made from the file)
+  const char* written;  // status in the file afterwards
+  float written_current;
+  int entry_status;  // the entry's status afterwards
+  bool killed;       // its render was killed
+};
+
+class FileUpdateOwnership : public TaskFileTest, public testing::WithParamInterface<OwnCase> {};
+
+TEST_P(FileUpdateOwnership, WritesOnlyWhatThisHostStillOwns) {
+  const OwnCase& c = GetParam();
+  const std::string other = group_line("beta.sdl", 2, 1, 1) + rec_line(0, 4, 6, 4, 1, 0, "STARTED");
+  write_file("Render_Tasks", other + group_line("alpha.sdl", 1, 1, 1) +
+                                 rec_line(0, c.file_start, 6, 4, c.file_dev, 0, c.file_status));
   alpha_->status.set("started");
-  for (int id = 0; id < 3; ++id) {
-    entry(alpha_, id, id == 1 ? there_ : here_, TASK_RUNNING)->rec->current = 50.0f + id;
+  TASK* e = Task_add(alpha_, TaskRec_alloc(nullptr, 4, 6, 5, here_, TASK_RUNNING, nullptr, 0));
+  e->taken = c.taken ? 1 : 0;
+  int child = fork();
+  if (child == 0) {
+    setpgid(0, 0);
+    pause();
+    _exit(0);
   }
-  entry(beta_, 3, here_, TASK_FINISHED);  // same id, other job
+  e->pid = child;
   Task_file_update(alpha_);
   EXPECT_EQ(read_file("Render_Tasks"),
-            group_line("alpha.sdl", 1, 4, 4) + rec_line(0, 1, 3, 50, 1, 0, "RUNNING") +
-                rec_line(1, 4, 6, 4, 2, 0, "RUNNING") + rec_line(2, 7, 8, 7, 1, 0, "PENDING") +
-                rec_line(3, 9, 10, 9, 1, 0, "RUNNING"));
+            group_line("alpha.sdl", 1, 1, 1) +
+                rec_line(0, c.file_start, 6, c.written_current, c.file_dev, 0, c.written) +
+                other);  // another job's record of the same id is not touched
+  EXPECT_EQ(e->rec->status, c.entry_status);
+  if (!c.killed) kill(child, SIGKILL);
+  int status = 0;
+  ASSERT_EQ(waitpid(child, &status, 0), child);
+  EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL);
+  if (c.killed) {
+    EXPECT_EQ(e->pid, 0);
+  }
+  e->pid = 0;
+  // Entries of a group built again are dropped at the next safe point.
+  EXPECT_EQ(Task_retire_marked() != 0, c.file_start != 4.0f);
 }
+
+INSTANTIATE_TEST_SUITE_P(Owners, FileUpdateOwnership,
+                         testing::Values(OwnCase{"ours_follows_the_entry", 4, 1, "STARTED", true,
+                                                 "RUNNING", 5, TASK_RUNNING, false},
+                                         OwnCase{"put_back_is_left_and_lost", 4, 1, "PENDING", true,
+                                                 "PENDING", 4, TASK_PENDING, true},
+                                         OwnCase{"taken_by_another_host", 4, 2, "RUNNING", true,
+                                                 "RUNNING", 4, TASK_RUNNING, true},
+                                         OwnCase{"left_by_an_earlier_daemon", 4, 1, "RUNNING",
+                                                 false, "RUNNING", 4, TASK_RUNNING, false},
+                                         OwnCase{"rebuilt_group_same_id", 1, 1, "STARTED", true,
+                                                 "STARTED", 4, TASK_RUNNING, false}),
+                         [](const auto& info) { return std::string(info.param.label); });
 
 // 0: no pid file, 1: the pid of this live process, 2: the pid of one that ended.
 class DaemonAlive : public TaskFileTest, public testing::WithParamInterface<int> {};

@@ -194,6 +194,18 @@ class EntryIndex {
   /// A new entry of the selected job.
   void add(TASK* e) { entries_->push_back(e); }
 
+  /// The entries of the selected job (new ones included).
+  const std::vector<TASK*>& selected() const { return *entries_; }
+
+  /// Every job that has entries (the null job of entries whose job left
+  /// the file included).
+  template <class F>
+  void for_each_job(F f) const {
+    for (const auto& [job, entries] : by_job_) {
+      if (!entries.empty()) f(job);
+    }
+  }
+
  private:
   std::unordered_map<const Job*, std::vector<TASK*>> by_job_;
   std::vector<TASK*>* entries_ = nullptr;
@@ -202,6 +214,43 @@ class EntryIndex {
   std::vector<TASK*> table_;
   std::vector<TASK*> sorted_;
 };
+
+bool held_status(int status) {
+  return status == TASK_STARTED || status == TASK_RUNNING || status == TASK_FAILED;
+}
+
+// Drops every entry of a job whose group in the file is of another life than
+// the one this host knew: the group vanished, its next id went below what
+// was seen here, or an id of it names another start frame.  Otherwise a
+// group built again from id 0 would be taken for the old one, id by id.
+void retire_other_lives(TaskGroup* groups, TaskAfterLock* after) {
+  std::unordered_map<const Job*, const TaskGroup*> in_file;
+  for (const TaskGroup* g = groups; g != nullptr; g = g->next) in_file.emplace(g->job, g);
+  std::vector<const Job*> gone;
+  {
+    EntryIndex index;
+    index.for_each_job([&](const Job* job) {
+      if (job == nullptr) return;  // its job left the file: UpdateRunningTasks ends those
+      auto it = in_file.find(job);
+      const TaskGroup* g = it != in_file.end() ? it->second : nullptr;
+      index.select(job);
+      int seen = 0;
+      for (const TASK* e : index.selected()) seen = std::max(seen, e->seen_next_id);
+      if (g == nullptr || g->next_task_id < seen) {
+        gone.push_back(job);
+        return;
+      }
+      for (const TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
+        TASK* e = index.find(rec->id);
+        if (e != nullptr && !Task_same_rec(e->rec, rec)) {
+          gone.push_back(job);
+          return;
+        }
+      }
+    });
+  }
+  for (const Job* job : gone) Task_retire_job(job, after);
+}
 
 }  // namespace
 
@@ -278,6 +327,7 @@ TASK* GetaPendingTask() {
 TASK* Get_a_task() { return Task_get(); }
 
 TASK* Task_get() {
+  Task_retire_marked();
   const char* host = rndctl.host.c_str();
   lock_fileop(FILE_TASKS, 1);
   FILE* fp = update_fileop(FILE_TASKS);
@@ -289,13 +339,20 @@ TASK* Task_get() {
   // those that keep it have left the file.
   for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) e->stale = 1;
   TaskGroup* groups = Task_read(fp);
+  TaskAfterLock after;
+  retire_other_lives(groups, &after);
 
   insert_unknown_pending_jobs(&groups);
 
   TASK* chosen = nullptr;
   if (TaskRec* rec = extract_pending_task(&groups)) {
-    split_a_task(rec->group, rec);
     chosen = match_a_taskrec(rec);
+    // The record is PENDING in the file: an entry here that still held it
+    // lost it, and its render stops before the piece is taken again.
+    if (chosen != nullptr && chosen->rec != rec) Task_settle(chosen, rec, &after);
+    const int ids_before = rec->group->next_task_id;
+    split_a_task(rec->group, rec);
+    if (rec->group->next_task_id != ids_before) after.wake(rec->group->job);
     if (chosen == nullptr) {
       chosen = Task_add(rec->group->job, rec);
     } else if (chosen->rec != rec) {
@@ -310,6 +367,7 @@ TASK* Task_get() {
     if (chosen != nullptr) {
       chosen->rec->status = TASK_STARTED;
       chosen->stale = 0;
+      chosen->taken = 1;
     }
   }
 
@@ -321,33 +379,39 @@ TASK* Task_get() {
     index.select(job);
     for (TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
       TASK* e = index.find(rec->id);
+      if (e != nullptr && !Task_same_rec(e->rec, rec)) e = nullptr;
       if (e == nullptr) {
         e = Task_add(job, rec);  // the entry owns the record from now on
         if (e != nullptr) index.add(e);
-        continue;
-      }
-      TaskRec* own = e->rec;
-      if (uses_host && own != rec) {
+      } else if (e->rec != rec && uses_host) {
+        TaskRec* own = e->rec;
         own->start = rec->start;
         own->end = rec->end;
         own->retries = rec->retries;
         own->current = rec->current;
         if (rec->dev != nullptr) own->dev = rec->dev;
-        // This host knows best what its own tasks are doing; for the others
-        // the file is the news.
-        if (dev_on_this_host(own->dev)) {
-          rec->status = own->status;
+        // This host knows best what its own tasks are doing, while they are
+        // its own; for the others the file is the news.
+        if (Task_settle(e, rec, &after) != 0) {
           dbgpnt("Task_get: use old status %d\n", own->status);
         } else {
           own->status = rec->status;
         }
       }
-      if (own != rec) {
+      if (e != nullptr && !e->taken && rj_dev_is_this_host(rec->dev) && held_status(rec->status)) {
+        // Names this host as its renderer, but no daemon here took it: an
+        // earlier daemon of this host did and ended.  Nobody renders it.
+        rec->status = TASK_PENDING;
+        if (e->rec != nullptr) e->rec->status = TASK_PENDING;
+        after.wake(job);
+      }
+      if (e != nullptr && e->rec != rec) {
         if (uses_host) dbgpnt("extra task_rec %x, setting dead state\n", px(rec));
         rec->keep = 1;
       }
-      e->stale = 0;
+      if (e != nullptr) e->stale = 0;
     }
+    for (TASK* e : index.selected()) e->seen_next_id = std::max(e->seen_next_id, g->next_task_id);
   }
 
   rewind_fileop(FILE_TASKS);
@@ -355,13 +419,18 @@ TASK* Task_get() {
   close_and_truncate_fileop(FILE_TASKS);
   lock_fileop(FILE_TASKS, 0);
   TaskGroup_free_all(&groups);
+  after.run();
 
   TASK* e = rndctl.tasks;
   while (e != nullptr) {
     TASK* next = e->next;
-    if (e->stale) {
+    // A render whose job left the file is ended by UpdateRunningTasks once
+    // it is reaped; any other entry without a record in the file goes, and
+    // a render of it with it.
+    if (e->stale && !(e->job == nullptr && e->pid >= 2)) {
       dbgpnt("freeing Task %x\n", px(e));
       if (e == chosen) chosen = nullptr;
+      Task_let_go(e, nullptr);
       TASK_free(e);
     }
     e = next;
@@ -519,7 +588,7 @@ TASK* match_a_taskrec(TaskRec* rec) {
   if (rec == nullptr || rec->group == nullptr) return nullptr;
   const Job* job = rec->group->job;
   for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
-    if (e->job == job && e->rec != nullptr && e->rec->id == rec->id) return e;
+    if (e->job == job && Task_same_rec(e->rec, rec)) return e;
   }
   return nullptr;
 }
@@ -564,16 +633,22 @@ void split_a_task(TaskGroup* group, TaskRec* rec) {
 }
 
 TaskRec* Split_first_splittable_failed_tasks() {
-  for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
-    if (e->rec == nullptr || e->rec->status != TASK_FAILED) continue;
+  // Only a failure of this daemon's own render is this host's to put back.
+  TASK* next = nullptr;
+  for (TASK* e = rndctl.tasks; e != nullptr; e = next) {
+    next = e->next;
+    if (e->rec == nullptr || e->rec->status != TASK_FAILED || !e->taken) continue;
+    if (e->rec->retries >= kMaxRetries) continue;  // stays FAILED: nothing to write
     if (TaskRec* r = Task_split_and_insert(e->rec)) return r;
   }
+  Task_retire_marked();
   return nullptr;
 }
 
 TaskRec* Task_split_and_insert(TaskRec* rec) {
   if (rec == nullptr || rec->task == nullptr || rec->task->job == nullptr) return nullptr;
-  Job* job = rec->task->job;
+  TASK* entry = rec->task;
+  Job* job = entry->job;
   dbgpnt("Task_split_and_insert===========================%d\n", rec->id);
   lock_fileop(FILE_TASKS, 1);
   FILE* fp = update_fileop(FILE_TASKS);
@@ -583,7 +658,18 @@ TaskRec* Task_split_and_insert(TaskRec* rec) {
   }
   TaskGroup* groups = Task_read(fp);
   TaskGroup* group = TaskGroup_by_job(groups, job);
-  if (group != nullptr && rec->retries < kMaxRetries) {
+  TaskAfterLock after;
+  TaskRec* f = nullptr;
+  if (Task_group_rebuilt(job, group)) {
+    Task_mark_rebuilt(job);
+  } else if (group != nullptr) {
+    for (f = group->tasks; f != nullptr && (f == rec || !Task_same_rec(rec, f)); f = f->next) {
+    }
+  }
+  if (f != nullptr && !Task_owns(entry, f)) {
+    // Put back or taken by another host meanwhile: not this host's any more.
+    Task_settle(entry, f, &after);
+  } else if (f != nullptr && rec->retries < kMaxRetries) {
     int n = rec->retries++;
     if (rec->start < rec->current) {
       // Frames up to the one it reached are done; the rest starts afresh.
@@ -599,21 +685,21 @@ TaskRec* Task_split_and_insert(TaskRec* rec) {
     } else {
       rec->status = TASK_PENDING;
     }
-    for (TaskRec* f = group->tasks; f != nullptr; f = f->next) {
-      if (f->id != rec->id || f == rec) continue;
-      f->status = rec->status;
-      f->start = rec->start;
-      f->end = rec->end;
-      f->current = rec->current;
-      f->retries = rec->retries;
-      break;
-    }
+    f->status = rec->status;
+    f->start = rec->start;
+    f->end = rec->end;
+    f->current = rec->current;
+    f->retries = rec->retries;
+    entry->taken = 0;  // given back
+    Task_note_group(job, group);
+    after.wake(job);
   }
   rewind_fileop(FILE_TASKS);
   Task_write(fp, groups);
   close_and_truncate_fileop(FILE_TASKS);
   lock_fileop(FILE_TASKS, 0);
   TaskGroup_free_all(&groups);
+  after.run();
   dbgpnt("done ================= Task_split_and_insert\n");
   return nullptr;
 }

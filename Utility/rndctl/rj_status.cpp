@@ -19,9 +19,7 @@ const char* status_name(int code) {
   return task_status_table[code];
 }
 
-bool runs_here(const TaskRec* rec) {
-  return rec != nullptr && rj_dev_is_this_host(rec->dev);
-}
+bool runs_here(const TaskRec* rec) { return rec != nullptr && rj_dev_is_this_host(rec->dev); }
 
 bool job_uses_this_host(const Job* job) {
   if (!rndctl.host) return false;
@@ -221,6 +219,18 @@ int UpdateRunningTasks() {
     Job* job = entry->job;
     if (job == nullptr) {
       dbgpnt("Crash Alert - task->job is NULL\n");
+      // Its job left the job file.  A render of it still running here is
+      // killed; once it is reaped nothing of the job is left behind.
+      if (entry->pid >= 2) {
+        if (!entry->killed) {
+          rj_kill_render(rndctl.host.c_str(), entry->pid, 9);
+          entry->killed = 1;
+        }
+        continue;
+      }
+      Task_let_go(entry, nullptr);
+      TASK_free(entry);
+      changed = true;
       continue;
     }
     if (rec == nullptr) continue;
@@ -232,7 +242,9 @@ int UpdateRunningTasks() {
 
     const bool stopping = job->status.is("restarted") || job->status.is("aborted");
     if (stopping && (here || s == TASK_PENDING)) status = TASK_ABORTED;
-    if (s == TASK_RUNNING && here) {
+    // Only a render this daemon started and reaped is judged: an entry made
+    // from the file (a record of an earlier daemon here) ended nothing.
+    if (s == TASK_RUNNING && here && entry->taken) {
       // A process that has already ended is judged even in a stopping job:
       // its output file goes and its failure is recorded; the next pass
       // turns the task ABORTED.
@@ -263,6 +275,9 @@ int UpdateRunningTasks() {
     if (status == TASK_STARTED || status == TASK_RUNNING) result = 1;
   }
 
+  // Entries of a group found rebuilt while the list was walked go now,
+  // before they count towards any job's state.
+  if (Task_retire_marked() != 0) changed = true;
   for (Job* job = rndctl.jobs; job != nullptr; job = job->next) {
     if (job_uses_this_host(job)) UpdateJobState(job);
   }

@@ -1,8 +1,14 @@
 // The running-task list: one entry per task record of Render_Tasks that this
 // process knows about, linking the record to the render process (if any)
 // that works on it here.
+#include <unistd.h>
+
+#include <algorithm>
+#include <cmath>
 #include <cstdint>
 #include <cstdio>
+#include <unordered_map>
+#include <vector>
 
 #include "Shared/memory/MA_rtns.h"
 #include "Utility/rndctl/rndctl.h"
@@ -34,7 +40,156 @@ TASK* list_tail() {
   return t;
 }
 
+bool owned_status(int status) {
+  return status == TASK_STARTED || status == TASK_RUNNING || status == TASK_FAILED;
+}
+
+void kill_here(int pid) { rj_kill_render(rndctl.host.c_str(), pid, 9); }
+
 }  // namespace
+
+bool Task_owns(const TASK* entry, const TaskRec* file_rec) {
+  return entry != nullptr && entry->taken && !entry->killed && file_rec != nullptr &&
+         rj_dev_is_this_host(file_rec->dev) && owned_status(file_rec->status);
+}
+
+bool Task_same_rec(const TaskRec* own, const TaskRec* file_rec) {
+  if (own == nullptr || file_rec == nullptr || own->id != file_rec->id) return false;
+  // Frames go through the file with six decimals: a start computed here
+  // comes back within rounding of that print.
+  double a = own->start, b = file_rec->start;
+  return std::fabs(a - b) <= 2e-6 + 1e-7 * std::fabs(a);
+}
+
+void TaskAfterLock::kill(int pid) {
+  if (pid >= 2) kills.push_back(pid);
+}
+
+void TaskAfterLock::wake(Job* job) {
+  if (job != nullptr && std::find(wakes.begin(), wakes.end(), job) == wakes.end()) {
+    wakes.push_back(job);
+  }
+}
+
+void TaskAfterLock::run() {
+  for (int pid : kills) kill_here(pid);
+  kills.clear();
+  for (Job* job : wakes) Job_wake_other_hosts(job);
+  wakes.clear();
+}
+
+void Task_let_go(TASK* entry, TaskAfterLock* after) {
+  if (entry == nullptr) return;
+  if (entry->pid >= 2) {
+    if (after != nullptr) {
+      after->kill(entry->pid);
+    } else {
+      kill_here(entry->pid);
+    }
+  }
+  entry->pid = 0;
+  entry->taken = 0;
+  if (entry->stream != nullptr) {
+    fclose(entry->stream);
+    entry->stream = nullptr;
+  }
+  if (entry->stream_path) {
+    unlink(entry->stream_path.c_str());
+    entry->stream_path.reset();
+  }
+  if (entry->out_path) {
+    if (entry->job == nullptr || entry->job->save_out == 0) unlink(entry->out_path.c_str());
+    entry->out_path.reset();
+  }
+  entry->output.reset();
+}
+
+int Task_settle(TASK* entry, TaskRec* file_rec, TaskAfterLock* after) {
+  if (entry == nullptr || entry->rec == nullptr || file_rec == nullptr) return 0;
+  TaskRec* own = entry->rec;
+  if (Task_owns(entry, file_rec)) {
+    file_rec->status = own->status;
+    return 1;
+  }
+  if (own == file_rec || !entry->taken || !owned_status(own->status)) return 0;
+  // The piece was put back or taken by another host while this one was
+  // slow: its render here stops, and whatever it did is not reported.
+  Task_let_go(entry, after);
+  own->status = file_rec->status;
+  own->start = file_rec->start;
+  own->end = file_rec->end;
+  own->current = file_rec->current;
+  own->retries = file_rec->retries;
+  own->dev = file_rec->dev;
+  if (file_rec->status == TASK_PENDING && after != nullptr) after->wake(entry->job);
+  return 0;
+}
+
+int Task_seen_next_id(const Job* job) {
+  int seen = 0;
+  for (const TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
+    if (e->job == job && job != nullptr) seen = std::max(seen, e->seen_next_id);
+  }
+  return seen;
+}
+
+void Task_note_group(const Job* job, const TaskGroup* group) {
+  if (job == nullptr || group == nullptr) return;
+  for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
+    if (e->job == job) e->seen_next_id = std::max(e->seen_next_id, group->next_task_id);
+  }
+}
+
+bool Task_group_rebuilt(const Job* job, const TaskGroup* group) {
+  if (job == nullptr) return false;
+  std::unordered_map<int, const TaskRec*> ids;
+  int seen = 0;
+  for (const TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
+    if (e->job != job || e->rec == nullptr) continue;
+    ids.emplace(e->rec->id, e->rec);
+    seen = std::max(seen, e->seen_next_id);
+  }
+  if (ids.empty()) return false;  // nothing here that could belong to another life
+  if (group == nullptr || group->next_task_id < seen) return true;
+  for (const TaskRec* rec = group->tasks; rec != nullptr; rec = rec->next) {
+    auto it = ids.find(rec->id);
+    if (it != ids.end() && !Task_same_rec(it->second, rec)) return true;
+  }
+  return false;
+}
+
+void Task_retire_job(const Job* job, TaskAfterLock* after) {
+  if (job == nullptr) return;
+  TASK* next = nullptr;
+  for (TASK* e = rndctl.tasks; e != nullptr; e = next) {
+    next = e->next;
+    if (e->job != job) continue;
+    dbgpnt("freeing Task %x\n", px(e));
+    Task_let_go(e, after);
+    TASK_free(e);
+  }
+}
+
+void Task_mark_rebuilt(const Job* job) {
+  if (job == nullptr) return;
+  for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
+    if (e->job == job) e->rebuilt = 1;
+  }
+}
+
+int Task_retire_marked() {
+  int dropped = 0;
+  TASK* next = nullptr;
+  for (TASK* e = rndctl.tasks; e != nullptr; e = next) {
+    next = e->next;
+    if (!e->rebuilt) continue;
+    dbgpnt("freeing Task %x\n", px(e));
+    Task_let_go(e, nullptr);
+    TASK_free(e);
+    ++dropped;
+  }
+  return dropped;
+}
 
 TASK* Task_add(Job* job, TaskRec* rec) {
   dbgpnt("Task_add to \"%s\" id = %d start = %f\t%s\n",

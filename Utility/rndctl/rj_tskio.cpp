@@ -25,6 +25,7 @@
 #include <cstring>
 #include <memory>
 #include <string>
+#include <unordered_map>
 #include <vector>
 
 #include "Shared/memory/MA_rtns.h"
@@ -519,9 +520,12 @@ int daemon_alive(const char* host) {
   return 0;
 }
 
-bool on_this_host(const Dev* dev) {
-  return dev != nullptr && dev->host_name.c_str() != nullptr && rndctl.host.c_str() != nullptr &&
-         strcmp(dev->host_name.c_str(), rndctl.host.c_str()) == 0;
+bool on_this_host(const Dev* dev) { return rj_dev_is_this_host(dev); }
+
+// States in which the job's group leaves the task file.
+bool job_is_over(const Job* job) {
+  const Text& state = job->status;
+  return state.is("aborted") || state.is("failed") || state.is("finished") || state.is("restarted");
 }
 
 void status_file_path(char* out, size_t size, const char* host) {
@@ -868,39 +872,52 @@ void Task_file_update(Job* job) {
     return;
   }
   TaskGroup* groups = Task_read(fp);
+  TaskAfterLock after;
+  bool job_seen = false;
   TaskGroup* g = groups;
   while (g != nullptr) {
     TaskGroup* next = g->next;
     dbgpnt("\"%s\" -> %s\n", g->job->name.or_else("(null)"), g->job->status.or_else("(null)"));
     if (job != nullptr && g->job == job) {
-      const Text& state = job->status;
-      if (state.is("aborted") || state.is("failed") || state.is("finished") ||
-          state.is("restarted")) {
+      job_seen = true;
+      if (Task_group_rebuilt(job, g)) {
+        // Built again since this host last looked: nothing this host holds
+        // belongs to it, not even the end of the job it knew.
+        Task_mark_rebuilt(job);
+      } else if (job_is_over(job)) {
         dbgpnt("free up task info\n");
         while (g->tasks != nullptr) TaskRec_freeOnly(g->tasks);
         TaskGroup_free(&groups, g);
       } else {
+        std::unordered_map<int, TASK*> mine;  // first entry of each id, as a list walk finds it
+        for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
+          if (e->job == job && e->rec != nullptr) mine.emplace(e->rec->id, e);
+        }
         for (TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
-          if (rec->status == TASK_PENDING || rec->status == TASK_FAILED) continue;
-          if (!on_this_host(rec->dev)) continue;
-          for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
-            if (e->job == job && e->rec != nullptr && e->rec->id == rec->id) {
-              rec->status = e->rec->status;
-              rec->current = e->rec->current;
-              dbgpnt("%d) %s %.2f\n", rec->id, GetTaskStatusStr(rec->status), rec->current);
-              break;
-            }
+          auto it = mine.find(rec->id);
+          if (it == mine.end() || !Task_same_rec(it->second->rec, rec)) continue;
+          TASK* e = it->second;
+          if (Task_settle(e, rec, &after) != 0) {
+            rec->current = e->rec->current;
+            dbgpnt("%d) %s %.2f\n", rec->id, GetTaskStatusStr(rec->status), rec->current);
           }
         }
       }
     }
     g = next;
   }
+  // The group left the file while this host still holds entries of a job it
+  // thinks under way: the group was cleared behind its back (a restart it
+  // did not see).  A job over in this host's eyes dropped it itself.
+  if (job != nullptr && !job_seen && !job_is_over(job) && Task_group_rebuilt(job, nullptr)) {
+    Task_mark_rebuilt(job);
+  }
   rewind_fileop(FILE_TASKS);
   Task_write(fp, groups);
   close_and_truncate_fileop(FILE_TASKS);
   lock_fileop(FILE_TASKS, 0);
   TaskGroup_free_all(&groups);
+  after.run();
   dbgpnt("Task_file_update-------------------------DONE\n");
 }
 
@@ -931,6 +948,7 @@ int Task_file_check(Job* job) {
   close_and_truncate_fileop(FILE_TASKS);
   lock_fileop(FILE_TASKS, 0);
   TaskGroup_free_all(&groups);
+  if (set_back) Job_wake_other_hosts(job);
   dbgpnt("Task_file_check-------------------------DONE\n");
   return set_back;
 }

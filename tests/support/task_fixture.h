@@ -5,11 +5,13 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdlib>
 #include <filesystem>
 #include <string>
 
 #include "Shared/memory/MA_rtns.h"
+#include "tests/support/task_text.h"
 #include "tests/support/test_support.h"
 
 class TaskFixture : public ControlDirTest {
@@ -35,6 +37,7 @@ class TaskFixture : public ControlDirTest {
   void mkdir_p(const std::string& rel) const { std::filesystem::create_directories(path(rel)); }
 
   /// A running-task entry of `job` for start..end on `dev`, in `status`.
+  /// An entry on this host stands for a piece this daemon took.
   TASK* add_entry(Job* job, Dev* dev, float start, float end, int status, int id = 0) {
     auto* rec = MA_new<TaskRec>(__LINE__, "tests/task_fixture");
     rec->start = start;
@@ -43,7 +46,29 @@ class TaskFixture : public ControlDirTest {
     rec->status = status;
     rec->id = id;
     rec->dev = dev;
-    return Task_add(job, rec);
+    TASK* entry = Task_add(job, rec);
+    if (entry != nullptr) entry->taken = rj_dev_is_this_host(dev) ? 1 : 0;
+    return entry;
+  }
+
+  /// Writes Render_Tasks as the entries made so far came from it: the
+  /// updates of this host find the groups they belong to.
+  void write_task_file() const {
+    std::string text;
+    for (Job* job = rndctl.jobs; job != nullptr; job = job->next) {
+      std::string recs;
+      int n = 0, next_id = 0;
+      for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
+        if (e->job != job || e->rec == nullptr) continue;
+        const TaskRec* r = e->rec;
+        recs += rec_line(r->id, r->start, r->end, r->current, r->dev != nullptr ? r->dev->index : 0,
+                         r->retries, GetTaskStatusStr(r->status));
+        ++n;
+        next_id = std::max(next_id, r->id + 1);
+      }
+      if (n != 0) text += group_line(job->name.c_str(), job->index, n, next_id) + recs;
+    }
+    write_file("Render_Tasks", text);
   }
 
   /// Waits for `pid` and returns its raw wait status.
