@@ -184,8 +184,8 @@ INSTANTIATE_TEST_SUITE_P(
         BusyLock{"OtherHost", "otherhost", "1\n", 181, "second timed out on \"otherhost\""},
         BusyLock{"EmptyHolderFile", "otherhost", "", 5, "abandoned without a holder pid"},
         BusyLock{"OwnHostNoPid", "testhost", "garbage\n", 5, "abandoned without a holder pid"},
-        // An empty directory is replaced by the rename that takes the lock.
-        BusyLock{"NoHolderFile", nullptr, "", 0, "Start of new process entries"}),
+        // An editor between its mkdir and its holder: respected for a while.
+        BusyLock{"NoHolderFile", nullptr, "", 5, "abandoned without a holder pid"}),
     [](const testing::TestParamInfo<BusyLock>& info) { return std::string(info.param.name); });
 
 TEST_F(FileopTest, BackoffStartsInMillisecondsGrowsAndNeverPausesOverFiveSeconds) {

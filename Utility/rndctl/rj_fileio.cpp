@@ -41,16 +41,19 @@ struct FdCloser {
   }
 };
 
-// The state behind an update stream.
+// The state behind an update stream.  The old contents are read whole at
+// the open and the file is closed at once: a file that this process still
+// holds open when the new one is renamed over it is not replaced in one
+// step by a network file system client (nor by a file system in user
+// space): the client first moves the open file aside under a hidden name,
+// and for that moment the file is not there for the other hosts.
 struct UpdateStream {
-  int old_fd = -1;  // the file as it was at the open (owned)
-  std::string out;  // the new contents, from the start of the file
-  int64_t pos = 0;  // the stream's position
+  std::string old;             // the file as it was at the open
+  struct stat old_st {};       // and its mode and owner then
+  std::string out;             // the new contents, from the start of the file
+  int64_t pos = 0;             // the stream's position
   bool written = false;
   bool rewound = false;  // rewound and written nothing: the new contents are empty
-  ~UpdateStream() {
-    if (old_fd >= 0) close(old_fd);
-  }
 };
 
 struct FileRecord {
@@ -92,32 +95,26 @@ ssize_t pread_full(int fd, char* buf, size_t size, int64_t at) {
 // Appends the old file's bytes [from, to) to `out`; past the old end, zeros
 // (what a write past the end of a file leaves between).
 bool append_old(const UpdateStream& u, std::string& out, int64_t from, int64_t to) {
-  char chunk[65536];
-  while (from < to) {
-    size_t want = static_cast<size_t>(to - from) < sizeof chunk ? static_cast<size_t>(to - from)
-                                                                : sizeof chunk;
-    ssize_t n = pread_full(u.old_fd, chunk, want, from);
-    if (n < 0) return false;
-    if (n == 0) {
-      out.append(static_cast<size_t>(to - from), '\0');
-      return true;
-    }
-    out.append(chunk, static_cast<size_t>(n));
-    from += n;
+  const int64_t have = static_cast<int64_t>(u.old.size());
+  if (from < have) {
+    int64_t upto = to < have ? to : have;
+    out.append(u.old, static_cast<size_t>(from), static_cast<size_t>(upto - from));
+    from = upto;
   }
+  if (from < to) out.append(static_cast<size_t>(to - from), '\0');
   return true;
 }
 
-int64_t old_size(const UpdateStream& u) {
-  struct stat st;
-  return fstat(u.old_fd, &st) == 0 ? static_cast<int64_t>(st.st_size) : 0;
-}
+int64_t old_size(const UpdateStream& u) { return static_cast<int64_t>(u.old.size()); }
 
 ssize_t update_read(void* cookie, char* buf, size_t size) {
   auto* u = static_cast<UpdateStream*>(cookie);
-  ssize_t n = pread_full(u->old_fd, buf, size, u->pos);
-  if (n > 0) u->pos += n;
-  return n;
+  const int64_t have = static_cast<int64_t>(u->old.size());
+  if (u->pos >= have) return 0;
+  size_t n = static_cast<size_t>(have - u->pos) < size ? static_cast<size_t>(have - u->pos) : size;
+  memcpy(buf, u->old.data() + u->pos, n);
+  u->pos += static_cast<int64_t>(n);
+  return static_cast<ssize_t>(n);
 }
 
 ssize_t update_write(void* cookie, const char* buf, size_t size) {
@@ -172,19 +169,6 @@ void report_write_failure(const char* path, int error) {
   dbgpnt("ERROR: failed to write %s: %s\n", path, strerror(error));
 }
 
-// Whether `data` equals the file behind `fd`, sizes first.
-bool same_contents(int fd, const struct stat& st, const std::string& data) {
-  if (static_cast<uint64_t>(st.st_size) != data.size()) return false;
-  char chunk[65536];
-  size_t at = 0;
-  while (at < data.size()) {
-    size_t want = data.size() - at < sizeof chunk ? data.size() - at : sizeof chunk;
-    ssize_t n = pread_full(fd, chunk, want, static_cast<int64_t>(at));
-    if (n != static_cast<ssize_t>(want) || memcmp(chunk, data.data() + at, want) != 0) return false;
-    at += want;
-  }
-  return true;
-}
 
 // Forces a directory entry change (a rename) to disk.  Failing that, the new
 // contents are in place but might not survive a crash of the file server;
@@ -199,12 +183,13 @@ void sync_directory(const char* path) {
   }
 }
 
-// Replaces the file `path` (open as `old_fd`) by `data`: 1 written,
-// 0 unchanged (nothing touched), -1 failed and reported (old file stands).
-int replace_file(const char* path, int old_fd, const std::string& data) {
-  struct stat st;
-  bool have_old = fstat(old_fd, &st) == 0;
-  if (have_old && same_contents(old_fd, st, data)) return 0;
+// Replaces the file `path` (which held `old`, with the mode and owner of
+// `st`) by `data`: 1 written, 0 unchanged (nothing touched), -1 failed and
+// reported (old file stands).
+int replace_file(const char* path, const std::string& old, const struct stat& st,
+                 const std::string& data) {
+  if (old == data) return 0;
+  const bool have_old = st.st_ino != 0;
 
   std::string temp = std::string(path) + ".new.XXXXXX";
   int fd = mkostemp(&temp[0], O_CLOEXEC);
@@ -296,18 +281,39 @@ int close_record(int index, bool cut_at_position) {
       report_write_failure(rec.path, ENOMEM);
       return -1;
     }
-    if (replace_file(rec.path, update->old_fd, data) < 0) result = -1;
+    if (replace_file(rec.path, update->old, update->old_st, data) < 0) result = -1;
   }
   return result;
 }
 
-// Opens (creating it when absent) the file as it stands, for an update.
-int open_old(int index) {
+// Reads the whole file as it stands (creating it when absent) for an
+// update, and closes it again.
+bool read_old(int index, UpdateStream* u) {
   int fd;
   do {
     fd = open(files[index].path, O_RDONLY | O_CREAT | O_CLOEXEC, 0666);
   } while (fd < 0 && errno == EINTR);
-  return fd;
+  if (fd < 0) return false;
+  FdCloser closer{fd};
+  if (fstat(fd, &u->old_st) != 0) return false;
+  try {
+    u->old.resize(static_cast<size_t>(u->old_st.st_size));
+    ssize_t n = pread_full(fd, u->old.data(), u->old.size(), 0);
+    if (n < 0) return false;
+    u->old.resize(static_cast<size_t>(n));
+    // Grown since the stat: read on to its end.
+    char chunk[65536];
+    for (;;) {
+      n = pread_full(fd, chunk, sizeof chunk, static_cast<int64_t>(u->old.size()));
+      if (n < 0) return false;
+      if (n == 0) break;
+      u->old.append(chunk, static_cast<size_t>(n));
+    }
+  } catch (const std::bad_alloc&) {
+    errno = ENOMEM;
+    return false;
+  }
+  return true;
 }
 
 bool ensure_paths(int index) {
@@ -394,8 +400,8 @@ FILE* update_fileop(int index) {
   FileRecord& rec = files[index];
   forget_stream(rec);
   auto update = std::make_unique<UpdateStream>();
-  update->old_fd = open_old(index);
-  FILE* fp = update->old_fd >= 0 ? fopencookie(update.get(), "r+", kUpdateFunctions) : nullptr;
+  FILE* fp = read_old(index, update.get()) ? fopencookie(update.get(), "r+", kUpdateFunctions)
+                                           : nullptr;
   if (fp == nullptr) {
     report_open_failure(index, "create");
     sounder(3);
@@ -424,19 +430,19 @@ int fileop_rewrite(int index, bool (*change)(FILE* in, FILE* out, void* context)
   }
   FileopLock lock(index);
   if (!lock.held()) return -1;
-  FdCloser old{open_old(index)};
-  if (old.fd < 0) {
+  UpdateStream old;
+  if (!read_old(index, &old)) {
     report_open_failure(index, "create");
     return -1;
   }
-  // The reader gets its own descriptor: closing `in` must not close `old`.
-  int in_fd = dup(old.fd);
   struct InCloser {
     void operator()(FILE* f) const { fclose(f); }
   };
-  std::unique_ptr<FILE, InCloser> in(in_fd >= 0 ? fdopen(in_fd, "r") : nullptr);
+  // fmemopen refuses an empty buffer: an empty file reads as /dev/null.
+  std::unique_ptr<FILE, InCloser> in(
+      old.old.empty() ? fopen("/dev/null", "re")
+                      : fmemopen(const_cast<char*>(old.old.data()), old.old.size(), "r"));
   if (!in) {
-    if (in_fd >= 0) close(in_fd);
     report_open_failure(index, "open");
     return -1;
   }
@@ -458,7 +464,7 @@ int fileop_rewrite(int index, bool (*change)(FILE* in, FILE* out, void* context)
     return -1;
   }
   std::string data(buffer != nullptr ? buffer : "", length);
-  return replace_file(files[index].path, old.fd, data);
+  return replace_file(files[index].path, old.old, old.old_st, data);
 }
 
 mode_t get_original_umask() { return saved_umask; }

@@ -1,12 +1,11 @@
 // Lock directories: taking, waiting, breaking and releasing them.
 //
 // A lock is the directory "NAME.lock" holding one holder file named after
-// the holder's host with "%d\n" and its pid.  It is made aside
-// ("NAME.lock.HOST.PID.N") with its holder file already written and renamed
-// into place: rename of a directory onto a non-empty one fails, so that is
-// the atomic test-and-set that works across hosts, and no lock of ours ever
-// stands without its holder.  (An empty directory is replaced: only an older
-// writer, between its mkdir and its holder, or its crash there, leaves one.)
+// the holder's host with "%d\n" and its pid.  mkdir is the test-and-set:
+// atomic on every file system the farm shares, and the one that the other
+// processes of the control directory use too.  The holder is written under a
+// name of its own inside and renamed to the host's name, so it is never seen
+// half-written.
 //
 // Who cleans up after a crash: the next waiter.  A holder of this host whose
 // pid is not alive here was our own crash and is broken at once; a lock
@@ -107,6 +106,19 @@ using ScopedDIR = std::unique_ptr<DIR, DirCloser>;
 void unique_name(char* out, size_t size, const char* lock_path, const char* what) {
   snprintf(out, size, "%s%s%s.%d.%u", lock_path, what, rndctl.host.or_else(""), rndctl.pid,
            name_counter++);
+}
+
+// Lock directories released aside that could not be removed at once; each
+// later release tries them again.  Bounded: a leftover nobody can remove is
+// forgotten, out of everybody's way under its unique name.
+constexpr size_t kMaxLeftovers = 16;
+char leftovers[kMaxLeftovers][PATH_MAX];
+size_t leftover_count = 0;
+
+void remember_leftover(const char* path) {
+  if (leftover_count < kMaxLeftovers) {
+    snprintf(leftovers[leftover_count++], PATH_MAX, "%s", path);
+  }
 }
 
 enum class Holder { kUnreadable, kMissing, kNoPid, kPid };
@@ -213,60 +225,45 @@ bool holds_no_pid(const char* lock_path, const struct stat& seen) {
   return empty;
 }
 
-// The aside directory of a waiter: made once, with its holder file, and
-// renamed into place by the attempt that wins.
-struct Aside {
-  char path[PATH_MAX] = "";
-  bool made = false;
-  mode_t mode = 0777;
-
-  ~Aside() {
-    if (made) remove_lock_tree(path, nullptr, 0);
+// One attempt at the lock.  mkdir is the test-and-set that every process of
+// the control directory agrees on, an older editor included, which makes the
+// directory first and its holder after: a lock must never be taken from it
+// in between.  (Renaming a ready-made directory into place would do just
+// that: rename replaces an empty directory.)  The holder file is written
+// under a name of its own and renamed to the host's name, so it is never
+// seen empty.  A crash between the mkdir and that rename leaves a lock
+// without a holder, which waiters break once it is a few seconds old.  The
+// first attempt is made in mode 0777, retries in 0664: other tools tell a
+// retaken lock by it; the mode changes only once the holder is written
+// (without search permission it could not be).
+bool take_lock_dir(const char* lock_path, bool retry) {
+  if (mkdir(lock_path, 0777) != 0) return false;
+  const char* host = rndctl.host.or_else("");
+  char holder[PATH_MAX];
+  char ready[PATH_MAX];
+  snprintf(holder, sizeof holder, "%s/%s", lock_path, host);
+  snprintf(ready, sizeof ready, "%s/.%s.%d", lock_path, host, rndctl.pid);
+  // The directory is fresh, but never follow a planted link.
+  int fd = open(ready, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0666);
+  bool ok = fd >= 0;
+  if (ok) {
+    char text[32];
+    int n = snprintf(text, sizeof text, "%d\n", rndctl.pid);
+    ssize_t w;
+    do {
+      w = write(fd, text, static_cast<size_t>(n));
+    } while (w < 0 && errno == EINTR);
+    ok = w == n;
+    if (close(fd) != 0) ok = false;
+    ok = ok && rename(ready, holder) == 0;
+    if (!ok) unlink(ready);
   }
-
-  bool make(const char* lock_path) {
-    unique_name(path, sizeof path, lock_path, ".");
-    if (mkdir(path, 0777) != 0) return false;
-    made = true;
-    mode = 0777;
-    char holder[PATH_MAX];
-    snprintf(holder, sizeof holder, "%s/%s", path, rndctl.host.or_else(""));
-    // The directory is ours and fresh, but never follow a planted link.
-    int fd = open(holder, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0666);
-    bool ok = fd >= 0;
-    if (ok) {
-      char text[32];
-      int n = snprintf(text, sizeof text, "%d\n", rndctl.pid);
-      ssize_t w;
-      do {
-        w = write(fd, text, static_cast<size_t>(n));
-      } while (w < 0 && errno == EINTR);
-      ok = w == n;
-      if (close(fd) != 0) ok = false;
-    }
-    if (!ok) {
-      remove_lock_tree(path, nullptr, 0);
-      made = false;
-    }
-    return ok;
-  }
-
-  // One attempt.  The first is made in mode 0777, retries in 0664: other
-  // tools tell a retaken lock by it.  The mode changes only now that the
-  // holder is written (without search permission it could not be).
-  bool try_take(const char* lock_path, bool retry) {
-    if (!made && !make(lock_path)) return false;
-    if (retry) {
-      if (mode != 0664 && chmod(path, 0664) == 0) mode = 0664;
-      // The lock's age is its directory's access time: it starts now, not
-      // when this waiter began.
-      utimensat(AT_FDCWD, path, nullptr, 0);
-    }
-    if (rename(path, lock_path) != 0) return false;
-    made = false;
-    return true;
-  }
-};
+  // Without a holder the lock is held all the same; waiters break it after
+  // the grace of a lock without a pid.
+  if (!ok) dbgpnt("lock %s taken without a holder file: %s\n", lock_path, strerror(errno));
+  if (retry) chmod(lock_path, 0664);
+  return true;
+}
 
 // The pause at back-off level `level`: exponential from 2 ms, at most
 // fileop_poll_seconds, half of it fixed and half random, so waiters that met
@@ -338,7 +335,26 @@ void remove_own_lock(const char* lock_path) {
   snprintf(path, sizeof path, "%s/%s", lock_path, host);
   unlink(path);
   // ENOENT: broken in between by a waiter who judged it stale.
-  rmdir(lock_path);
+  if (rmdir(lock_path) == 0 || errno == ENOENT) return;
+  // Not empty: a file system in user space may not have seen the close of
+  // the holder yet and keeps the unlinked file as a hidden one until it
+  // does.  Waiting for that would hold the lock; renamed aside, the lock is
+  // free now and the rest is removed later.
+  char away[PATH_MAX];
+  unique_name(away, sizeof away, lock_path, ".released.");
+  if (rename(lock_path, away) == 0) remember_leftover(away);
+}
+
+void sweep_leftovers() {
+  size_t kept = 0;
+  for (size_t i = 0; i < leftover_count; ++i) {
+    remove_lock_tree(leftovers[i], nullptr, 0);
+    struct stat st;
+    if (lstat(leftovers[i], &st) != 0) continue;  // gone
+    if (kept != i) memcpy(leftovers[kept], leftovers[i], PATH_MAX);
+    ++kept;
+  }
+  leftover_count = kept;
 }
 
 void release(int index, const char* lock_path) {
@@ -353,6 +369,7 @@ void release(int index, const char* lock_path) {
     dbgpnt("lock %s held %.3f ms\n", lock_path, static_cast<double>(held_ns) / 1e6);
   }
   remove_own_lock(lock_path);
+  if (leftover_count > 0) sweep_leftovers();
 }
 
 }  // namespace
@@ -389,7 +406,6 @@ int lock_fileop(int index, int take) {
   }
 
   mode_t previous = umask(0);
-  Aside aside;
   uint64_t seed = static_cast<uint64_t>(fileop_monotonic_ns()) ^
                   (static_cast<uint64_t>(rndctl.pid) << 32) ^ 0x9e3779b97f4a7c15ull;
   if (seed == 0) seed = 1;
@@ -399,13 +415,13 @@ int lock_fileop(int index, int take) {
   unsigned level = 0;
   unsigned at_once = 0;
   for (bool retry = false;; retry = true) {
-    if (aside.try_take(lock_path, retry)) break;
+    if (take_lock_dir(lock_path, retry)) break;
     if (!retry) dbgpnt(":::::: WAITING on %s\n", lock_path);
     // After a break the lock is free: try again at once, but not for ever
     // when others keep winning it.  A missing control directory lands here
-    // too (no aside can be made): the waiter keeps trying, pausing, until
-    // the directory is back.
-    if (judge_busy_lock(lock_path, &listed, &seen) == 1 && aside.made && at_once++ < 8) continue;
+    // too (mkdir fails): the waiter keeps trying, pausing, until the
+    // directory is back.
+    if (judge_busy_lock(lock_path, &listed, &seen) == 1 && at_once++ < 8) continue;
     // Editors do not wait: the user sees no delay.
     if (is_editor()) continue;
     int64_t pause = backoff_pause(level, &seed);

@@ -4,7 +4,11 @@
 // the control block's lists; its running-task entries point into those lists,
 // so every reload that replaces the lists must re-point the entries before the
 // old records are freed.
+#include <fcntl.h>
 #include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
 
 #include <cstdio>
 #include <cstdlib>
@@ -106,29 +110,26 @@ int RJC_parse() {
 
 namespace {
 
-// What this process last read from, or wrote to, one control file: the
-// file's identity then and its bytes.  While the file keeps that identity
-// its bytes are the ones held here, and reading it again is waste: one
-// change of a file costs one read however many reloads a pass makes.
-// Rewrites go through a new file renamed into place, so every rewrite gives
-// a new inode; in-place writers still change size or time stamps.
+// What this process last read from, or wrote to, one control file: its
+// bytes.  While the file still holds them, parsing it again is waste: one
+// change of a file costs one parse however many reloads a pass makes.
+//
+// Whether it still holds them is asked of its contents, not of its time
+// stamps.  A network file system may keep whole seconds and report a file's
+// attributes from a cache of its own for a while (a stat by name is not
+// revalidated; an open is), and a rewrite within one second to the same
+// size, as a job's progress text moving from "42.50% " to "45.00% ", would
+// look unchanged.  Reading a few megabytes and comparing them costs a few
+// milliseconds; a missed change costs a lost job.
 struct Seen {
   bool valid = false;
-  struct stat st {};
   std::string bytes;
 };
 Seen seen[2];
 bool marks_valid = false;  // see take_marks
 
-bool same_identity(const struct stat& a, const struct stat& b) {
-  return a.st_ino == b.st_ino && a.st_dev == b.st_dev && a.st_size == b.st_size &&
-         a.st_mtim.tv_sec == b.st_mtim.tv_sec && a.st_mtim.tv_nsec == b.st_mtim.tv_nsec &&
-         a.st_ctim.tv_sec == b.st_ctim.tv_sec && a.st_ctim.tv_nsec == b.st_ctim.tv_nsec;
-}
-
-void remember(int index, const struct stat& st, const std::string& bytes) {
+void remember(int index, const std::string& bytes) {
   seen[index].valid = true;
-  seen[index].st = st;
   seen[index].bytes = bytes;
 }
 
@@ -137,13 +138,38 @@ void forget(int index) {
   seen[index].bytes.clear();
 }
 
-// True when the file still is what this process last read or wrote.
-bool unchanged(int index) {
-  if (!seen[index].valid) return false;
-  struct stat st;
+// True when the file (opened afresh, so that a network client revalidates
+// it) still holds what this process last read or wrote.  Read without the
+// lock: a writer that rewrites in place under the lock may be caught half
+// way, which reads as a change and sends the caller to the locked read.
+bool holds(int index, const std::string& want) {
   const char* path = fileop_path(index);
-  return path != nullptr && stat(path, &st) == 0 && same_identity(st, seen[index].st);
+  if (path == nullptr) return false;
+  int fd;
+  do {
+    fd = open(path, O_RDONLY | O_CLOEXEC);
+  } while (fd < 0 && errno == EINTR);
+  if (fd < 0) return false;
+  struct stat st;
+  bool same = fstat(fd, &st) == 0 && static_cast<size_t>(st.st_size) == want.size();
+  char buf[1 << 16];
+  size_t at = 0;
+  while (same) {
+    ssize_t n = read(fd, buf, sizeof buf);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) {
+      same = n == 0 && at == want.size();
+      break;
+    }
+    size_t got = static_cast<size_t>(n);
+    same = at + got <= want.size() && memcmp(buf, want.data() + at, got) == 0;
+    at += got;
+  }
+  close(fd);
+  return same;
 }
+
+bool unchanged(int index) { return seen[index].valid && holds(index, seen[index].bytes); }
 
 // The whole of one control file: the bytes held when it has not changed,
 // else read under its lock (held for the read alone; parsing happens after
@@ -152,10 +178,9 @@ bool unchanged(int index) {
 const Seen* read_file(int index) {
   if (unchanged(index)) return &seen[index];
   std::string bytes;
-  struct stat st {};
   lock_fileop(index, 1);
   FILE* fp = read_fileop(index);
-  bool ok = fp != nullptr && fstat(fileno(fp), &st) == 0;
+  bool ok = fp != nullptr;
   if (fp != nullptr) {
     char buf[1 << 16];
     size_t n;
@@ -168,7 +193,7 @@ const Seen* read_file(int index) {
     forget(index);
     return nullptr;
   }
-  remember(index, st, bytes);
+  remember(index, bytes);
   return &seen[index];
 }
 
@@ -199,17 +224,15 @@ std::string render(int index) {
   return text;
 }
 
-// Replaces file `index` with `text` under its lock, when the file is still
-// the version `expected` describes.  Returns 1 written, 0 when somebody else
-// rewrote the file since (nothing written: the caller reads the newer
-// version), -1 when the write failed (reported by the file operations; the
-// old file stands).
-int write_if_unchanged(int index, const std::string& text, const struct stat& expected) {
+// Replaces file `index` with `text` under its lock, when the file still
+// holds `expected` (what the caller read).  Returns 1 written, 0 when
+// somebody else rewrote the file since (nothing written: the caller reads
+// the newer version), -1 when the write failed (reported by the file
+// operations; the old file stands).
+int write_if_unchanged(int index, const std::string& text, const std::string& expected) {
   lock_fileop(index, 1);
-  struct stat st;
-  const char* path = fileop_path(index);
   int result;
-  if (path == nullptr || stat(path, &st) != 0 || !same_identity(st, expected)) {
+  if (!holds(index, expected)) {
     result = 0;
   } else {
     FILE* fp = update_fileop(index);
@@ -217,11 +240,11 @@ int write_if_unchanged(int index, const std::string& text, const struct stat& ex
       result = -1;
     } else {
       rewind_fileop(index);
-      bool ok = fwrite(text.data(), 1, text.size(), fp) == text.size() && fflush(fp) == 0;
-      close_and_truncate_fileop(index);
+      bool ok = fwrite(text.data(), 1, text.size(), fp) == text.size();
+      ok = close_and_truncate_fileop(index) == 0 && ok;
       result = ok ? 1 : -1;
-      if (ok && stat(path, &st) == 0) {
-        remember(index, st, text);
+      if (ok) {
+        remember(index, text);
       } else {
         forget(index);
       }
@@ -404,13 +427,12 @@ void reconcile_from(const std::string& resources, const std::string& jobs, int e
 
 // Writes the lists back where they differ from the bytes read.  Returns
 // false when a file was rewritten by somebody else since it was read.
-bool write_back(const std::string& resources, const struct stat& res_st, const std::string& jobs,
-                const struct stat& job_st) {
+bool write_back(const std::string& resources, const std::string& jobs) {
   bool current = true;
   std::string text = render(FILE_RESOURCES);
-  if (text != resources) current = write_if_unchanged(FILE_RESOURCES, text, res_st) != 0 && current;
+  if (text != resources) current = write_if_unchanged(FILE_RESOURCES, text, resources) != 0 && current;
   text = render(FILE_JOBS);  // the writer drops the jobs marked for deletion
-  if (text != jobs) current = write_if_unchanged(FILE_JOBS, text, job_st) != 0 && current;
+  if (text != jobs) current = write_if_unchanged(FILE_JOBS, text, jobs) != 0 && current;
   return current;
 }
 
@@ -453,11 +475,9 @@ void Update_from_demon(int editor) {
     // Copies: a write-back replaces what is remembered of the files.
     const std::string resources = res != nullptr ? res->bytes : std::string();
     const std::string jobs = job != nullptr ? job->bytes : std::string();
-    const struct stat res_st = res != nullptr ? res->st : (struct stat){};
-    const struct stat job_st = job != nullptr ? job->st : (struct stat){};
     reconcile_from(resources, jobs, editor);
     if (res == nullptr || job == nullptr) break;  // reported by the open; nothing to write to
-    if (write_back(resources, res_st, jobs, job_st)) break;
+    if (write_back(resources, jobs)) break;
     // In the daemon the files as they stand win: what it failed to write
     // goes with the newer version, which the next read takes as it is.
     if (editor == 0 && attempt > 0) break;

@@ -239,7 +239,12 @@ void ChaosTest::run(unsigned seed, const SshServer* ssh) {
   auto deadline = begun + std::chrono::duration_cast<std::chrono::steady_clock::duration>(
                               std::chrono::duration<double>(kRunBound));
   long long begun_ns = wall_ns();
-  for (const auto& h : names) ASSERT_TRUE(hosts.start(h)) << h << " did not start";
+  for (const auto& h : names) {
+    ASSERT_TRUE(hosts.start(h)) << h << " did not start:\n"
+                                << read_text_file(hosts.daemon(h)->tmpdir + "/early")
+                                << hosts.daemon(h)->log() << "\n--- first host:\n"
+                                << hosts.daemon(names[0])->log();
+  }
 
   std::vector<Event> events = plan(seed, names, job_names);
   std::map<std::string, long long> counts_from;
@@ -316,7 +321,9 @@ void ChaosTest::run(unsigned seed, const SshServer* ssh) {
       if (by_frame[f].empty()) missing += " " + std::to_string(f);
     }
     EXPECT_TRUE(missing.empty()) << j
-                                 << " frames never rendered since its last restart:" << missing;
+                                 << " frames never rendered since its last restart:" << missing
+                                 << "\njob log:\n"
+                                 << farm.read("JOBLOG/" + j) << logs;
     for (const auto& [frame, stamps] : by_frame) {
       if (stamps.size() < 2) continue;
       bool excused = false;
