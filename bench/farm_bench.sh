@@ -157,7 +157,7 @@ run_setting() {
     script+='exec "$@"'
     echo "fb$i $(date +%s%N)" >>"$farm/starts"
     DRCTMPDIR=$farm/tmp$i STAMP_FILE=$farm/stamps PATH=$render_bin:$PATH \
-      unshare "${ns[@]}" /bin/sh -c "$script" "fb$i" "$daemon" -l "$dir" >"$farm/tmp$i/early" 2>&1 &
+      unshare "${ns[@]}" /bin/sh -c "$script" "fb$i" "$daemon" -l "$dir" ${FARM_BENCH_DEBUG:+-d 1} >"$farm/tmp$i/early" 2>&1 &
     pids+=($!)
   done
   start=$(date +%s)
@@ -216,7 +216,7 @@ run_setting() {
     FNR == NR { if (first == "" || $2 < first) first = $2; next }
     { if ($4 > last) last = $4 }
     END { printf "%.1f", 100 * (N * T / (H * P)) / ((last - first) / 1e9) }' "$farm/starts" "$farm/stamps")
-  rm -rf "$farm"
+  [ -n "${FARM_BENCH_KEEP:-}" ] || rm -rf "$farm"
 }
 
 mkdir -p "$root"

@@ -146,7 +146,8 @@ void Editor_process_list(int mode) {
     const EditSlot& slot = edit_table[i];
     if (slot.pid > 0) fprintf(fp, "%s %d %s\n", slot.host, slot.pid, slot.user);
   }
-  close_and_truncate_fileop(FILE_EDITPIDS);
+  (void)close_and_truncate_fileop(
+      FILE_EDITPIDS);  // a failure is reported there; the old file stands
   lock_fileop(FILE_EDITPIDS, 0);
 }
 
@@ -169,7 +170,7 @@ int Editor_process_validate(int pid) {
       return 0;
     }
     read_table(fp);
-    close_fileop(FILE_EDITPIDS);
+    (void)close_fileop(FILE_EDITPIDS);  // a failure is reported there; the old file stands
     lock_fileop(FILE_EDITPIDS, 0);
   }
 

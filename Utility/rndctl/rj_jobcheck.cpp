@@ -50,7 +50,7 @@ int RJCget_next_index(int file_id) {
     rewind_fileop(file_id);
     // The letter l after the number is part of the file: readers stop at it.
     fprintf(fp, "%ul\n", store);
-    close_and_truncate_fileop(file_id);
+    (void)close_and_truncate_fileop(file_id);  // a failure is reported there; the old file stands
   }
   lock_fileop(file_id, 0);
   return result;

@@ -52,10 +52,11 @@ int put_back_cycle(Pick pick) {
   if (count > 0) {
     rewind_fileop(FILE_TASKS);
     Task_write(fp, groups);
-    close_and_truncate_fileop(FILE_TASKS);
+    (void)close_and_truncate_fileop(
+        FILE_TASKS);  // a failure is reported there; the old file stands
   } else {
     // Nothing put back: a rewrite would only turn the groups round.
-    close_fileop(FILE_TASKS);
+    (void)close_fileop(FILE_TASKS);  // a failure is reported there; the old file stands
   }
   lock_fileop(FILE_TASKS, 0);
   TaskGroup_free_all(&groups);

@@ -9,7 +9,6 @@
 #include <unistd.h>
 
 #include <cerrno>
-
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -186,7 +185,7 @@ const Seen* read_file(int index) {
     size_t n;
     while (ok && (n = fread(buf, 1, sizeof buf, fp)) > 0) bytes.append(buf, n);
     if (ferror(fp)) ok = false;
-    close_fileop(index);
+    (void)close_fileop(index);  // a failure is reported there; the old file stands
   }
   lock_fileop(index, 0);
   if (!ok) {
@@ -352,7 +351,7 @@ void Job_control_write(const char* /*dir*/) {
   FILE* fp = update_fileop(FILE_JOBS);
   if (fp != nullptr) {
     Job_control_write_dev(fp);
-    close_and_truncate_fileop(FILE_JOBS);
+    (void)close_and_truncate_fileop(FILE_JOBS);  // a failure is reported there; the old file stands
   }
   lock_fileop(FILE_JOBS, 0);
 }
@@ -363,7 +362,8 @@ void Resource_control_write(const char* /*dir*/) {
   FILE* fp = update_fileop(FILE_RESOURCES);
   if (fp != nullptr) {
     Resource_control_write_dev(fp);
-    close_and_truncate_fileop(FILE_RESOURCES);
+    (void)close_and_truncate_fileop(
+        FILE_RESOURCES);  // a failure is reported there; the old file stands
   }
   lock_fileop(FILE_RESOURCES, 0);
 }
@@ -430,7 +430,8 @@ void reconcile_from(const std::string& resources, const std::string& jobs, int e
 bool write_back(const std::string& resources, const std::string& jobs) {
   bool current = true;
   std::string text = render(FILE_RESOURCES);
-  if (text != resources) current = write_if_unchanged(FILE_RESOURCES, text, resources) != 0 && current;
+  if (text != resources)
+    current = write_if_unchanged(FILE_RESOURCES, text, resources) != 0 && current;
   text = render(FILE_JOBS);  // the writer drops the jobs marked for deletion
   if (text != jobs) current = write_if_unchanged(FILE_JOBS, text, jobs) != 0 && current;
   return current;

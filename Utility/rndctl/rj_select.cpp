@@ -415,11 +415,18 @@ TASK* Task_get() {
   }
 
   rewind_fileop(FILE_TASKS);
-  Task_write(fp, groups);
-  close_and_truncate_fileop(FILE_TASKS);
+  bool written = Task_write(fp, groups) >= 0;
+  written = close_and_truncate_fileop(FILE_TASKS) == 0 && written;
   lock_fileop(FILE_TASKS, 0);
   TaskGroup_free_all(&groups);
   after.run();
+  if (!written && chosen != nullptr && chosen->rec != nullptr) {
+    // The file does not say STARTED (the failure is reported): another host
+    // may take the piece, so this one must not render it.
+    chosen->rec->status = TASK_PENDING;
+    chosen->taken = 0;
+    chosen = nullptr;
+  }
 
   TASK* e = rndctl.tasks;
   while (e != nullptr) {
@@ -696,7 +703,7 @@ TaskRec* Task_split_and_insert(TaskRec* rec) {
   }
   rewind_fileop(FILE_TASKS);
   Task_write(fp, groups);
-  close_and_truncate_fileop(FILE_TASKS);
+  (void)close_and_truncate_fileop(FILE_TASKS);  // reported; the old file stands
   lock_fileop(FILE_TASKS, 0);
   TaskGroup_free_all(&groups);
   after.run();

@@ -843,7 +843,7 @@ void Task_file_dump() {
   if (fp != nullptr) {
     TaskGroup* groups = Task_read(fp);
     Task_write_dump(groups);
-    close_fileop(FILE_TASKS);
+    (void)close_fileop(FILE_TASKS);  // read only: nothing to lose
     TaskGroup_free_all(&groups);
   }
   lock_fileop(FILE_TASKS, 0);
@@ -856,7 +856,7 @@ int Task_file_search(const char* host) {
   if (fp != nullptr) {
     TaskGroup* groups = Task_read(fp);
     found = Task_find(groups, host);
-    close_fileop(FILE_TASKS);
+    (void)close_fileop(FILE_TASKS);  // read only: nothing to lose
     TaskGroup_free_all(&groups);
   }
   lock_fileop(FILE_TASKS, 0);
@@ -914,7 +914,7 @@ void Task_file_update(Job* job) {
   }
   rewind_fileop(FILE_TASKS);
   Task_write(fp, groups);
-  close_and_truncate_fileop(FILE_TASKS);
+  (void)close_and_truncate_fileop(FILE_TASKS);  // reported there; the next update writes again
   lock_fileop(FILE_TASKS, 0);
   TaskGroup_free_all(&groups);
   after.run();
@@ -945,7 +945,7 @@ int Task_file_check(Job* job) {
   }
   rewind_fileop(FILE_TASKS);
   Task_write(fp, groups);
-  close_and_truncate_fileop(FILE_TASKS);
+  (void)close_and_truncate_fileop(FILE_TASKS);  // reported there; the next update writes again
   lock_fileop(FILE_TASKS, 0);
   TaskGroup_free_all(&groups);
   if (set_back) Job_wake_other_hosts(job);
@@ -965,7 +965,7 @@ void Editor_load_Tasks() {
   for (TaskGroup* g = groups; g != nullptr; g = g->next) {
     for (TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) Task_add(g->job, rec);
   }
-  close_fileop(FILE_TASKS);
+  (void)close_fileop(FILE_TASKS);  // read only: nothing to lose
   lock_fileop(FILE_TASKS, 0);
   TaskGroup_free_all(&groups);
 }

@@ -362,14 +362,14 @@ FILE* update_fileop(int index);
 void rewind_fileop(int index);
 /// Closes the stream; an update stream that was written keeps the old bytes
 /// past the written ones (nothing is cut).  0 ok, -1 failed and reported.
-int close_fileop(int index);
+[[nodiscard]] int close_fileop(int index);
 /// Closes the stream; the new contents of an update stream end at the
 /// stream's position and replace the file atomically (see above); a stream
 /// that was neither rewound nor written is closed without a rewrite.  0 ok (also when
 /// nothing changed), -1 when the rewrite failed: the old file stands, the
 /// temporary is gone, and the path with the system's reason was reported to
 /// the user and the trace.
-int close_and_truncate_fileop(int index);
+[[nodiscard]] int close_and_truncate_fileop(int index);
 mode_t get_original_umask();
 /// The path of shared file `index` ("%s/%s"), building the table when needed.
 const char* fileop_path(int index);
