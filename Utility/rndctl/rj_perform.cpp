@@ -89,18 +89,6 @@ size_t put_text(char* buf, size_t size, size_t at, const char* text) {
   return at;
 }
 
-void write_all(int fd, const char* text, size_t length) {
-  while (length > 0) {
-    ssize_t n = write(fd, text, length);
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      return;
-    }
-    text += n;
-    length -= static_cast<size_t>(n);
-  }
-}
-
 struct ChildPlan {
   char* const* argv;        // non-owning, built by the caller
   const char* stream_path;  // non-owning
@@ -116,7 +104,7 @@ void child_trace(const ChildPlan& plan, const char* text) {
   size_t at = put_text(line, sizeof line, 0, plan.host);
   at = put_text(line, sizeof line, at, ":\t");
   at = put_text(line, sizeof line, at, text);
-  write_all(STDERR_FILENO, line, at);
+  rj_write_all(STDERR_FILENO, line, at);
 }
 
 // Puts a fresh file on `target`.  The stream lives in a world-writable
@@ -185,8 +173,8 @@ bool child_reopen(const char* path, int target) {
   at = put_text(line, sizeof line, at, reason);
   at = put_text(line, sizeof line, at, ">\n");
   child_trace(plan, line);
-  write_all(STDERR_FILENO, line, at);
-  write_all(STDOUT_FILENO, line, at);
+  rj_write_all(STDERR_FILENO, line, at);
+  rj_write_all(STDOUT_FILENO, line, at);
   _exit(-1);
 }
 

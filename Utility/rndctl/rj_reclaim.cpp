@@ -136,18 +136,6 @@ bool process_start_time(int pid, unsigned long long* start) {
   return false;
 }
 
-void write_all(int fd, const char* text, size_t length) {
-  while (length > 0) {
-    ssize_t n = write(fd, text, length);
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      return;
-    }
-    text += n;
-    length -= static_cast<size_t>(n);
-  }
-}
-
 // The temporary directory is writable by everyone: the registry is written
 // under a fresh name that a planted link cannot stand in for, then renamed
 // over whatever stands at its place (rename replaces a link, never follows it).
@@ -163,7 +151,7 @@ void write_registry() {
   for (int i = 0; i < render_count; ++i) {
     char line[64];
     int n = snprintf(line, sizeof line, "%d %llu\n", renders[i].pid, renders[i].start);
-    if (n > 0) write_all(fd, line, static_cast<size_t>(n));
+    if (n > 0) rj_write_all(fd, line, static_cast<size_t>(n));
   }
   close(fd);
   if (rename(temp, path) != 0) unlink(temp);

@@ -76,6 +76,18 @@ bool rj_dev_on_host(const Dev* dev, const char* host) {
 
 bool rj_dev_is_this_host(const Dev* dev) { return rj_dev_on_host(dev, rndctl.host.c_str()); }
 
+void rj_write_all(int fd, const char* text, size_t length) {
+  while (length > 0) {
+    ssize_t n = write(fd, text, length);
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      return;
+    }
+    text += n;
+    length -= static_cast<size_t>(n);
+  }
+}
+
 void Job_wake_other_hosts(const Job* job) {
   if (job == nullptr) return;
   for (const RndDevList* e = job->resources; e != nullptr; e = e->next) {

@@ -29,19 +29,6 @@ bool job_uses_this_host(const Job* job) {
   return false;
 }
 
-// Closes the entry's log stream and removes its file; the render program is
-// gone or about to be, and nobody reads the stream any more.
-void drop_stream(TASK* entry) {
-  if (entry->stream != nullptr) {
-    fclose(entry->stream);
-    entry->stream = nullptr;
-  }
-  if (entry->stream_path) {
-    unlink(entry->stream_path.c_str());
-    entry->stream_path.reset();
-  }
-}
-
 // Frames done of the image a render program reports, counted from the first
 // frame of its task.  The count follows the numbering the program was given
 // on its command line: the job's own extension numbers, the numbering of a
@@ -102,7 +89,7 @@ int SetTaskStatus(TASK* entry, int status) {
     rj_kill_render(host, entry->pid, 9);
   }
   entry->pid = 0;
-  drop_stream(entry);
+  Task_drop_stream(entry);
   entry->output.reset();
   return 1;
 }
@@ -298,7 +285,7 @@ void Job_clear_tasks(Job* job) {
     next = entry->next;
     if (entry->job != job) continue;
     dbgpnt("freeing task %lx in Job_clear_tasks\n", reinterpret_cast<unsigned long>(entry));
-    drop_stream(entry);
+    Task_drop_stream(entry);
     TASK_free(entry);
   }
   dbgpnt("Tasks cleared \"%s\" set to not running\n", job->name.or_else("noname"));

@@ -78,6 +78,17 @@ void TaskAfterLock::run() {
   wakes.clear();
 }
 
+void Task_drop_stream(TASK* entry) {
+  if (entry->stream != nullptr) {
+    fclose(entry->stream);
+    entry->stream = nullptr;
+  }
+  if (entry->stream_path) {
+    unlink(entry->stream_path.c_str());
+    entry->stream_path.reset();
+  }
+}
+
 void Task_let_go(TASK* entry, TaskAfterLock* after) {
   if (entry == nullptr) return;
   if (entry->pid >= 2) {
@@ -89,14 +100,7 @@ void Task_let_go(TASK* entry, TaskAfterLock* after) {
   }
   entry->pid = 0;
   entry->taken = 0;
-  if (entry->stream != nullptr) {
-    fclose(entry->stream);
-    entry->stream = nullptr;
-  }
-  if (entry->stream_path) {
-    unlink(entry->stream_path.c_str());
-    entry->stream_path.reset();
-  }
+  Task_drop_stream(entry);
   if (entry->out_path) {
     if (entry->job == nullptr || entry->job->save_out == 0) unlink(entry->out_path.c_str());
     entry->out_path.reset();

@@ -284,6 +284,10 @@ const char* rj_tmpdir();
 bool rj_dev_on_host(const Dev* dev, const char* host);
 /// rj_dev_on_host(dev, this host's name).
 bool rj_dev_is_this_host(const Dev* dev);
+/// Writes all of `text` to `fd`, retrying after signals; gives up silently on
+/// an error (the callers have nowhere to report it).  Safe between fork and
+/// exec and in a signal handler.
+void rj_write_all(int fd, const char* text, size_t length);
 /// Work of `job` appeared (put back, cut off, created): touches the pid file
 /// of every other host in the job's host list, once each, so that an idle
 /// daemon there takes it without waiting for its check interval.
@@ -655,6 +659,9 @@ int Task_settle(TASK* entry, TaskRec* file_rec, TaskAfterLock* after);
 /// once when `after` is null), its pid becomes 0 so that the reaped exit finds
 /// no entry and is not judged, its stream and output files are removed.
 void Task_let_go(TASK* entry, TaskAfterLock* after);
+/// Closes an entry's log stream and removes its file: the render program is
+/// gone or about to be, and nobody reads the stream any more.
+void Task_drop_stream(TASK* entry);
 
 /// Lives of a task group.  This host's entries of a job remember the highest
 /// next_task_id seen of its group.  A group is a new life when it vanished from the
