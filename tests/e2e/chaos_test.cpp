@@ -332,9 +332,18 @@ void ChaosTest::run(unsigned seed, const SshServer* ssh) {
         seen += " " + s.host + "@" + std::to_string((s.start_ns - begun_ns) / 1000000) + "-" +
                 std::to_string((s.end_ns - begun_ns) / 1000000) + "ms";
         long long window = static_cast<long long>((max_frames[s.host] * kFrameSeconds + 1.0) * 1e9);
+        // A render is in flight until its daemon has seen it end; a daemon
+        // stopped when the render ended sees that only once continued.
+        long long seen_end = s.end_ns;
+        for (const Event& e : events) {
+          long long thaw = e.at_ns + static_cast<long long>(e.down * 1e9);
+          if (e.fault == Fault::kFreeze && e.target == s.host && e.at_ns <= s.end_ns &&
+              s.end_ns <= thaw)
+            seen_end = thaw;
+        }
         for (const Event& e : events) {
           if ((e.fault == Fault::kKillDaemon || e.fault == Fault::kPowerCut) &&
-              e.target == s.host && s.start_ns <= e.at_ns && s.end_ns >= e.at_ns - window)
+              e.target == s.host && s.start_ns <= e.at_ns && seen_end >= e.at_ns - window)
             excused = true;
         }
       }
