@@ -265,6 +265,21 @@ int UpdateRunningTasks() {
   // Entries of a group found rebuilt while the list was walked go now,
   // before they count towards any job's state.
   if (Task_retire_marked() != 0) changed = true;
+  // A job the files show "pending" while entries here say its tasks were
+  // taken or done: an editor restarted it and cleared its group, and this
+  // host missed the "restarted" between.  Ask the task file before those
+  // entries make up a state for it that would be written over "pending".
+  std::vector<Job*> reset;
+  for (Job* job = rndctl.jobs; job != nullptr; job = job->next) {
+    if (!job->status.is("pending") || !job_uses_this_host(job)) continue;
+    for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
+      if (e->job == job && e->rec != nullptr && e->rec->status != TASK_PENDING) {
+        reset.push_back(job);
+        break;
+      }
+    }
+  }
+  if (!reset.empty() && Task_retire_rebuilt(reset) != 0) changed = true;
   for (Job* job = rndctl.jobs; job != nullptr; job = job->next) {
     if (job_uses_this_host(job)) UpdateJobState(job);
   }

@@ -181,6 +181,25 @@ void Task_mark_rebuilt(const Job* job) {
   }
 }
 
+int Task_retire_rebuilt(const std::vector<Job*>& jobs) {
+  lock_fileop(FILE_TASKS, 1);
+  FILE* fp = read_fileop(FILE_TASKS);
+  TaskGroup* groups = fp != nullptr ? Task_read(fp) : nullptr;
+  bool read = fp != nullptr;
+  if (fp != nullptr) (void)close_fileop(FILE_TASKS);  // read only: nothing to lose
+  lock_fileop(FILE_TASKS, 0);
+  int dropped = 0;
+  TaskAfterLock after;
+  for (Job* job : jobs) {
+    if (!read || !Task_group_rebuilt(job, TaskGroup_by_job(groups, job))) continue;
+    for (const TASK* e = rndctl.tasks; e != nullptr; e = e->next) dropped += e->job == job;
+    Task_retire_job(job, &after);
+  }
+  TaskGroup_free_all(&groups);
+  after.run();
+  return dropped;
+}
+
 int Task_retire_marked() {
   int dropped = 0;
   TASK* next = nullptr;

@@ -681,6 +681,10 @@ void Task_retire_job(const Job* job, TaskAfterLock* after);
 void Task_mark_rebuilt(const Job* job);
 /// Returns the number of entries dropped.
 int Task_retire_marked();
+/// Reads the task file (under its lock) and drops every entry of those of
+/// `jobs` whose group there was rebuilt or is gone; returns how many entries
+/// went.  For a suspicion the daemon cannot settle from its own lists.
+int Task_retire_rebuilt(const std::vector<Job*>& jobs);
 TaskGroup* Task_read(FILE* fp);
 TaskGroup* TaskGroup_read(FILE* fp);
 int Task_write(FILE* fp, TaskGroup* groups);
