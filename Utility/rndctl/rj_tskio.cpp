@@ -254,7 +254,10 @@ class TextOut {
   void reserve(size_t n) {
     if (n > capacity_) grow(n);
   }
+  /// Empties the text and keeps the room.
+  void clear() { used_ = 0; }
   const char* data() const { return text_.get(); }
+  char* data() { return text_.get(); }
   size_t size() const { return used_; }
 
  private:
@@ -745,15 +748,26 @@ TaskGroup* TaskGroup_read(FILE* fp) {
 
 TaskGroup* Task_read(FILE* fp) {
   if (fp == nullptr) return nullptr;
-  std::string text;
+  // The buffer is kept from one read to the next: a fresh one of some
+  // megabytes per cycle is fresh pages for the kernel to map every time,
+  // and giving it back makes the allocator sweep every small block freed
+  // since.  Nothing read keeps a pointer into it.
+  static TextOut text;
+  text.clear();
   struct stat st;
   if (fstat(fileno(fp), &st) == 0 && S_ISREG(st.st_mode) && st.st_size > 0)
-    text.reserve(static_cast<size_t>(st.st_size) + 1);
-  char chunk[65536];
-  size_t n;
-  while ((n = fread(chunk, 1, sizeof chunk, fp)) > 0) text.append(chunk, n);
-  text.push_back('\0');
-  TokenSource in(text.data(), text.size() - 1);
+    text.reserve(static_cast<size_t>(st.st_size) + 65536 + 1);
+  // Straight into the buffer, which grows only if the file holds more than
+  // it said.
+  for (;;) {
+    char* p = text.room(65536);
+    size_t n = fread(p, 1, 65536, fp);
+    if (n == 0) break;
+    text.commit(p + n);
+  }
+  char* end = text.room(1);
+  *end = '\0';
+  TokenSource in(text.data(), text.size());
   return read_all(in);
 }
 
@@ -796,7 +810,10 @@ int Task_write(FILE* fp, TaskGroup* groups) {
   if (fp == nullptr) return -1;
   // The whole file in one write: the stream is line-buffered, and a write
   // per group costs a system call each on a file of thousands of groups.
-  TextOut out;
+  // Kept from one write to the next, for the reasons the reader keeps its
+  // buffer.
+  static TextOut out;
+  out.clear();
   // A record's line is some fifty characters; reserving for all of them at
   // once saves copying the text as it grows.
   size_t records = 0;
