@@ -32,13 +32,24 @@ bool is_number_state(const char* text, float* value) {
   return text != nullptr && get_fvalue(text, value) != 0;
 }
 
+// Whether the file's state text of job `index` is not what this process
+// last read from the file or wrote to it: somebody else wrote it since.
+bool state_is_news(int index, const Text& file_state);
+
 // Settles the state text of old job J against the freshly read job N.
 void reconcile(Job* J, Job* N, int editor) {
   const char* js = J->status.c_str();
   const char* ns = N->status.c_str();
+  // An editor's restart ("restarted", then "pending" once it cleared the
+  // job's tasks) is an order, not a report of progress: a host's write-back
+  // of the progress it worked out before it had read the order must not
+  // undo it, or the job never renders again and waits for ever.
+  const bool ordered = editor != 0 && (N->status.is("restarted") || N->status.is("pending")) &&
+                       !J->status.is("aborted") && state_is_news(J->index, N->status);
+  if (ordered) J->doneframes = N->doneframes;
   bool take_file;
   if (editor == 0 || ns == nullptr || N->status.is("aborted") || N->status.is("finished") ||
-      J->status.is("aborted")) {
+      J->status.is("aborted") || ordered) {
     take_file = true;
   } else if ((N->status.is("pending") && J->status.is("finished")) ||
              (N->status.is("started") && J->status.is("pending")) || J->status.is("none")) {
@@ -287,6 +298,18 @@ struct DevMark {
 std::vector<JobMark> job_marks;
 std::vector<DevMark> dev_marks;
 
+bool same_text(const Text& a, const Text& b) {
+  if (a.none() || b.none()) return a.none() == b.none();
+  return strcmp(a.c_str(), b.c_str()) == 0;
+}
+
+bool state_is_news(int index, const Text& file_state) {
+  for (const JobMark& m : job_marks) {
+    if (m.index == index) return !same_text(m.status, file_state);
+  }
+  return true;  // a job this process never saw in the file
+}
+
 void take_marks() {
   job_marks.clear();
   dev_marks.clear();
@@ -297,11 +320,6 @@ void take_marks() {
     dev_marks.push_back({d, d->index, d->max_frames, d->num_processors});
   }
   marks_valid = true;
-}
-
-bool same_text(const Text& a, const Text& b) {
-  if (a.none() || b.none()) return a.none() == b.none();
-  return strcmp(a.c_str(), b.c_str()) == 0;
 }
 
 // True when the lists still hold exactly what the files held at the last sync.

@@ -320,8 +320,7 @@ void ChaosTest::run(unsigned seed, const SshServer* ssh) {
     for (int f = 1; f <= kFrames; ++f) {
       if (by_frame[f].empty()) missing += " " + std::to_string(f);
     }
-    EXPECT_TRUE(missing.empty()) << j
-                                 << " frames never rendered since its last restart:" << missing
+    EXPECT_TRUE(missing.empty()) << j << " frames never rendered since its last restart:" << missing
                                  << "\njob log:\n"
                                  << farm.read("JOBLOG/" + j) << logs;
     for (const auto& [frame, stamps] : by_frame) {
@@ -352,6 +351,15 @@ void ChaosTest::run(unsigned seed, const SshServer* ssh) {
     }
   }
 
+  // CHAOS_KEEP=DIR keeps the control directory and every daemon's log of a
+  // failed run for a post-mortem.
+  if (HasFailure() && getenv("CHAOS_KEEP") != nullptr) {
+    std::string keep = getenv("CHAOS_KEEP");
+    std::string cmd = "mkdir -p '" + keep + "' && cp -r '" + farm.dir() + "' '" + keep + "/ctl'";
+    std::string tmp = hosts.daemon(names[0])->tmpdir;
+    cmd += " && cp -r '" + tmp.substr(0, tmp.rfind('/')) + "' '" + keep + "/hosts'";
+    if (system(cmd.c_str()) != 0) ADD_FAILURE() << "could not keep the run in " << keep;
+  }
   std::vector<std::string> stuck = hosts.shut_down(30);
   EXPECT_TRUE(stuck.empty()) << stuck.size() << " daemon(s) did not leave within 30 s of an "
                              << "operator's stop (waiting on a lock?), first " << stuck[0];
