@@ -208,7 +208,9 @@ bool holds_no_pid(const char* lock_path, const struct stat& seen) {
   }
   bool empty = true;
   while (struct dirent* e = readdir(d.get())) {
-    if (strcmp(e->d_name, ".") == 0 || strcmp(e->d_name, "..") == 0) continue;
+    // Dot files are no holders: a holder being written under its own name,
+    // or a holder a file system client unlinked and keeps hidden.
+    if (e->d_name[0] == '.') continue;
     struct stat f;
     if (fstatat(fd, e->d_name, &f, AT_SYMLINK_NOFOLLOW) != 0 || !S_ISREG(f.st_mode) ||
         f.st_size > 0) {
@@ -281,14 +283,27 @@ int64_t backoff_pause(unsigned level, uint64_t* seed) {
   return half + static_cast<int64_t>(*seed % static_cast<uint64_t>(ceiling - half + 1));
 }
 
+// What tells one lock directory from the next under the same name.  The
+// inode alone does not: a file system client in user space may number files
+// by their path.  A new lock also has a new modification time (made, its
+// holder renamed in).
+uint64_t lock_identity(const struct stat& st) {
+  // Not its change time: putting back the access time a listing moved
+  // changes that, and the lock is still the same one.
+  uint64_t id = static_cast<uint64_t>(st.st_ino);
+  id = id * 1099511628211ull ^ static_cast<uint64_t>(st.st_mtim.tv_sec);
+  id = id * 1099511628211ull ^ static_cast<uint64_t>(st.st_mtim.tv_nsec);
+  return id == 0 ? 1 : id;
+}
+
 // One look at a busy lock: breaks it when its holder is gone.  1 when it
 // was broken (try again at once), 0 when it stands.  `listed` remembers the
 // lock directory already listed in this wait; `seen` gets the one looked at.
-int judge_busy_lock(const char* lock_path, ino_t* listed, ino_t* seen) {
+int judge_busy_lock(const char* lock_path, uint64_t* listed, uint64_t* seen) {
   struct stat st;
   *seen = 0;
   if (stat(lock_path, &st) != 0) return errno == ENOENT ? 1 : 0;
-  *seen = st.st_ino;
+  *seen = lock_identity(st);
   char entry[NAME_MAX + 1] = "";
 
   int pid = 0;
@@ -302,8 +317,8 @@ int judge_busy_lock(const char* lock_path, ino_t* listed, ino_t* seen) {
 
   long age = static_cast<long>(fileop_server_clock() - st.st_atime);
   if (age >= kStaleSeconds) return fileop_break_stale_lock(lock_path);
-  if (age >= kGraceSeconds && (own == Holder::kNoPid || *listed != st.st_ino)) {
-    *listed = st.st_ino;
+  if (age >= kGraceSeconds && (own == Holder::kNoPid || *listed != *seen)) {
+    *listed = *seen;
     if ((own == Holder::kNoPid || holds_no_pid(lock_path, st)) &&
         break_lock(lock_path, st, entry, sizeof entry) == 1) {
       wrt_logfile("broke lock \"%s\" abandoned without a holder pid", lock_path);
@@ -331,18 +346,19 @@ void remove_own_lock(const char* lock_path) {
     if (opened) chmod(lock_path, st.st_mode & 07777);
     return;
   }
-  char path[PATH_MAX];
-  snprintf(path, sizeof path, "%s/%s", lock_path, host);
-  unlink(path);
-  // ENOENT: broken in between by a waiter who judged it stale.
-  if (rmdir(lock_path) == 0 || errno == ENOENT) return;
-  // Not empty: a file system in user space may not have seen the close of
-  // the holder yet and keeps the unlinked file as a hidden one until it
-  // does.  Waiting for that would hold the lock; renamed aside, the lock is
-  // free now and the rest is removed later.
+  // Renamed away first, the lock is free at once, whatever its directory
+  // still holds: a network or user-space file system client that has not
+  // yet seen the close of a holder file keeps it, unlinked, as a hidden
+  // file in the directory for a while, and an rmdir in place would fail
+  // and leave the lock standing.  What cannot be removed now is removed by
+  // a later release.
   char away[PATH_MAX];
   unique_name(away, sizeof away, lock_path, ".released.");
-  if (rename(lock_path, away) == 0) remember_leftover(away);
+  // ENOENT: broken in between by a waiter who judged it stale.
+  if (rename(lock_path, away) != 0) return;
+  remove_lock_tree(away, nullptr, 0);
+  struct stat left;
+  if (lstat(away, &left) == 0) remember_leftover(away);
 }
 
 void sweep_leftovers() {
@@ -409,9 +425,9 @@ int lock_fileop(int index, int take) {
   uint64_t seed = static_cast<uint64_t>(fileop_monotonic_ns()) ^
                   (static_cast<uint64_t>(rndctl.pid) << 32) ^ 0x9e3779b97f4a7c15ull;
   if (seed == 0) seed = 1;
-  ino_t listed = 0;
-  ino_t seen = 0;
-  ino_t seen_before = 0;
+  uint64_t listed = 0;
+  uint64_t seen = 0;
+  uint64_t seen_before = 0;
   unsigned level = 0;
   unsigned at_once = 0;
   for (bool retry = false;; retry = true) {

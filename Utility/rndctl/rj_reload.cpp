@@ -133,13 +133,16 @@ namespace {
 // milliseconds; a missed change costs a lost job.
 struct Seen {
   bool valid = false;
+  std::string path;  // the file it was read from (a process may change directory)
   std::string bytes;
 };
 Seen seen[2];
 bool marks_valid = false;  // see take_marks
 
 void remember(int index, const std::string& bytes) {
-  seen[index].valid = true;
+  const char* path = fileop_path(index);
+  seen[index].valid = path != nullptr;
+  seen[index].path = path != nullptr ? path : "";
   seen[index].bytes = bytes;
 }
 
@@ -179,7 +182,11 @@ bool holds(int index, const std::string& want) {
   return same;
 }
 
-bool unchanged(int index) { return seen[index].valid && holds(index, seen[index].bytes); }
+bool unchanged(int index) {
+  const char* path = fileop_path(index);
+  return seen[index].valid && path != nullptr && seen[index].path == path &&
+         holds(index, seen[index].bytes);
+}
 
 // The whole of one control file: the bytes held when it has not changed,
 // else read under its lock (held for the read alone; parsing happens after
@@ -297,6 +304,7 @@ struct DevMark {
 };
 std::vector<JobMark> job_marks;
 std::vector<DevMark> dev_marks;
+std::string marks_location;  // the control directory the marks were taken in
 
 bool same_text(const Text& a, const Text& b) {
   if (a.none() || b.none()) return a.none() == b.none();
@@ -304,13 +312,15 @@ bool same_text(const Text& a, const Text& b) {
 }
 
 bool state_is_news(int index, const Text& file_state) {
+  if (!rndctl.location.is(marks_location.c_str())) return false;
   for (const JobMark& m : job_marks) {
     if (m.index == index) return !same_text(m.status, file_state);
   }
-  return true;  // a job this process never saw in the file
+  return false;  // never seen here: nothing to tell apart, the rules above decide
 }
 
 void take_marks() {
+  marks_location = rndctl.location.or_else("");
   job_marks.clear();
   dev_marks.clear();
   for (const Job* j = rndctl.jobs; j != nullptr; j = j->next) {
@@ -324,7 +334,7 @@ void take_marks() {
 
 // True when the lists still hold exactly what the files held at the last sync.
 bool lists_clean() {
-  if (!marks_valid) return false;
+  if (!marks_valid || !rndctl.location.is(marks_location.c_str())) return false;
   size_t i = 0;
   for (const Job* j = rndctl.jobs; j != nullptr; j = j->next, ++i) {
     if (i >= job_marks.size()) return false;
