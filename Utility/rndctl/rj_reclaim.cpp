@@ -6,6 +6,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <climits>
 #include <csignal>
@@ -29,37 +30,22 @@ bool held(const TaskRec* rec) { return rec->status == TASK_STARTED || rec->statu
 // once the lock is gone.
 template <class Pick>
 int put_back_cycle(Pick pick) {
-  lock_fileop(FILE_TASKS, 1);
-  FILE* fp = update_fileop(FILE_TASKS);
-  if (fp == nullptr) {
-    lock_fileop(FILE_TASKS, 0);
-    return 0;
-  }
-  TaskGroup* groups = Task_read(fp);
   std::vector<Job*> touched;
   int count = 0;
-  for (TaskGroup* g = groups; g != nullptr; g = g->next) {
-    // Remainders are appended at the tail; they are PENDING and not held.
-    for (TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
-      if (!held(rec) || !pick(g, rec)) continue;
-      Task_put_back(&groups, g, rec);
-      ++count;
-      bool seen = false;
-      for (Job* j : touched) seen = seen || j == g->job;
-      if (!seen) touched.push_back(g->job);
+  (void)Task_file_rewrite([&](TaskGroup** groups) {  // a failure is reported there
+    for (TaskGroup* g = *groups; g != nullptr; g = g->next) {
+      // Remainders are appended at the tail; they are PENDING and not held.
+      for (TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
+        if (!held(rec) || !pick(g, rec)) continue;
+        Task_put_back(groups, g, rec);
+        ++count;
+        if (std::find(touched.begin(), touched.end(), g->job) == touched.end()) {
+          touched.push_back(g->job);
+        }
+      }
     }
-  }
-  if (count > 0) {
-    rewind_fileop(FILE_TASKS);
-    Task_write(fp, groups);
-    (void)close_and_truncate_fileop(
-        FILE_TASKS);  // a failure is reported there; the old file stands
-  } else {
-    // Nothing put back: a rewrite would only turn the groups round.
-    (void)close_fileop(FILE_TASKS);  // a failure is reported there; the old file stands
-  }
-  lock_fileop(FILE_TASKS, 0);
-  TaskGroup_free_all(&groups);
+    return count > 0;
+  });
   for (Job* j : touched) Job_wake_other_hosts(j);
   return count;
 }

@@ -329,98 +329,94 @@ TASK* Get_a_task() { return Task_get(); }
 TASK* Task_get() {
   Task_retire_marked();
   const char* host = rndctl.host.c_str();
-  lock_fileop(FILE_TASKS, 1);
-  FILE* fp = update_fileop(FILE_TASKS);
-  if (fp == nullptr) {
-    lock_fileop(FILE_TASKS, 0);
-    return nullptr;
-  }
-  // Every entry that finds its record in the file loses the mark again;
-  // those that keep it have left the file.
-  for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) e->stale = 1;
-  TaskGroup* groups = Task_read(fp);
   TaskAfterLock after;
-  retire_other_lives(groups, &after);
-
-  insert_unknown_pending_jobs(&groups);
-
   TASK* chosen = nullptr;
-  if (TaskRec* rec = extract_pending_task(&groups)) {
-    chosen = match_a_taskrec(rec);
-    // The record is PENDING in the file: an entry here that still held it
-    // lost it, and its render stops before the piece is taken again.
-    if (chosen != nullptr && chosen->rec != rec) Task_settle(chosen, rec, &after);
-    const int ids_before = rec->group->next_task_id;
-    split_a_task(rec->group, rec);
-    if (rec->group->next_task_id != ids_before) after.wake(rec->group->job);
-    if (chosen == nullptr) {
-      chosen = Task_add(rec->group->job, rec);
-    } else if (chosen->rec != rec) {
-      TaskRec* own = chosen->rec;
-      own->start = rec->start;
-      own->end = rec->end;
-      own->retries = rec->retries;
-      own->current = rec->current;
-      own->dev = rec->dev;
-    }
-    rec->status = TASK_STARTED;
-    if (chosen != nullptr) {
-      chosen->rec->status = TASK_STARTED;
-      chosen->stale = 0;
-      chosen->taken = 1;
-    }
-  }
+  bool opened = false;
+  const int written = Task_file_rewrite([&](TaskGroup** list) {
+    opened = true;
+    TaskGroup*& groups = *list;
+    // Every entry that finds its record in the file loses the mark again;
+    // those that keep it have left the file.
+    for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) e->stale = 1;
+    retire_other_lives(groups, &after);
 
-  // Bring the mirror in line with the file, group by group.
-  EntryIndex index;
-  for (TaskGroup* g = groups; g != nullptr; g = g->next) {
-    Job* job = g->job;
-    int uses_host = isa_job_using_host(host, job);
-    index.select(job);
-    for (TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
-      TASK* e = index.find(rec->id);
-      if (e != nullptr && !Task_same_rec(e->rec, rec)) e = nullptr;
-      if (e == nullptr) {
-        e = Task_add(job, rec);  // the entry owns the record from now on
-        if (e != nullptr) index.add(e);
-      } else if (e->rec != rec && uses_host) {
-        TaskRec* own = e->rec;
+    insert_unknown_pending_jobs(&groups);
+
+    if (TaskRec* rec = extract_pending_task(&groups)) {
+      chosen = match_a_taskrec(rec);
+      // The record is PENDING in the file: an entry here that still held it
+      // lost it, and its render stops before the piece is taken again.
+      if (chosen != nullptr && chosen->rec != rec) Task_settle(chosen, rec, &after);
+      const int ids_before = rec->group->next_task_id;
+      split_a_task(rec->group, rec);
+      if (rec->group->next_task_id != ids_before) after.wake(rec->group->job);
+      if (chosen == nullptr) {
+        chosen = Task_add(rec->group->job, rec);
+      } else if (chosen->rec != rec) {
+        TaskRec* own = chosen->rec;
         own->start = rec->start;
         own->end = rec->end;
         own->retries = rec->retries;
         own->current = rec->current;
-        if (rec->dev != nullptr) own->dev = rec->dev;
-        // This host knows best what its own tasks are doing, while they are
-        // its own; for the others the file is the news.
-        if (Task_settle(e, rec, &after) != 0) {
-          dbgpnt("Task_get: use old status %d\n", own->status);
-        } else {
-          own->status = rec->status;
-        }
+        own->dev = rec->dev;
       }
-      if (e != nullptr && !e->taken && rj_dev_is_this_host(rec->dev) && held_status(rec->status)) {
-        // Names this host as its renderer, but no daemon here took it: an
-        // earlier daemon of this host did and ended.  Nobody renders it.
-        rec->status = TASK_PENDING;
-        if (e->rec != nullptr) e->rec->status = TASK_PENDING;
-        after.wake(job);
+      rec->status = TASK_STARTED;
+      if (chosen != nullptr) {
+        chosen->rec->status = TASK_STARTED;
+        chosen->stale = 0;
+        chosen->taken = 1;
       }
-      if (e != nullptr && e->rec != rec) {
-        if (uses_host) dbgpnt("extra task_rec %x, setting dead state\n", px(rec));
-        rec->keep = 1;
-      }
-      if (e != nullptr) e->stale = 0;
     }
-    for (TASK* e : index.selected()) e->seen_next_id = std::max(e->seen_next_id, g->next_task_id);
-  }
 
-  rewind_fileop(FILE_TASKS);
-  bool written = Task_write(fp, groups) >= 0;
-  written = close_and_truncate_fileop(FILE_TASKS) == 0 && written;
-  lock_fileop(FILE_TASKS, 0);
-  TaskGroup_free_all(&groups);
+    // Bring the mirror in line with the file, group by group.
+    EntryIndex index;
+    for (TaskGroup* g = groups; g != nullptr; g = g->next) {
+      Job* job = g->job;
+      int uses_host = isa_job_using_host(host, job);
+      index.select(job);
+      for (TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
+        TASK* e = index.find(rec->id);
+        if (e != nullptr && !Task_same_rec(e->rec, rec)) e = nullptr;
+        if (e == nullptr) {
+          e = Task_add(job, rec);  // the entry owns the record from now on
+          if (e != nullptr) index.add(e);
+        } else if (e->rec != rec && uses_host) {
+          TaskRec* own = e->rec;
+          own->start = rec->start;
+          own->end = rec->end;
+          own->retries = rec->retries;
+          own->current = rec->current;
+          if (rec->dev != nullptr) own->dev = rec->dev;
+          // This host knows best what its own tasks are doing, while they are
+          // its own; for the others the file is the news.
+          if (Task_settle(e, rec, &after) != 0) {
+            dbgpnt("Task_get: use old status %d\n", own->status);
+          } else {
+            own->status = rec->status;
+          }
+        }
+        if (e != nullptr && !e->taken && rj_dev_is_this_host(rec->dev) &&
+            held_status(rec->status)) {
+          // Names this host as its renderer, but no daemon here took it: an
+          // earlier daemon of this host did and ended.  Nobody renders it.
+          rec->status = TASK_PENDING;
+          if (e->rec != nullptr) e->rec->status = TASK_PENDING;
+          after.wake(job);
+        }
+        if (e != nullptr && e->rec != rec) {
+          if (uses_host) dbgpnt("extra task_rec %x, setting dead state\n", px(rec));
+          rec->keep = 1;
+        }
+        if (e != nullptr) e->stale = 0;
+      }
+      for (TASK* e : index.selected()) e->seen_next_id = std::max(e->seen_next_id, g->next_task_id);
+    }
+
+    return true;
+  });
+  if (!opened) return nullptr;
   after.run();
-  if (!written && chosen != nullptr && chosen->rec != nullptr) {
+  if (written != 1 && chosen != nullptr && chosen->rec != nullptr) {
     // The file does not say STARTED (the failure is reported): another host
     // may take the piece, so this one must not render it.
     chosen->rec->status = TASK_PENDING;
@@ -657,55 +653,46 @@ TaskRec* Task_split_and_insert(TaskRec* rec) {
   TASK* entry = rec->task;
   Job* job = entry->job;
   dbgpnt("Task_split_and_insert===========================%d\n", rec->id);
-  lock_fileop(FILE_TASKS, 1);
-  FILE* fp = update_fileop(FILE_TASKS);
-  if (fp == nullptr) {
-    lock_fileop(FILE_TASKS, 0);
-    return nullptr;
-  }
-  TaskGroup* groups = Task_read(fp);
-  TaskGroup* group = TaskGroup_by_job(groups, job);
   TaskAfterLock after;
-  TaskRec* f = nullptr;
-  if (Task_group_rebuilt(job, group)) {
-    Task_mark_rebuilt(job);
-  } else if (group != nullptr) {
-    for (f = group->tasks; f != nullptr && (f == rec || !Task_same_rec(rec, f)); f = f->next) {
-    }
-  }
-  if (f != nullptr && !Task_owns(entry, f)) {
-    // Put back or taken by another host meanwhile: not this host's any more.
-    Task_settle(entry, f, &after);
-  } else if (f != nullptr && rec->retries < kMaxRetries) {
-    int n = rec->retries++;
-    if (rec->start < rec->current) {
-      // Frames up to the one it reached are done; the rest starts afresh.
-      TaskRec* rest = insert_task(&groups, job, rec->current, rec->end, TASK_PENDING);
-      if (rest != nullptr) {
-        rest->retries = n;
-        rest->keep = 2;
-        Task_add(job, rest);
+  (void)Task_file_rewrite([&](TaskGroup** groups) {  // reported; the old file stands
+    TaskGroup* group = TaskGroup_by_job(*groups, job);
+    TaskRec* f = nullptr;
+    if (Task_group_rebuilt(job, group)) {
+      Task_mark_rebuilt(job);
+    } else if (group != nullptr) {
+      for (f = group->tasks; f != nullptr && (f == rec || !Task_same_rec(rec, f)); f = f->next) {
       }
-      rec->status = TASK_FINISHED;
-      rec->end = rec->current - job->frames[2];
-      rec->current = rec->end;
-    } else {
-      rec->status = TASK_PENDING;
     }
-    f->status = rec->status;
-    f->start = rec->start;
-    f->end = rec->end;
-    f->current = rec->current;
-    f->retries = rec->retries;
-    entry->taken = 0;  // given back
-    Task_note_group(job, group);
-    after.wake(job);
-  }
-  rewind_fileop(FILE_TASKS);
-  Task_write(fp, groups);
-  (void)close_and_truncate_fileop(FILE_TASKS);  // reported; the old file stands
-  lock_fileop(FILE_TASKS, 0);
-  TaskGroup_free_all(&groups);
+    if (f != nullptr && !Task_owns(entry, f)) {
+      // Put back or taken by another host meanwhile: not this host's any more.
+      Task_settle(entry, f, &after);
+    } else if (f != nullptr && rec->retries < kMaxRetries) {
+      int n = rec->retries++;
+      if (rec->start < rec->current) {
+        // Frames up to the one it reached are done; the rest starts afresh.
+        TaskRec* rest = insert_task(groups, job, rec->current, rec->end, TASK_PENDING);
+        if (rest != nullptr) {
+          rest->retries = n;
+          rest->keep = 2;
+          Task_add(job, rest);
+        }
+        rec->status = TASK_FINISHED;
+        rec->end = rec->current - job->frames[2];
+        rec->current = rec->end;
+      } else {
+        rec->status = TASK_PENDING;
+      }
+      f->status = rec->status;
+      f->start = rec->start;
+      f->end = rec->end;
+      f->current = rec->current;
+      f->retries = rec->retries;
+      entry->taken = 0;  // given back
+      Task_note_group(job, group);
+      after.wake(job);
+    }
+    return true;
+  });
   after.run();
   dbgpnt("done ================= Task_split_and_insert\n");
   return nullptr;

@@ -880,60 +880,74 @@ int Task_file_search(const char* host) {
   return found;
 }
 
-void Task_file_update(Job* job) {
-  dbgpnt("\nTask_file_update-----------------------------\n");
+int Task_file_rewrite(const std::function<bool(TaskGroup** groups)>& change) {
   lock_fileop(FILE_TASKS, 1);
   FILE* fp = update_fileop(FILE_TASKS);
   if (fp == nullptr) {
     lock_fileop(FILE_TASKS, 0);
-    return;
+    return -1;
   }
   TaskGroup* groups = Task_read(fp);
+  int result = 0;
+  if (change(&groups)) {
+    rewind_fileop(FILE_TASKS);
+    bool written = Task_write(fp, groups) >= 0;
+    result = close_and_truncate_fileop(FILE_TASKS) == 0 && written ? 1 : -1;
+  } else {
+    // Nothing changed: a rewrite would only turn the groups round.
+    (void)close_fileop(FILE_TASKS);  // read only: nothing to lose
+  }
+  lock_fileop(FILE_TASKS, 0);
+  TaskGroup_free_all(&groups);
+  return result;
+}
+
+void Task_file_update(Job* job) {
+  dbgpnt("\nTask_file_update-----------------------------\n");
   TaskAfterLock after;
-  bool job_seen = false;
-  TaskGroup* g = groups;
-  while (g != nullptr) {
-    TaskGroup* next = g->next;
-    dbgpnt("\"%s\" -> %s\n", g->job->name.or_else("(null)"), g->job->status.or_else("(null)"));
-    if (job != nullptr && g->job == job) {
-      job_seen = true;
-      if (Task_group_rebuilt(job, g)) {
-        // Built again since this host last looked: nothing this host holds
-        // belongs to it, not even the end of the job it knew.
-        Task_mark_rebuilt(job);
-      } else if (job_is_over(job)) {
-        dbgpnt("free up task info\n");
-        while (g->tasks != nullptr) TaskRec_freeOnly(g->tasks);
-        TaskGroup_free(&groups, g);
-      } else {
-        std::unordered_map<int, TASK*> mine;  // first entry of each id, as a list walk finds it
-        for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
-          if (e->job == job && e->rec != nullptr) mine.emplace(e->rec->id, e);
-        }
-        for (TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
-          auto it = mine.find(rec->id);
-          if (it == mine.end() || !Task_same_rec(it->second->rec, rec)) continue;
-          TASK* e = it->second;
-          if (Task_settle(e, rec, &after) != 0) {
-            rec->current = e->rec->current;
-            dbgpnt("%d) %s %.2f\n", rec->id, GetTaskStatusStr(rec->status), rec->current);
+  (void)Task_file_rewrite([&](TaskGroup** list) {  // reported there; the next update writes again
+    TaskGroup*& groups = *list;
+    bool job_seen = false;
+    TaskGroup* g = groups;
+    while (g != nullptr) {
+      TaskGroup* next = g->next;
+      dbgpnt("\"%s\" -> %s\n", g->job->name.or_else("(null)"), g->job->status.or_else("(null)"));
+      if (job != nullptr && g->job == job) {
+        job_seen = true;
+        if (Task_group_rebuilt(job, g)) {
+          // Built again since this host last looked: nothing this host holds
+          // belongs to it, not even the end of the job it knew.
+          Task_mark_rebuilt(job);
+        } else if (job_is_over(job)) {
+          dbgpnt("free up task info\n");
+          while (g->tasks != nullptr) TaskRec_freeOnly(g->tasks);
+          TaskGroup_free(&groups, g);
+        } else {
+          std::unordered_map<int, TASK*> mine;  // first entry of each id, as a list walk finds it
+          for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
+            if (e->job == job && e->rec != nullptr) mine.emplace(e->rec->id, e);
+          }
+          for (TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
+            auto it = mine.find(rec->id);
+            if (it == mine.end() || !Task_same_rec(it->second->rec, rec)) continue;
+            TASK* e = it->second;
+            if (Task_settle(e, rec, &after) != 0) {
+              rec->current = e->rec->current;
+              dbgpnt("%d) %s %.2f\n", rec->id, GetTaskStatusStr(rec->status), rec->current);
+            }
           }
         }
       }
+      g = next;
     }
-    g = next;
-  }
-  // The group left the file while this host still holds entries of a job it
-  // thinks under way: the group was cleared behind its back (a restart it
-  // did not see).  A job over in this host's eyes dropped it itself.
-  if (job != nullptr && !job_seen && !job_is_over(job) && Task_group_rebuilt(job, nullptr)) {
-    Task_mark_rebuilt(job);
-  }
-  rewind_fileop(FILE_TASKS);
-  Task_write(fp, groups);
-  (void)close_and_truncate_fileop(FILE_TASKS);  // reported there; the next update writes again
-  lock_fileop(FILE_TASKS, 0);
-  TaskGroup_free_all(&groups);
+    // The group left the file while this host still holds entries of a job it
+    // thinks under way: the group was cleared behind its back (a restart it
+    // did not see).  A job over in this host's eyes dropped it itself.
+    if (job != nullptr && !job_seen && !job_is_over(job) && Task_group_rebuilt(job, nullptr)) {
+      Task_mark_rebuilt(job);
+    }
+    return true;
+  });
   after.run();
   dbgpnt("Task_file_update-------------------------DONE\n");
 }
@@ -941,30 +955,21 @@ void Task_file_update(Job* job) {
 int Task_file_check(Job* job) {
   dbgpnt("\nTask_file_check-----------------------------\n");
   int set_back = 0;
-  lock_fileop(FILE_TASKS, 1);
-  FILE* fp = update_fileop(FILE_TASKS);
-  if (fp == nullptr) {
-    lock_fileop(FILE_TASKS, 0);
-    return 0;
-  }
-  TaskGroup* groups = Task_read(fp);
-  TaskGroup* g = TaskGroup_by_job(groups, job);
-  if (g != nullptr) {
-    for (TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
-      rec->retries = 0;
-      if ((rec->status == TASK_RUNNING || rec->status == TASK_STARTED) && rec->dev != nullptr &&
-          rec->dev->host_name.c_str() != nullptr && !daemon_alive(rec->dev->host_name.c_str())) {
-        rec->status = TASK_PENDING;
-        set_back = 1;
-        dbgpnt("set job pending failed daemon on \"%s\"\n", rec->dev->host_name.c_str());
+  (void)Task_file_rewrite([&](TaskGroup** groups) {  // reported there
+    TaskGroup* g = TaskGroup_by_job(*groups, job);
+    if (g != nullptr) {
+      for (TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
+        rec->retries = 0;
+        if ((rec->status == TASK_RUNNING || rec->status == TASK_STARTED) && rec->dev != nullptr &&
+            rec->dev->host_name.c_str() != nullptr && !daemon_alive(rec->dev->host_name.c_str())) {
+          rec->status = TASK_PENDING;
+          set_back = 1;
+          dbgpnt("set job pending failed daemon on \"%s\"\n", rec->dev->host_name.c_str());
+        }
       }
     }
-  }
-  rewind_fileop(FILE_TASKS);
-  Task_write(fp, groups);
-  (void)close_and_truncate_fileop(FILE_TASKS);  // reported there; the next update writes again
-  lock_fileop(FILE_TASKS, 0);
-  TaskGroup_free_all(&groups);
+    return true;
+  });
   if (set_back) Job_wake_other_hosts(job);
   dbgpnt("Task_file_check-------------------------DONE\n");
   return set_back;

@@ -25,6 +25,7 @@
 #include <cstdint>
 #include <cstdio>
 #include <ctime>
+#include <functional>
 #include <string>
 #include <unordered_map>
 #include <vector>
@@ -695,6 +696,13 @@ void Task_file_dump();
 int Task_file_search(const char* host);
 void Task_file_update(Job* job);
 int Task_file_check(Job* job);
+/// The one locked read-modify-write of the task file: takes its lock, reads
+/// the groups, hands them to `change` (which may add, cut and free records
+/// and groups), and when it returns true writes them back (aside, then
+/// renamed in); releases the lock and frees the groups on every way out.
+/// Returns 1 written, 0 left alone, -1 when the file could not be opened or
+/// written (reported; the old file stands).
+int Task_file_rewrite(const std::function<bool(TaskGroup** groups)>& change);
 void Editor_load_Tasks();
 void Task_update_status();
 void Task_sfile_dump(Dev* dev);
