@@ -297,10 +297,11 @@ void ChaosTest::run(unsigned seed, const SshServer* ssh) {
   double took = std::chrono::duration<double>(std::chrono::steady_clock::now() - begun).count();
   if (getenv("CHAOS_VERBOSE") != nullptr) printf("seed %u: jobs done after %.1f s\n", seed, took);
   std::string logs;
-  for (const auto& h : names)
-    logs += "--- " + h + " log tail:\n" +
-            hosts.daemon(h)->log().substr(
-                hosts.daemon(h)->log().size() > 600 ? hosts.daemon(h)->log().size() - 600 : 0);
+  for (const auto& h : names) {
+    // One read: the log still grows while the daemons run.
+    std::string log = hosts.daemon(h)->log();
+    logs += "--- " + h + " log tail:\n" + log.substr(log.size() > 600 ? log.size() - 600 : 0);
+  }
   for (const auto& j : job_names) {
     EXPECT_EQ(job_status(farm, j), "finished")
         << j << " after " << took << " s (bound " << kRunBound << " s)\n"
