@@ -219,6 +219,9 @@ TEST_F(RenderTest, AScheduledJobStartsOnlyInItsHours) {
   EXPECT_FALSE(exists(image("nightly", 1)));
   EXPECT_EQ(job_status(farm_, "nightly"), "pending");
   sunday.stop();
+  // The next daemon refuses to start while the pid file names a live one.
+  int old_pid = read_pid_file(farm_.path(host_ + ".pid"));
+  ASSERT_TRUE(wait_for([&] { return old_pid == 0 || kill(old_pid, 0) != 0; }, 20));
 
   // Monday 8:15: inside them.
   farm_.set_wrapper({"/usr/bin/faketime", "2026-11-23 08:15:00"});
