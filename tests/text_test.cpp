@@ -1,4 +1,4 @@
-#include "Utility/rndctl/rj_text.h"
+#include "Utility/rndctl/base/rj_text.h"
 
 #include <gtest/gtest.h>
 

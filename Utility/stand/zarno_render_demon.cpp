@@ -20,7 +20,22 @@
 #include <ctime>
 
 #include "Shared/memory/MA_rtns.h"
-#include "Utility/rndctl/rndctl.h"
+#include "Utility/rndctl/base/rj_control.h"
+#include "Utility/rndctl/base/rj_log.h"
+#include "Utility/rndctl/base/rj_text.h"
+#include "Utility/rndctl/ctldir/rj_updatetime.h"
+#include "Utility/rndctl/ctlfile/rj_reload.h"
+#include "Utility/rndctl/proc/rj_signal.h"
+#include "Utility/rndctl/records/rj_jobcheck.h"
+#include "Utility/rndctl/records/rj_recindex.h"
+#include "Utility/rndctl/records/rj_schedule.h"
+#include "Utility/rndctl/tasks/rj_perform.h"
+#include "Utility/rndctl/tasks/rj_reclaim.h"
+#include "Utility/rndctl/tasks/rj_select.h"
+#include "Utility/rndctl/tasks/rj_status.h"
+#include "Utility/rndctl/tasks/rj_task.h"
+#include "Utility/rndctl/tasks/rj_taskrec.h"
+#include "Utility/rndctl/tasks/rj_tskio.h"
 
 namespace {
 

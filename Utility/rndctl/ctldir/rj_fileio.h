@@ -1,0 +1,154 @@
+#pragma once
+
+#include <sys/types.h>
+
+#include <cstdint>
+#include <cstdio>
+#include <ctime>
+
+// The shared files, by index into control_names.
+enum {
+  FILE_JOBS = 0,
+  FILE_RESOURCES = 1,
+  FILE_TASKS = 2,
+  FILE_EDITPIDS = 3,
+  FILE_DEV_INDEX = 4,
+  FILE_JOB_INDEX = 5,
+  FILE_ACCESS = 6,
+  FILE_STATUS = 7,
+  FILE_COUNT = 8
+};
+
+// Locked file operations (rj_fileio, rj_lockdir).
+//
+// Mutual exclusion and atomic rewrites of the shared files.  Every shared
+// file has a fixed index (FILE_JOBS ...) and a lock directory "NAME.lock"
+// beside it that holds one holder file, named after the holder's host and
+// containing "%d\n" with its pid.
+//
+// Calling order, always:
+//   lock_fileop(i, 1)                     waits until the lock is this process's
+//   read_fileop(i) | update_fileop(i)     stream, or null (reported)
+//   ... read; for a rewrite rewind_fileop(i) and write from the start ...
+//   close_fileop(i) | close_and_truncate_fileop(i)   0, or -1 (reported)
+//   lock_fileop(i, 0)                     releases, only when it is ours
+// New code uses FileopLock and fileop_rewrite below instead.
+//
+// A rewrite never shows half done: an update stream reads the file as it
+// was, keeps what is written to it in memory, and close_and_truncate_fileop
+// (or fileop_rewrite) puts the new contents in a temporary file beside the
+// old one ("NAME.new.XXXXXX"), forces it to disk and renames it over the old
+// one; a reader sees the old file or the new one.  When the new contents
+// equal the old, nothing is written and the file keeps its inode and times.
+//
+// What a crash leaves behind: during a rewrite at most the temporary file,
+// which nobody reads (the old file stands); while holding a lock, the lock
+// directory: this host's next waiter breaks it at once (its holder pid is
+// dead), other hosts when it is 181 s old.  A lock is made aside
+// ("NAME.lock.HOST.PID.N") with its holder file and renamed into place, so
+// no lock directory of ours ever stands without its holder; a process
+// killed while waiting leaves its aside directory, which nobody reads.
+//
+// Nothing here is safe inside a signal handler.
+extern const char* const control_names[FILE_COUNT];
+int init_fileop();
+/// take non-zero: waits (backing off, see fileop_poll_seconds) until the lock
+/// of file `index` is taken, breaking it when its holder is gone; returns 1.
+/// take zero: releases it when this process holds it (its holder file names
+/// this host and this pid) and leaves anyone else's alone; returns 1.
+/// 0 only for a bad index or when the paths cannot be built.
+int lock_fileop(int index, int take);
+/// Opens file `index` for reading, creating it empty when absent.
+FILE* read_fileop(int index);
+/// Opens file `index` for a rewrite (creating it empty when absent): reads
+/// give the file as it was; writes go to the new contents, from the start of
+/// the file (right after the open or after rewind_fileop).  The stream has
+/// no descriptor (fileno is -1).
+FILE* update_fileop(int index);
+/// Rewinds the open stream: an update stream then writes from the start.
+void rewind_fileop(int index);
+/// Closes the stream; an update stream that was written keeps the old bytes
+/// past the written ones (nothing is cut).  0 ok, -1 failed and reported.
+[[nodiscard]] int close_fileop(int index);
+/// Closes the stream; the new contents of an update stream end at the
+/// stream's position and replace the file atomically (see above); a stream
+/// that was neither rewound nor written is closed without a rewrite.  0 ok (also when
+/// nothing changed), -1 when the rewrite failed: the old file stands, the
+/// temporary is gone, and the path with the system's reason was reported to
+/// the user and the trace.
+[[nodiscard]] int close_and_truncate_fileop(int index);
+mode_t get_original_umask();
+/// The path of shared file `index` ("%s/%s"), building the table when needed.
+const char* fileop_path(int index);
+/// The path of the lock directory of file `index` ("%s/%s.lock"), likewise.
+const char* fileop_lock_path(int index);
+/// The access log stream opened by init_fileop, or null.
+FILE* fileop_access_stream();
+/// Closes the access log and forgets every path, so that the next lock or
+/// open builds the table again (a process that changes control directory).
+void fileop_reset();
+/// The longest pause, in seconds, between two attempts at a busy lock (5).
+/// A waiter retries after a few milliseconds, then after growing, jittered
+/// pauses up to this.  0: no pauses at all (tests); editors never pause.
+extern unsigned fileop_poll_seconds;
+/// Pauses the waiter for `ns` nanoseconds (nanosleep); tests replace it.
+extern void (*fileop_sleep)(int64_t ns);
+/// A monotonic clock in nanoseconds for pauses and hold times; tests replace it.
+extern int64_t (*fileop_monotonic_ns)();
+/// The file server's clock, against which lock ages are judged: the
+/// modification time of ".clock.HOST" in the control directory, touched at
+/// most once a second and carried forward on the monotonic clock in
+/// between (rj_now() when it cannot be touched).  Tests replace it.
+extern time_t (*fileop_server_clock)();
+/// One look at a busy lock directory: when its access time is 181 seconds
+/// old or older by the server clock, takes it away (a rename, so only one
+/// waiter wins), removes it with its holder file, reports the break on
+/// stderr and in the access log, and returns 1; otherwise 0.
+int fileop_break_stale_lock(const char* lock_path);
+/// Releases every lock this process holds, and no other.  For fatal paths
+/// (a syntax error ends the daemon): the other hosts go on at once.
+void fileop_release_held_locks();
+/// How long the lock of one file was held by this process, for benchmarks.
+struct FileopHoldStats {
+  long count = 0;  // releases of a held lock
+  int64_t longest_ns = 0;
+  int64_t total_ns = 0;
+};
+FileopHoldStats fileop_hold_stats(int index);
+
+/// Holds the lock of one shared file for the life of the object: the
+/// constructor waits for it (lock_fileop(index, 1)), the destructor releases
+/// it on every way out of the scope.
+class FileopLock {
+ public:
+  explicit FileopLock(int index) : index_(index), held_(lock_fileop(index, 1) == 1) {}
+  ~FileopLock() {
+    if (held_) lock_fileop(index_, 0);
+  }
+  FileopLock(const FileopLock&) = delete;
+  FileopLock& operator=(const FileopLock&) = delete;
+  [[nodiscard]] bool held() const { return held_; }
+
+ private:
+  int index_;
+  bool held_;
+};
+
+/// Rewrites file `index` under its lock in one call: takes the lock, opens
+/// the file (empty when absent) as `in`, lets `change(in, out)` write the
+/// new contents to `out` (a memory stream), writes them aside and renames
+/// them over the file, releases the lock.  `change` returns false when
+/// there is nothing to change.  Returns 1 written, 0 nothing to change
+/// (`change` said so, or wrote the same bytes: the file is not touched),
+/// -1 failed (reported; the old file stands).
+[[nodiscard]] int fileop_rewrite(int index, bool (*change)(FILE* in, FILE* out, void* context),
+                                 void* context);
+template <class Change>
+[[nodiscard]] int fileop_rewrite(int index, Change change) {
+  return fileop_rewrite(
+      index,
+      [](FILE* in, FILE* out, void* context) -> bool {
+        return (*static_cast<Change*>(context))(in, out);
+      },
+      &change);
+}

@@ -1,0 +1,521 @@
+// Starting render programs for running-task entries, the per-job log under
+// JOBLOG, and killing this daemon's render processes.
+//
+// A render program runs as a child of the daemon in its own process group,
+// with its error output in the task's log stream (which the progress reading
+// follows) and its stdout in an output file next to the images.  The child is
+// reaped by the SIGCHLD handler, which clears the entry's pid and stores the
+// exit value; UpdateRunningTasks judges the outcome on the next pass.
+#include "Utility/rndctl/tasks/rj_perform.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/types.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <climits>
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "Shared/memory/MA_rtns.h"
+#include "Utility/rndctl/base/rj_control.h"
+#include "Utility/rndctl/base/rj_log.h"
+#include "Utility/rndctl/base/rj_text.h"
+#include "Utility/rndctl/proc/rj_signal.h"
+#include "Utility/rndctl/records/rj_dev.h"
+#include "Utility/rndctl/records/rj_jobcheck.h"
+#include "Utility/rndctl/records/rj_recindex.h"
+#include "Utility/rndctl/records/rj_records.h"
+#include "Utility/rndctl/tasks/rj_reclaim.h"
+#include "Utility/rndctl/tasks/rj_status.h"
+#include "Utility/rndctl/tasks/rj_task.h"
+#include "Utility/rndctl/tasks/rj_taskrec.h"
+#include "Utility/rndctl/tasks/rj_tskio.h"
+
+namespace {
+
+constexpr const char* kUnit = "Utility/rndctl/rj_perform";
+
+const char* status_name(int code) {
+  if (code < TASK_PENDING || code > TASK_STOPPED) return "UNKNOWN";
+  return task_status_table[code];
+}
+
+struct FileCloser {
+  void operator()(FILE* fp) const {
+    if (fp != nullptr) fclose(fp);
+  }
+};
+using ScopedFILE = std::unique_ptr<FILE, FileCloser>;
+
+struct MaFree {
+  void operator()(char* p) const { MA_free(p, __LINE__, kUnit); }
+};
+using ScopedBlock = std::unique_ptr<char, MaFree>;
+
+std::string format_float(float value) {
+  char buf[64];
+  snprintf(buf, sizeof buf, "%f", static_cast<double>(value));
+  return buf;
+}
+
+std::string format_int(int value) {
+  char buf[32];
+  snprintf(buf, sizeof buf, "%d", value);
+  return buf;
+}
+
+// Extension numbers count frames from the job's first frame: the job's own
+// extension start and step when it names them, else the start frame
+// (truncated) counting up by one.
+void extension_base_step(const Job* job, int* base, int* step) {
+  if (job->extension != 0) {
+    *base = job->ext_start;
+    *step = job->ext_by;
+  } else {
+    *base = static_cast<int>(job->frames[0]);
+    *step = 1;
+  }
+}
+
+int extension_of_frame(const Job* job, float frame) {
+  int base = 0;
+  int step = 1;
+  extension_base_step(job, &base, &step);
+  return (Calc_frame_range(job->frames[0], frame, job->frames[2]) - 1) * step + base;
+}
+
+// --- The child side of rj_system -------------------------------------------
+// Between fork and exec only async-signal-safe calls: the daemon's heap and
+// stdio locks may be in any state in the copy.  Everything the child needs is
+// prepared by the parent.
+
+size_t put_text(char* buf, size_t size, size_t at, const char* text) {
+  if (text == nullptr) text = "(null)";
+  while (*text != '\0' && at + 1 < size) buf[at++] = *text++;
+  buf[at] = '\0';
+  return at;
+}
+
+struct ChildPlan {
+  char* const* argv;        // non-owning, built by the caller
+  const char* stream_path;  // non-owning
+  const char* out_path;     // non-owning
+  const char* workdir;      // non-owning; null: stay where the daemon is
+  const char* host;         // non-owning; the trace prefix
+  bool trace;
+};
+
+void child_trace(const ChildPlan& plan, const char* text) {
+  if (!plan.trace) return;
+  char line[1024];
+  size_t at = put_text(line, sizeof line, 0, plan.host);
+  at = put_text(line, sizeof line, at, ":\t");
+  at = put_text(line, sizeof line, at, text);
+  rj_write_all(STDERR_FILENO, line, at);
+}
+
+// Puts a fresh file on `target`.  The stream lives in a world-writable
+// temporary directory, so a planted symbolic link must not redirect it.
+bool child_reopen(const char* path, int target) {
+  if (path == nullptr) return false;
+  int fd;
+  do {
+    fd = open(path, O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0666);
+  } while (fd < 0 && errno == EINTR);
+  if (fd < 0) return false;
+  // dup2 leaves close-on-exec off on the target.
+  int ok = dup2(fd, target);
+  close(fd);
+  return ok >= 0;
+}
+
+[[noreturn]] void child_exec(const ChildPlan& plan) {
+  // Handlers are dropped by exec anyway, but ignored dispositions and the
+  // signal mask are inherited: the daemon keeps SIGALRM and SIGCHLD blocked
+  // outside its wait, and a render program must not start with them blocked.
+  struct sigaction dfl {};
+  dfl.sa_handler = SIG_DFL;
+  sigemptyset(&dfl.sa_mask);
+  for (int sig = 1; sig < NSIG; ++sig) {
+    if (sig == SIGKILL || sig == SIGSTOP) continue;
+    sigaction(sig, &dfl, nullptr);
+  }
+  sigset_t none;
+  sigemptyset(&none);
+  sigprocmask(SIG_SETMASK, &none, nullptr);
+
+  // Its own group, so that the program and whatever it starts can be told
+  // apart from the daemon's own process group.
+  setpgid(0, 0);
+
+  // The output path may be relative to the project directory: change first.
+  if (plan.workdir != nullptr) {
+    if (chdir(plan.workdir) != 0) {
+      // Stays in the daemon's directory, as a missing project directory did
+      // when the daemon changed directory itself.
+    }
+  }
+
+  char line[1024];
+  if (!child_reopen(plan.stream_path, STDERR_FILENO)) {
+    size_t at = put_text(line, sizeof line, 0, "eeeeeeeeeeeeeeeeeeeeeeee failed to reopen \"");
+    at = put_text(line, sizeof line, at, plan.stream_path);
+    put_text(line, sizeof line, at, "\" as stderr\n");
+    child_trace(plan, line);
+  }
+  if (!child_reopen(plan.out_path, STDOUT_FILENO)) {
+    size_t at = put_text(line, sizeof line, 0, "oooooooooooooooooooooooo failed to reopen \"");
+    at = put_text(line, sizeof line, at, plan.out_path);
+    put_text(line, sizeof line, at, "\" as stdout\n");
+    child_trace(plan, line);
+  }
+
+  execvp(plan.argv[0], plan.argv);
+
+  const char* reason = strerrordesc_np(errno);
+  if (reason == nullptr) reason = "Unknown error";
+  size_t at = put_text(line, sizeof line, 0, "system(\"");
+  at = put_text(line, sizeof line, at, plan.argv[0]);
+  at = put_text(line, sizeof line, at, "\") failed at exec <");
+  at = put_text(line, sizeof line, at, reason);
+  at = put_text(line, sizeof line, at, ">\n");
+  child_trace(plan, line);
+  rj_write_all(STDERR_FILENO, line, at);
+  rj_write_all(STDOUT_FILENO, line, at);
+  _exit(-1);
+}
+
+// The project directory of a scene path: everything before the character
+// that precedes the first "sdl" ("/proj/sdl/a.sdl" -> "/proj").  A path that
+// starts with "sdl" or holds none names no directory to change to.
+bool project_dir_of(const char* sdl, std::string* dir) {
+  if (sdl == nullptr) return false;
+  const char* hit = strstr(sdl, "sdl");
+  if (hit == nullptr || hit == sdl) return false;
+  dir->assign(sdl, static_cast<size_t>(hit - sdl - 1));
+  return true;
+}
+
+// The directory a job's render program runs in: its project directory when
+// that exists, else (false) wherever the daemon is.
+bool render_dir_of(const Job* job, std::string* dir) {
+  if (job == nullptr || !project_dir_of(job->sdl.c_str(), dir)) return false;
+  struct stat st;
+  return stat(dir->c_str(), &st) == 0 && S_ISDIR(st.st_mode);
+}
+
+}  // namespace
+
+int rj_splitpath(const char* path, char** base, char** dir, const char* last) {
+  if (base != nullptr) *base = nullptr;
+  if (dir != nullptr) *dir = nullptr;
+  if (path == nullptr) return 0;
+
+  std::string d;
+  std::string b;
+  const char* slash = strrchr(path, '/');
+  if (slash != nullptr) {
+    d.assign(path, static_cast<size_t>(slash - path));
+    b.assign(slash + 1);
+  } else {
+    d = ".";
+    b = path;
+  }
+
+  int stripped = 0;
+  if (last != nullptr && *last != '\0') {
+    size_t cut = d.rfind('/');
+    const char* component = cut == std::string::npos ? d.c_str() : d.c_str() + cut + 1;
+    if (strcmp(component, last) == 0) {
+      d = cut == std::string::npos ? std::string(".") : d.substr(0, cut);
+      stripped = 1;
+    }
+  }
+
+  if (base != nullptr) *base = MA_strdup(b.c_str(), __LINE__, kUnit);
+  if (dir != nullptr) *dir = MA_strdup(d.c_str(), __LINE__, kUnit);
+  return stripped;
+}
+
+void rj_set_paths(Job* job, char** path, char** root) {
+  if (path != nullptr) *path = nullptr;
+  if (root != nullptr) *root = nullptr;
+  if (job == nullptr || job->sdl.none()) return;
+  // path: the scene's own directory; root: the project directory, the one
+  // above the scene's "sdl" directory (the scene's directory when there is
+  // no such level).
+  if (path != nullptr) rj_splitpath(job->sdl.c_str(), nullptr, path, nullptr);
+  if (root != nullptr) rj_splitpath(job->sdl.c_str(), nullptr, root, "sdl");
+}
+
+int get_task_frame_range(TASK* entry, int* first_extension) {
+  if (entry == nullptr || entry->job == nullptr || entry->rec == nullptr) {
+    if (first_extension != nullptr) *first_extension = 0;
+    return 0;
+  }
+  const Job* job = entry->job;
+  const TaskRec* rec = entry->rec;
+  if (first_extension != nullptr) *first_extension = extension_of_frame(job, rec->start);
+  return Calc_frame_range(rec->start, rec->end, job->frames[2]);
+}
+
+int get_current_frame_extension(Job* job, Dev* dev, int* extension) {
+  for (TASK* entry = rndctl.tasks; entry != nullptr; entry = entry->next) {
+    if (entry->job != job || entry->rec == nullptr) continue;
+    if (entry->rec->dev != dev || entry->rec->status != TASK_RUNNING) continue;
+    set_image_percentage_done(entry);
+    if (extension != nullptr) *extension = extension_of_frame(job, entry->rec->current);
+    return 1;
+  }
+  return 0;
+}
+
+int rj_system(char* const argv[], const char* stream_path, const char* out_path, Job* job) {
+  if (argv == nullptr || argv[0] == nullptr) return -1;
+
+  // The render program finds its images through this; one entry per path,
+  // each after a space, so the value begins with a space.
+  std::string search;
+  if (job != nullptr) {
+    for (RndPathList* p = job->searchpath; p != nullptr; p = p->next) {
+      search += ' ';
+      search += p->path.or_else("");
+    }
+  }
+  setenv("ZARNO_PIX_SEARCHPATH", search.c_str(), 1);
+
+  // Only the child changes directory: the daemon holds relative paths.
+  std::string workdir;
+  bool change_dir = render_dir_of(job, &workdir);
+
+  ChildPlan plan{argv,
+                 stream_path,
+                 out_path,
+                 change_dir ? workdir.c_str() : nullptr,
+                 rndctl.host.or_else(""),
+                 debug != 0};
+
+  pid_t pid = fork();
+  if (pid == 0) child_exec(plan);
+  if (pid < 0) {
+    fprintf(stderr, "ERROR: Could not fork off\n");
+    fflush(stderr);
+    // Not counted: no child exists that the SIGCHLD side would ever reap.
+    return -1;
+  }
+  // The child makes itself the leader of its own group too; doing it here as
+  // well closes the window in which a kill of the group would find no group.
+  setpgid(pid, pid);
+  rndctl.running = rndctl.running + 1;
+  // Remembered outside the daemon, so that a daemon started after a crash
+  // of this one can end the render instead of letting it run unowned.
+  rj_render_started(pid);
+  return pid;
+}
+
+int Perform_a_Task(TASK* entry) {
+  if (entry == nullptr || entry->job == nullptr || entry->rec == nullptr) return 0;
+  Job* job = entry->job;
+  Dev* dev = entry->rec->dev;
+  if (job->name.none() || job->executable.none() || dev == nullptr || dev->name.none()) return 0;
+
+  dbgpnt("-----------------------------------Perform_a_Task( %d )\n", entry->rec->id);
+  dev->last_task = entry;
+
+  char* path = nullptr;
+  char* root = nullptr;
+  rj_set_paths(job, &path, &root);
+  dbgpnt("------ Perform_a_Task path: \"%s\", root: \"%s\"\n", path != nullptr ? path : "",
+         root != nullptr ? root : "");
+  MA_free(path, __LINE__, kUnit);
+  MA_free(root, __LINE__, kUnit);
+
+  char* pix_file = nullptr;
+  char* pix_dir = nullptr;
+  rj_splitpath(job->pix.c_str(), &pix_file, &pix_dir, "");
+  ScopedBlock pix_file_guard(pix_file);
+  ScopedBlock pix_dir_guard(pix_dir);
+  char out[4096];
+  snprintf(out, sizeof out, "%s/out.%s.%s.%s.%d", pix_dir != nullptr ? pix_dir : ".",
+           pix_file != nullptr ? pix_file : "", dev->host_name.or_else(""), dev->name.c_str(),
+           rndctl.out_counter);
+  // Wraps to 0 rather than going negative.
+  rndctl.out_counter = rndctl.out_counter == INT_MAX ? 0 : rndctl.out_counter + 1;
+  // The program opens its output from its own working directory; the
+  // daemon, which stays where it is, reads and removes the same file, so a
+  // relative path is anchored there for both.
+  std::string workdir;
+  if (out[0] != '/' && render_dir_of(job, &workdir)) {
+    if (workdir[0] != '/') {
+      char cwd[4096];
+      if (getcwd(cwd, sizeof cwd) != nullptr) workdir = std::string(cwd) + "/" + workdir;
+    }
+    entry->out_path.set((workdir + "/" + out).c_str());
+  } else {
+    entry->out_path.set(out);
+  }
+
+  int first_extension = 0;
+  get_task_frame_range(entry, &first_extension);
+
+  std::vector<std::string> args;
+  if (job->executable.is("edgepass")) {
+    args.emplace_back("shadepass");
+    args.emplace_back("-V");
+  } else if (job->executable.is("glintcast") || job->executable.is("glintwalk")) {
+    args.emplace_back(job->executable.c_str());
+    char processors[32];
+    snprintf(processors, sizeof processors, "-n%d", dev->num_processors);
+    args.emplace_back(processors);
+  } else {
+    args.emplace_back(job->executable.c_str());
+  }
+  args.emplace_back("-p");
+  args.emplace_back(job->pix.or_else(""));
+  if (job->output_mask != 0) {
+    args.emplace_back("-m");
+    args.emplace_back(job->matte.or_else(""));
+  }
+  args.emplace_back("-A");
+  if (job->animate != 0) {
+    float by = job->frames[2];
+    int by_int = static_cast<int>(by);
+    if (by_int == 0) by_int = by < 0.0f ? -1 : 1;
+    args.emplace_back("-s");
+    args.push_back(format_float(entry->rec->start));
+    args.emplace_back("-e");
+    args.push_back(format_float(entry->rec->end));
+    args.emplace_back("-b");
+    args.push_back(format_float(by));
+    if (job->extension != 0) {
+      args.emplace_back("-S");
+      args.push_back(format_int(first_extension));
+      args.emplace_back("-B");
+      args.push_back(format_int(job->ext_by));
+    } else if (static_cast<float>(by_int) != by) {
+      // Fractional steps cannot name files by frame number: number them.
+      args.emplace_back("-S");
+      args.push_back(format_int(first_extension));
+      args.emplace_back("-B");
+      args.push_back(format_int(by_int));
+    }
+    args.emplace_back("-E");
+    args.push_back(format_int(job->ext_size));
+  }
+  if (job->rnd_opts && job->rnd_opts.c_str()[strspn(job->rnd_opts.c_str(), " ")] != '\0') {
+    args.emplace_back(job->rnd_opts.c_str());
+  }
+  args.emplace_back(job->sdl.or_else(""));
+
+  std::vector<char*> argv;
+  argv.reserve(args.size() + 1);
+  for (std::string& a : args) argv.push_back(a.data());
+  argv.push_back(nullptr);
+
+  if (debug != 0) {
+    fprintf(stderr, "%s: ", rndctl.host.or_else(""));
+    for (const std::string& a : args) fprintf(stderr, "%s ", a.c_str());
+    fprintf(stderr, "\n");
+    fflush(stderr);
+  }
+
+  int pid = rj_system(argv.data(), entry->stream_path.c_str(), entry->out_path.c_str(), job);
+  entry->pid = pid;
+  dbgpnt("%s.%s = %d\n", job->name.c_str(), dev->name.c_str(), pid);
+  dbgpnt("---------------------------done----Perform_a_Task\n");
+  // A failed fork started nothing: the caller marks the task FAILED and it
+  // is put back for another try.
+  return pid > 0 ? 1 : 0;
+}
+
+FILE* Logfile_open_nr(Job* job) {
+  if (job == nullptr || job->name.none()) return nullptr;
+  char path[4096];
+  snprintf(path, sizeof path, "%s/JOBLOG/%s", rndctl.location.or_else("."), job->name.c_str());
+  return fopen(path, "re");
+}
+
+FILE* Logfile_open(Job* job) {
+  FILE* fp = Logfile_open_nr(job);
+  if (fp == nullptr) return nullptr;
+  // The header is four lines; the task lines follow.
+  char line[120];
+  for (int i = 0; i < 4; ++i) {
+    if (fgets(line, sizeof line, fp) == nullptr) break;
+  }
+  return fp;
+}
+
+void Job_Log_out(Job* job) {
+  if (job == nullptr || job->name.none()) return;
+  bool any = false;
+  for (TASK* entry = rndctl.tasks; entry != nullptr && !any; entry = entry->next) {
+    any = entry->job == job;
+  }
+  if (!any) return;
+
+  char path[4096];
+  snprintf(path, sizeof path, "%s/JOBLOG", rndctl.location.or_else("."));
+  mkdir(path, 0775);
+  snprintf(path, sizeof path, "%s/JOBLOG/%s", rndctl.location.or_else("."), job->name.c_str());
+  dbgpnt("%s (job index %d) using the %s\n", job->name.c_str(), job->index,
+         job->executable.or_else(""));
+  int fd;
+  do {
+    fd = open(path, O_RDWR | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0666);
+  } while (fd < 0 && errno == EINTR);
+  if (fd < 0) return;
+  ScopedFILE fp(fdopen(fd, "w+"));
+  if (!fp) {
+    close(fd);
+    return;
+  }
+
+  fprintf(fp.get(), "%s %d using the %s\n", job->name.c_str(), job->index,
+          job->executable.or_else(""));
+  fprintf(fp.get(), "\tsdl = \"%s\"\n", job->sdl.or_else(""));
+  fprintf(fp.get(), "\tframes = %f to %f by %f\n", static_cast<double>(job->frames[0]),
+          static_cast<double>(job->frames[1]), static_cast<double>(job->frames[2]));
+  if (job->extension != 0) {
+    fprintf(fp.get(), "\textension = %d by %d  size(%d)\n", job->ext_start, job->ext_by,
+            job->ext_size);
+  } else {
+    fprintf(fp.get(), "  no extension set\n");
+  }
+  for (TASK* entry = rndctl.tasks; entry != nullptr; entry = entry->next) {
+    if (entry->job != job || entry->rec == nullptr) continue;
+    const TaskRec* rec = entry->rec;
+    fprintf(fp.get(), "\t%d\t %f - %f\t%d - %d\t %s\t %s  %d\n", rec->id,
+            static_cast<double>(rec->start), static_cast<double>(rec->end),
+            extension_of_frame(job, rec->start), extension_of_frame(job, rec->end),
+            rec->dev != nullptr ? rec->dev->name.or_else("nodev") : "nodev",
+            status_name(rec->status), rec->retries);
+  }
+}
+
+int rj_kill_render(const char* host, int pid, int sig) {
+  if (pid < 2) return 0;
+  // Another host's render: RJ_signal says so in the trace and sends nothing.
+  if (host != nullptr && !rndctl.host.is(host)) return RJ_signal(host, pid, sig);
+  // The render program leads its own process group: whatever it started
+  // (a renderer behind a wrapper script, helpers) must go with it.
+  int result = kill(-pid, sig);
+  if (result != 0 && errno == ESRCH) result = kill(pid, sig);
+  dbgpnt("kill( %d, %d ) = %d(%d);\n", pid, sig, result, result != 0 ? errno : 0);
+  return result;
+}
+
+void daemon_kill_running_tasks(const char* host) {
+  if (host == nullptr) return;
+  for (TASK* entry = rndctl.tasks; entry != nullptr; entry = entry->next) {
+    if (entry->rec == nullptr || !rj_dev_on_host(entry->rec->dev, host)) continue;
+    rj_kill_render(host, entry->pid, 9);
+  }
+}

@@ -1,0 +1,375 @@
+// Taking back tasks whose render went away with its daemon: the put-back of
+// a held record, the start-up and exit cycles of this host, the heartbeat
+// that tells a dead host from a quiet one, and the render registry through
+// which a restarted daemon finds the renders of the one that crashed.
+#include "Utility/rndctl/tasks/rj_reclaim.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <climits>
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <map>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "General/pst/pst.h"
+#include "Utility/rndctl/base/rj_control.h"
+#include "Utility/rndctl/base/rj_log.h"
+#include "Utility/rndctl/base/rj_text.h"
+#include "Utility/rndctl/ctldir/rj_fileio.h"
+#include "Utility/rndctl/proc/rj_signal.h"
+#include "Utility/rndctl/records/rj_dev.h"
+#include "Utility/rndctl/records/rj_recindex.h"
+#include "Utility/rndctl/records/rj_records.h"
+#include "Utility/rndctl/tasks/rj_perform.h"
+#include "Utility/rndctl/tasks/rj_select.h"
+#include "Utility/rndctl/tasks/rj_task.h"
+#include "Utility/rndctl/tasks/rj_taskrec.h"
+#include "Utility/rndctl/tasks/rj_tskio.h"
+
+namespace {
+
+bool held(const TaskRec* rec) { return rec->status == TASK_STARTED || rec->status == TASK_RUNNING; }
+
+// One locked read-modify-write of the task file: every held record for which
+// `pick` says yes is put back.  The other hosts of each job touched are woken
+// once the lock is gone.
+template <class Pick>
+int put_back_cycle(Pick pick) {
+  std::vector<Job*> touched;
+  int count = 0;
+  (void)Task_file_rewrite([&](TaskGroup** groups) {  // a failure is reported there
+    for (TaskGroup* g = *groups; g != nullptr; g = g->next) {
+      // Remainders are appended at the tail; they are PENDING and not held.
+      for (TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
+        if (!held(rec) || !pick(g, rec)) continue;
+        Task_put_back(groups, g, rec);
+        ++count;
+        if (std::find(touched.begin(), touched.end(), g->job) == touched.end()) {
+          touched.push_back(g->job);
+        }
+      }
+    }
+    return count > 0;
+  });
+  for (Job* j : touched) Job_wake_other_hosts(j);
+  return count;
+}
+
+// The pid a host's pid file names; 0 when there is none.
+int pid_file_pid(const char* host) {
+  char path[PATH_MAX];
+  snprintf(path, sizeof path, "%s/%s.pid", rndctl.location.or_else("."), host);
+  int fd = open(path, O_RDONLY | O_CLOEXEC);
+  if (fd < 0) return 0;
+  int32_t pid = 0;
+  ssize_t n;
+  do n = read(fd, &pid, sizeof pid);
+  while (n < 0 && errno == EINTR);
+  close(fd);
+  return n == static_cast<ssize_t>(sizeof pid) ? pid : 0;
+}
+
+// The daemon-alive test.
+bool daemon_alive(const char* host) {
+  int pid = pid_file_pid(host);
+  if (pid == 0) return false;
+  if (RJ_signal(host, pid, 0) == 0) {
+    dbgpnt("process is alive --> %s:%d\n", host, pid);
+    return true;
+  }
+  dbgpnt("process is DEAD --> %s:%d\n", host, pid);
+  return false;
+}
+
+void heartbeat_path(char* out, size_t size, const char* host) {
+  snprintf(out, size, "%s/TSKSTAT/%s", rndctl.location.or_else("."), host);
+}
+
+// --- The render registry -----------------------------------------------------
+// Written from the SIGCHLD handler too: fixed storage, plain system calls.
+
+struct RenderSlot {
+  int pid;
+  unsigned long long start;
+};
+constexpr int kMaxRenders = 256;
+RenderSlot renders[kMaxRenders];
+int render_count = 0;
+
+// Field 22 of /proc/PID/stat: when the process started, in clock ticks since
+// boot.  A pid that was reused names a process with another start time.
+bool process_start_time(int pid, unsigned long long* start) {
+  char path[64];
+  snprintf(path, sizeof path, "/proc/%d/stat", pid);
+  int fd = open(path, O_RDONLY | O_CLOEXEC);
+  if (fd < 0) return false;
+  char buf[1024];
+  ssize_t n;
+  do n = read(fd, buf, sizeof buf - 1);
+  while (n < 0 && errno == EINTR);
+  close(fd);
+  if (n <= 0) return false;
+  buf[n] = '\0';
+  // The command name may hold blanks and parentheses: count from the last ')'.
+  const char* p = strrchr(buf, ')');
+  if (p == nullptr) return false;
+  ++p;
+  for (int field = 3; field <= 22; ++field) {
+    while (*p == ' ') ++p;
+    if (*p == '\0') return false;
+    if (field == 22) {
+      char* end = nullptr;
+      *start = strtoull(p, &end, 10);
+      return end != p;
+    }
+    while (*p != ' ' && *p != '\0') ++p;
+  }
+  return false;
+}
+
+// The temporary directory is writable by everyone: the registry is written
+// under a fresh name that a planted link cannot stand in for, then renamed
+// over whatever stands at its place (rename replaces a link, never follows it).
+void write_registry() {
+  const char* path = rj_render_registry_path();
+  char temp[PATH_MAX + 16];
+  snprintf(temp, sizeof temp, "%s.%d", path, static_cast<int>(getpid()));
+  unlink(temp);
+  int fd;
+  do fd = open(temp, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600);
+  while (fd < 0 && errno == EINTR);
+  if (fd < 0) return;
+  for (int i = 0; i < render_count; ++i) {
+    char line[64];
+    int n = snprintf(line, sizeof line, "%d %llu\n", renders[i].pid, renders[i].start);
+    if (n > 0) rj_write_all(fd, line, static_cast<size_t>(n));
+  }
+  close(fd);
+  if (rename(temp, path) != 0) unlink(temp);
+}
+
+}  // namespace
+
+const char* rj_render_registry_path() {
+  static char path[PATH_MAX];
+  snprintf(path, sizeof path, "%s/zarno_render_demon.%s.renders", rj_tmpdir(),
+           rndctl.host.or_else(""));
+  return path;
+}
+
+void rj_render_started(int pid) {
+  if (pid < 2 || render_count == kMaxRenders) return;
+  unsigned long long start = 0;
+  if (!process_start_time(pid, &start)) return;
+  renders[render_count++] = RenderSlot{pid, start};
+  write_registry();
+}
+
+void rj_render_ended(int pid) {
+  for (int i = 0; i < render_count; ++i) {
+    if (renders[i].pid != pid) continue;
+    renders[i] = renders[--render_count];
+    write_registry();
+    return;
+  }
+}
+
+int rj_render_kill_leftovers() {
+  const char* path = rj_render_registry_path();
+  int killed = 0;
+  int fd;
+  do fd = open(path, O_RDONLY | O_NOFOLLOW | O_CLOEXEC);
+  while (fd < 0 && errno == EINTR);
+  if (fd >= 0) {
+    // A list of pids to kill is believed only from ourselves.
+    struct stat st;
+    std::string text;
+    if (fstat(fd, &st) == 0 && S_ISREG(st.st_mode) && st.st_uid == geteuid() &&
+        (st.st_mode & 022) == 0) {
+      char chunk[4096];
+      for (;;) {
+        ssize_t n = read(fd, chunk, sizeof chunk);
+        if (n < 0 && errno == EINTR) continue;
+        if (n <= 0) break;
+        text.append(chunk, static_cast<size_t>(n));
+      }
+    } else {
+      dbgpnt("render registry %s not believed\n", path);
+    }
+    close(fd);
+    const char* p = text.c_str();
+    int pid = 0;
+    unsigned long long start = 0;
+    int used = 0;
+    while (sscanf(p, "%d %llu%n", &pid, &start, &used) == 2) {
+      p += used;
+      unsigned long long now_start = 0;
+      if (pid < 2 || pid == getpid() || !process_start_time(pid, &now_start) ||
+          now_start != start) {
+        continue;
+      }
+      // It leads its own group: whatever it started goes with it.
+      int r = kill(-pid, SIGKILL);
+      if (r != 0 && errno == ESRCH) r = kill(pid, SIGKILL);
+      dbgpnt("render %d left by an earlier daemon: kill = %d\n", pid, r);
+      if (r == 0) ++killed;
+    }
+  }
+  render_count = 0;
+  write_registry();
+  return killed;
+}
+
+TaskRec* Task_put_back(TaskGroup** groups, TaskGroup* group, TaskRec* rec) {
+  if (group == nullptr || rec == nullptr || group->job == nullptr) return nullptr;
+  const float by = group->job->frames[2];
+  dbgpnt("put back %d of \"%s\": %f %f %f %s\n", rec->id, group->job->name.or_else("noname"),
+         static_cast<double>(rec->start), static_cast<double>(rec->current),
+         static_cast<double>(rec->end), GetTaskStatusStr(rec->status));
+  if (by > 0.0f && rec->start < rec->current && rec->current <= rec->end) {
+    TaskRec* rest = insert_task(groups, group->job, rec->current, rec->end, TASK_PENDING);
+    if (rest != nullptr) {
+      rest->retries = rec->retries;
+      rec->status = TASK_FINISHED;
+      rec->end = rec->current - by;
+      rec->current = rec->end;
+      return rest;
+    }
+  }
+  rec->status = TASK_PENDING;
+  rec->current = rec->start;
+  rec->dev = nullptr;
+  return nullptr;
+}
+
+int Task_reclaim_this_host() {
+  int killed = rj_render_kill_leftovers();
+  int count =
+      put_back_cycle([](TaskGroup*, TaskRec* rec) { return rj_dev_is_this_host(rec->dev); });
+  dbgpnt("start-up: %d render(s) killed, %d task(s) put back\n", killed, count);
+  return count;
+}
+
+int Task_reclaim_dead_hosts(time_t server_now) {
+  const long bound = rj_host_timeout();
+  // One verdict per host and cycle; the alive test may run a remote probe.
+  struct Verdict {
+    bool dead;
+    long age;
+  };
+  std::map<std::string, Verdict> verdicts;
+  auto judge = [&](const char* host) -> Verdict {
+    auto it = verdicts.find(host);
+    if (it != verdicts.end()) return it->second;
+    Verdict v{false, 0};
+    char path[PATH_MAX];
+    heartbeat_path(path, sizeof path, host);
+    struct stat st;
+    // Without a heartbeat file the host runs a daemon that keeps none: leave
+    // it to a person's Task_file_check.
+    if (stat(path, &st) == 0) {
+      v.age = static_cast<long>(server_now - st.st_mtim.tv_sec);
+      v.dead = v.age > bound && !daemon_alive(host);
+    }
+    verdicts.emplace(host, v);
+    return v;
+  };
+  return put_back_cycle([&](TaskGroup* g, TaskRec* rec) {
+    if (rec->dev == nullptr || rec->dev->host_name.none() || rj_dev_is_this_host(rec->dev)) {
+      return false;
+    }
+    const char* host = rec->dev->host_name.c_str();
+    Verdict v = judge(host);
+    if (!v.dead) return false;
+    wrt_logfile("put back task %d of \"%s\" from host %s: no heartbeat for %ld seconds", rec->id,
+                g->job->name.or_else("noname"), host, v.age);
+    return true;
+  });
+}
+
+int Task_release_own_renders() {
+  const char* host = rndctl.host.c_str();
+  std::vector<std::pair<int, int>> mine;  // job index, record id
+  int killed = 0;
+  for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
+    if (e->job == nullptr || e->rec == nullptr || !rj_dev_is_this_host(e->rec->dev)) continue;
+    if (!held(e->rec)) continue;
+    if (e->pid >= 2 && rj_kill_render(host, e->pid, SIGKILL) == 0) ++killed;
+    mine.emplace_back(e->job->index, e->rec->id);
+  }
+  render_count = 0;
+  write_registry();
+
+  // A daemon that took the pid file over put back this host's records when
+  // it started and may be rendering them again under the same ids.
+  int owner = pid_file_pid(host);
+  if (owner != 0 && owner != rndctl.pid && RJ_signal(host, owner, 0) == 0) {
+    dbgpnt("exit: %d render(s) killed, records left to daemon %d\n", killed, owner);
+    return killed;
+  }
+  int count = 0;
+  if (!mine.empty()) {
+    count = put_back_cycle([&](TaskGroup* g, TaskRec* rec) {
+      if (!rj_dev_is_this_host(rec->dev)) return false;
+      for (const auto& [index, id] : mine) {
+        if (index == g->job->index && id == rec->id) return true;
+      }
+      return false;
+    });
+  }
+  dbgpnt("exit: %d render(s) killed, %d task(s) put back\n", killed, count);
+  return killed;
+}
+
+time_t rj_heartbeat() {
+  const char* host = rndctl.host.c_str();
+  if (host == nullptr) return 0;
+  char path[PATH_MAX];
+  snprintf(path, sizeof path, "%s/TSKSTAT", rndctl.location.or_else("."));
+  if (mkdir(path, 0775) != 0 && errno != EEXIST) return 0;
+  heartbeat_path(path, sizeof path, host);
+  // Never truncated here: the file also lists this host's tasks.
+  int fd;
+  do fd = open(path, O_WRONLY | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0666);
+  while (fd < 0 && errno == EINTR);
+  if (fd < 0) return 0;
+  // Null times: the file server stamps its own clock, the one every host's
+  // heartbeat is judged by.
+  struct stat st;
+  bool ok = futimens(fd, nullptr) == 0 && fstat(fd, &st) == 0;
+  close(fd);
+  return ok ? st.st_mtim.tv_sec : 0;
+}
+
+long rj_host_timeout() {
+  const char* text = getenv("ZARNO_RNDCTL_HOST_TIMEOUT");
+  if (text == nullptr || *text == '\0') {
+    // Asked once a minute: a farm without a preferences file would have the
+    // lookup's complaint in the log each time.
+    const char* prefs = find_variable_file(0, nullptr, nullptr);
+    text = prefs != nullptr && *prefs != '\0' && access(prefs, R_OK) == 0
+               ? get_zarno_variable("ZARNO_RNDCTL_HOST_TIMEOUT")
+               : nullptr;
+  }
+  if (text != nullptr) {
+    char* end = nullptr;
+    long value = strtol(text, &end, 10);
+    if (end != text && value > 0) return value;
+  }
+  return 600;
+}
+
+bool rj_update_time_settled(int64_t seen_ns, time_t server_now) {
+  constexpr int64_t kSecond = 1000000000;
+  if (seen_ns <= 0 || seen_ns % kSecond != 0) return true;
+  return static_cast<int64_t>(server_now) > seen_ns / kSecond;
+}

@@ -1,0 +1,79 @@
+#pragma once
+
+#include <cstdint>
+#include <ctime>
+
+#include "Utility/rndctl/tasks/rj_taskrec.h"
+
+// ---------------------------------------------------------------------------
+// Taking back tasks whose render went away with its daemon (rj_reclaim).
+//
+// A daemon that is killed, loses its host for good or exits leaves records
+// STARTED or RUNNING in Render_Tasks that nobody renders, and a STARTED record
+// of a host holds one of its slots.  Such a record is put back the way a
+// failed task is cut: the frames before `current` stay done, the rest is
+// pending again.  `retries` is not counted up: the daemon failed, not the task.
+//
+// The daemon's calling order: Task_reclaim_this_host once at start-up, after
+// the first load of the control files and before the first pass (only then
+// does no process of this host render anything); rj_heartbeat at every pass
+// and every wake-up; Task_reclaim_dead_hosts from the service loop, about once
+// a minute and never while holding another lock; Task_release_own_renders
+// before a clean exit.  rj_system and the SIGCHLD handler keep the render
+// registry up to date with rj_render_started / rj_render_ended.
+
+/// Puts a held record of `group` (a group read from the task file) back.
+/// With progress (start < current <= end) `rec` becomes FINISHED
+/// start..current-by and a new PENDING record current..end with the group's
+/// next id and the same retries is appended; it is returned.  Without
+/// progress `rec` itself goes PENDING with its range and null is returned.
+/// A record put back pending names no host, so no host is barred from it.
+TaskRec* Task_put_back(TaskGroup** groups, TaskGroup* group, TaskRec* rec);
+
+/// Start-up: ends every render of the registry that a dead predecessor left
+/// running (rj_render_kill_leftovers), then puts back, in one locked cycle,
+/// every STARTED or RUNNING record of this host and wakes the other hosts of
+/// each job touched.  Returns the number of records put back.
+int Task_reclaim_this_host();
+
+/// Puts back every record held by another host whose heartbeat is older than
+/// rj_host_timeout() seconds by the file server's clock `server_now` (from
+/// rj_heartbeat) and whose daemon the daemon-alive test finds gone; one
+/// access-log line per record.  A host without a heartbeat file is not
+/// judged.  Returns the number of records put back.
+int Task_reclaim_dead_hosts(time_t server_now);
+
+/// Clean exit: kills the render process groups this daemon still runs and
+/// puts their records back, unless the pid file already names another live
+/// daemon (which took this host's records over when it started).  Returns
+/// the number of renders killed.
+int Task_release_own_renders();
+
+/// The heartbeat: touches "%s/TSKSTAT/%s" (created empty when missing) to the
+/// file server's time and returns its new modification time in seconds, or
+/// 0 when it cannot be touched.
+time_t rj_heartbeat();
+
+/// How long a host's heartbeat may age, in seconds: the environment variable
+/// ZARNO_RNDCTL_HOST_TIMEOUT, else that preference, else 600.
+long rj_host_timeout();
+
+/// Whether an update time `seen_ns` read by a reload may count as seen when
+/// the file server's clock reads `server_now`: false while a whole-second
+/// stamp (no nanoseconds) and the clock are still in the same second, since
+/// a second touch in that second would leave the same stamp.
+bool rj_update_time_settled(int64_t seen_ns, time_t server_now);
+
+/// The render registry: pid and start time of every render program this
+/// daemon runs, in "%s/zarno_render_demon.%s.renders" (rj_tmpdir(), host),
+/// rewritten whole through a fresh name and a rename at every change.
+/// rj_render_ended is safe in the SIGCHLD handler (no allocation, no stdio).
+void rj_render_started(int pid);
+void rj_render_ended(int pid);
+/// Kills (SIGKILL to the process group) every render of the registry file
+/// that still runs with the recorded start time, then starts an empty
+/// registry.  A file that is not a regular file of this user, or that others
+/// may write, is not believed.  Returns the number of renders killed.
+int rj_render_kill_leftovers();
+/// The registry's path (a static buffer).
+const char* rj_render_registry_path();
