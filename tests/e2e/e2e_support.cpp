@@ -145,8 +145,10 @@ Daemon& Farm::start(const std::vector<std::string>& args, const std::string& hos
     if (fd >= 0) {
       dup2(fd, 1);
       dup2(fd, 2);
-      close(fd);
     }
+    // The daemon starts as from a boot script, with the three streams only:
+    // what the test runner holds open is not the daemon's to pass on.
+    for (int other = 3; other < 1024; ++other) close(other);
     std::vector<char*> cargv;
     for (auto& a : argv) cargv.push_back(a.data());
     cargv.push_back(nullptr);

@@ -4,7 +4,6 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-
 #include "tests/e2e/render_farm.h"
 
 namespace {
@@ -198,56 +197,6 @@ TEST_F(RenderTest, AnImmediateJobRunsBesideARunningOneWhileOthersWait) {
   EXPECT_NE(job_status(farm_, "later"), "finished");
   ASSERT_TRUE(status_becomes(d, "later", "finished")) << d.log();
   EXPECT_TRUE(exists(image("busy", 3)));
-}
-
-TEST_F(RenderTest, AScheduledJobStartsOnlyInItsHours) {
-  if (system("command -v faketime >/dev/null 2>&1") != 0)
-    GTEST_SKIP() << "faketime is not installed";
-  JobSpec nightly = job("nightly", 1, 1, 2);
-  nightly.ctrl = "SCHEDULE";
-  nightly.runs = "\t{ 800 to 900 Monday }";
-  JobSpec ordinary = job("ordinary", 2, 1, 2);
-  ordinary.priority = 1;
-  std::vector<std::string> env = {"TZ=UTC", "ASAN_OPTIONS=verify_asan_link_order=0:detect_leaks=0"};
-
-  // Sunday noon: outside the job's hours; the ordinary job shows that the
-  // daemon does work.
-  farm_.set_wrapper({"/usr/bin/faketime", "2026-11-22 12:00:00"});
-  Daemon& sunday = start({here(3, 1)}, {nightly, ordinary}, env);
-  ASSERT_TRUE(status_becomes(sunday, "ordinary", "finished")) << sunday.log();
-  for (int i = 0; i < 3; ++i) {
-    sunday.wake();
-    usleep(50000);
-  }
-  EXPECT_FALSE(exists(image("nightly", 1)));
-  EXPECT_EQ(job_status(farm_, "nightly"), "pending");
-  sunday.stop();
-  // The next daemon refuses to start while the pid file names a live one.
-  int old_pid = read_pid_file(farm_.path(host_ + ".pid"));
-  ASSERT_TRUE(wait_for([&] { return old_pid == 0 || kill(old_pid, 0) != 0; }, 20));
-
-  // Monday 8:15: inside them.
-  farm_.set_wrapper({"/usr/bin/faketime", "2026-11-23 08:15:00"});
-  std::vector<std::string> all = render_env();
-  for (const auto& e : env) all.push_back(e);
-  Daemon& monday = farm_.start_on_farm({}, "", all);
-  ASSERT_TRUE(status_becomes(monday, "nightly", "finished")) << monday.log();
-  EXPECT_TRUE(exists(image("nightly", 2)));
-}
-
-TEST_F(RenderTest, APausedJobStartsNothingUntilItIsReleased) {
-  JobSpec paused = job("held", 1, 1, 2);
-  paused.ctrl = "PAUSED";
-  JobSpec ordinary = job("ordinary", 2, 1, 2);
-  ordinary.priority = 1;
-  Daemon& d = start({here(3, 1)}, {paused, ordinary});
-  ASSERT_TRUE(status_becomes(d, "ordinary", "finished")) << d.log();
-  EXPECT_FALSE(exists(image("held", 1)));
-  EXPECT_EQ(job_status(farm_, "held"), "pending");
-
-  ASSERT_TRUE(edit_job_file(farm_, "\tctrl\t\t= PAUSED;\n", "", host_));
-  ASSERT_TRUE(status_becomes(d, "held", "finished")) << d.log();
-  EXPECT_TRUE(exists(image("held", 2)));
 }
 
 }  // namespace

@@ -74,7 +74,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
       abort();
     }
   }
-  if (Tpst_get_value(table, "NOT_IN_THE_FILE_", 0) != nullptr && expected.count("NOT_IN_THE_FILE_") == 0)
+  if (Tpst_get_value(table, "NOT_IN_THE_FILE_", 0) != nullptr &&
+      expected.count("NOT_IN_THE_FILE_") == 0)
     abort();
   Tpst_delete(table);
 
