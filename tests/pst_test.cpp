@@ -165,29 +165,4 @@ TEST_F(PstTest, DefaultProjectComesFromTheBrowserFileNeverThePrefs) {
   EXPECT_EQ(lookup("ZARNO_DEFAULT_PROJECT"), "second");
 }
 
-TEST_F(PstTest, ProfileLinesAndComments) {
-  std::string p = site_ + "/profile";
-  ASSERT_TRUE(write_text_file(p,
-                              "   # comment \"x\"\n"
-                              "A \"one\"\n"
-                              "B\t\"has \"inner\" quotes\"\n"
-                              "A \"two\"\n"
-                              "NOQUOTE value\n"
-                              "C \"unterminated\n"
-                              "LONG \"" +
-                                  std::string(5000, 'x') +
-                                  "\"\n"
-                                  "D \"last line without newline\""));
-  TpstTable* t = Tpst_read(p.c_str());
-  ASSERT_NE(t, nullptr);
-  EXPECT_STREQ(Tpst_get_value(t, "A", 0), "two");
-  EXPECT_STREQ(Tpst_get_value(t, "B", 0), "has \"inner\" quotes");
-  EXPECT_EQ(Tpst_get_value(t, "NOQUOTE", 0), nullptr);
-  EXPECT_EQ(Tpst_get_value(t, "C", 0), nullptr);
-  EXPECT_EQ(Tpst_get_value(t, "LONG", 0), nullptr);
-  EXPECT_STREQ(Tpst_get_value(t, "D", 0), "last line without newline");
-  Tpst_delete(t);
-  EXPECT_EQ(Tpst_read((site_ + "/absent").c_str()), nullptr);
-}
-
 }  // namespace

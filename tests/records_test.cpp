@@ -7,21 +7,6 @@
 
 namespace {
 
-template <class T>
-std::vector<int> order(T* head) {
-  std::vector<int> v;
-  for (; head != nullptr; head = head->next) v.push_back(head->index);
-  return v;
-}
-
-// Back links must mirror forward links, or deletes corrupt the list.
-template <class T>
-void expect_back_links(T* head) {
-  for (T* prev = nullptr; head != nullptr; prev = head, head = head->next) {
-    EXPECT_EQ(head->prev, prev);
-  }
-}
-
 class RecordsTest : public ControlDirTest {};
 
 }  // namespace
@@ -50,29 +35,6 @@ TEST_F(RecordsTest, NewRecordsTakeTheirNamesFromWhatTheyAreGiven) {
   EXPECT_TRUE(Dev_new(nullptr, nullptr, nullptr, 9)->name.none());
 }
 
-TEST_F(RecordsTest, JobListOrderInsertAndDelete) {
-  Job* a = Job_new(nullptr, nullptr, "a", 1);
-  Job* b = Job_new(nullptr, nullptr, "b", 2);
-  Job_new(a, nullptr, "head", 3);  // before the head: becomes the head
-  Job_new(b, nullptr, "mid", 4);   // before an inner job
-  EXPECT_EQ(order(rndctl.jobs), (std::vector<int>{3, 1, 4, 2}));
-  expect_back_links(rndctl.jobs);
-
-  // Deleting returns the job before, else the one after.
-  EXPECT_EQ(Job_del(b)->index, 4);
-  EXPECT_EQ(Job_del(rndctl.jobs)->index, 1);  // the head: its successor
-  EXPECT_EQ(order(rndctl.jobs), (std::vector<int>{1, 4}));
-  expect_back_links(rndctl.jobs);
-  // Appending after deletes lands at the real tail.
-  Job_new(nullptr, nullptr, "c", 5);
-  EXPECT_EQ(order(rndctl.jobs), (std::vector<int>{1, 4, 5}));
-  Job_del(Job_by_index(5));
-  Job_del(Job_by_index(4));
-  EXPECT_EQ(Job_del(rndctl.jobs), nullptr);  // the only job
-  EXPECT_EQ(rndctl.jobs, nullptr);
-  EXPECT_EQ(Job_del(nullptr), nullptr);
-}
-
 TEST_F(RecordsTest, AddFindsByIndexAndLookupsReturnFirstMatch) {
   Job* a = Add_a_job(nullptr, "shot", 7);
   a->priority = 5;
@@ -98,26 +60,6 @@ TEST_F(RecordsTest, AddFindsByIndexAndLookupsReturnFirstMatch) {
   int item[4] = {};
   Job* listed = Job_new(nullptr, item, "listed", 8);
   EXPECT_EQ(Job_by_listitem(item), listed);
-}
-
-TEST_F(RecordsTest, ResourceListAndRename) {
-  Dev* a = Add_a_dev(nullptr, "a", 1);
-  Dev* b = Add_a_dev(nullptr, "b", 2);
-  EXPECT_EQ(Add_a_dev(nullptr, "zz", 1), a);
-  Dev* head = Insert_a_dev(a, nullptr, "head", 3);
-  EXPECT_EQ(order(rndctl.devs), (std::vector<int>{3, 1, 2}));
-  expect_back_links(rndctl.devs);
-
-  Dev_set_name(b, "a");  // two resources called a: the first wins
-  EXPECT_EQ(Dev_by_name("a"), a);
-  EXPECT_EQ(Dev_by_name("b"), nullptr);
-  Dev_del(a);
-  EXPECT_EQ(Dev_by_name("a"), b);
-  // A name set behind the table's back is still found.
-  head->name.set("renamed");
-  EXPECT_EQ(Dev_by_name("renamed"), head);
-  EXPECT_EQ(Dev_del(head), b);
-  EXPECT_EQ(rndctl.devs, b);
 }
 
 TEST_F(RecordsTest, PickListsStayMirrored) {
@@ -159,73 +101,6 @@ TEST_F(RecordsTest, PickListsStayMirrored) {
   EXPECT_EQ(job->resources->dev, b);
   Job_del(job);
   EXPECT_EQ(b->jobs, nullptr);
-}
-
-// Appends go through the tail each list keeps: after any mix of adds and
-// deletes (head, middle, tail, the only entry, a clone's own lists) every
-// list must still end where its tail says and hold what a plain model holds.
-template <class E>
-void expect_tail(E* head, E* tail) {
-  expect_back_links(head);
-  E* last = nullptr;
-  for (E* e = head; e != nullptr; e = e->next) last = e;
-  EXPECT_EQ(tail, last);
-}
-
-TEST_F(RecordsTest, ListsAppendAtTheirTailAfterAnyDelete) {
-  Dev* host = Dev_new(nullptr, nullptr, "host", 1);
-  Dev* other = Dev_new(nullptr, nullptr, "other", 2);
-  Job* job = Job_new(nullptr, nullptr, "j", 1);
-  std::vector<int> jobs_model;
-  std::vector<std::string> paths_model;
-  unsigned seed = 7;
-  auto next = [&seed](unsigned n) { return (seed = seed * 1103515245u + 12345u) / 65536u % n; };
-  for (int step = 0; step < 400; ++step) {
-    if (next(3) != 0 || jobs_model.empty()) {
-      int index = step + 10;
-      RndDevList_add(Job_new(nullptr, nullptr, "j", index), host);
-      jobs_model.push_back(index);
-      std::string p = "/p/" + std::to_string(step);
-      RndPathList_add(job, p.c_str());
-      paths_model.push_back(p);
-    } else {
-      size_t at = next(static_cast<unsigned>(jobs_model.size()));
-      Job_del(Job_by_index(jobs_model[at]));
-      jobs_model.erase(jobs_model.begin() + static_cast<long>(at));
-      RndPathList_del(job, paths_model[at].c_str());
-      paths_model.erase(paths_model.begin() + static_cast<long>(at));
-    }
-    expect_tail(host->jobs, host->jobs_tail);
-    expect_tail(job->searchpath, job->searchpath_tail);
-  }
-  std::vector<int> seen;
-  for (RndJobList* e = host->jobs; e != nullptr; e = e->next) seen.push_back(e->job->index);
-  EXPECT_EQ(seen, jobs_model);
-  std::vector<std::string> paths;
-  for (RndPathList* p = job->searchpath; p != nullptr; p = p->next)
-    paths.push_back(p->path.c_str());
-  EXPECT_EQ(paths, paths_model);
-
-  // A job's resource list down to nothing and back; a clone owns its lists.
-  RndDevList_add(job, host);
-  RndDevList_add(job, other);
-  RndDevList_del(job, other);
-  RndDevList_del(job, host);
-  EXPECT_TRUE(job->resources == nullptr && job->resources_tail == nullptr);
-  RndDevList_add(job, other);
-  Job* copy = Job_clone(job);
-  ASSERT_NE(copy, nullptr);
-  RndPathList_add(copy, "/copy");
-  RndDevList_add(copy, host);
-  expect_tail(job->searchpath, job->searchpath_tail);
-  expect_tail(copy->searchpath, copy->searchpath_tail);
-  expect_tail(copy->resources, copy->resources_tail);
-  EXPECT_STREQ(copy->searchpath_tail->path.c_str(), "/copy");
-  EXPECT_EQ(job->resources_tail->dev, other);
-  Dev_del(other);
-  expect_tail(job->resources, job->resources_tail);
-  expect_tail(copy->resources, copy->resources_tail);
-  EXPECT_EQ(job->resources, nullptr);
 }
 
 TEST(StateWords, DecodeCaseSensitively) {

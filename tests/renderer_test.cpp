@@ -1,5 +1,5 @@
-// The demo renderer, run as the daemon runs it: a real process in a project
-// directory, its images checked byte by byte by an independent PNG reader.
+// The demo renderer's command-line contract and fault switches, run as the
+// daemon runs it: a real process in a project directory.
 
 #include <dirent.h>
 #include <fcntl.h>
@@ -12,7 +12,6 @@
 #include <algorithm>
 #include <cstdio>
 #include <cstring>
-#include <set>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -33,71 +32,6 @@ struct Outcome {
   std::string out, err;
   bool exited(int code) const { return WIFEXITED(status) && WEXITSTATUS(status) == code; }
 };
-
-// Bitwise on purpose: a second, table-free implementation to check against.
-uint32_t crc32_bitwise(const uint8_t* p, size_t n) {
-  uint32_t c = 0xFFFFFFFFu;
-  for (size_t i = 0; i < n; i++) {
-    c ^= p[i];
-    for (int k = 0; k < 8; k++) c = (c >> 1) ^ (0xEDB88320u & (0u - (c & 1)));
-  }
-  return ~c;
-}
-
-uint32_t be32(const uint8_t* p) {
-  return (uint32_t{p[0]} << 24) | (uint32_t{p[1]} << 16) | (uint32_t{p[2]} << 8) | p[3];
-}
-
-struct Png {
-  uint32_t width = 0, height = 0;
-  int colour = -1;
-  std::vector<uint8_t> rows;  // filter bytes included
-};
-
-// Reads a PNG made of stored deflate blocks; "" on success, else what is wrong.
-std::string read_png(const std::string& path, Png* png) {
-  std::string bytes = read_text_file(path);
-  const auto* d = reinterpret_cast<const uint8_t*>(bytes.data());
-  size_t n = bytes.size();
-  static const uint8_t kSig[8] = {0x89, 'P', 'N', 'G', '\r', '\n', 0x1A, '\n'};
-  if (n < 8 || memcmp(d, kSig, 8) != 0) return "bad signature";
-  std::vector<uint8_t> z;
-  Strings order;
-  for (size_t p = 8; p < n; p += 12 + be32(d + p)) {
-    if (p + 12 > n || p + 12 + be32(d + p) > n) return "truncated chunk";
-    uint32_t len = be32(d + p);
-    std::string type(reinterpret_cast<const char*>(d + p + 4), 4);
-    if (crc32_bitwise(d + p + 4, len + 4) != be32(d + p + 8 + len)) return "bad CRC in " + type;
-    if (type == "IHDR") {
-      if (len != 13 || d[p + 16] != 8) return "IHDR length or bit depth";
-      png->width = be32(d + p + 8);
-      png->height = be32(d + p + 12);
-      png->colour = d[p + 17];
-    }
-    if (type == "IDAT") z.insert(z.end(), d + p + 8, d + p + 8 + len);
-    order.push_back(type);
-  }
-  if (order.empty() || order.front() != "IHDR" || order.back() != "IEND") return "chunk order";
-  if (z.size() < 6 || z[0] != 0x78 || ((z[0] << 8) | z[1]) % 31 != 0) return "zlib header";
-  size_t p = 2;
-  for (bool last = false; !last; p += 5 + (z[p + 1] | (z[p + 2] << 8))) {
-    if (p + 5 > z.size()) return "truncated deflate block";
-    last = z[p] & 1;
-    if ((z[p] >> 1) != 0) return "not a stored block";
-    uint16_t len = static_cast<uint16_t>(z[p + 1] | (z[p + 2] << 8));
-    if (static_cast<uint16_t>(~len) != static_cast<uint16_t>(z[p + 3] | (z[p + 4] << 8)))
-      return "NLEN";
-    if (p + 5 + len > z.size()) return "stored block runs past the end";
-    png->rows.insert(png->rows.end(), z.begin() + p + 5, z.begin() + p + 5 + len);
-  }
-  if (p + 4 != z.size()) return "trailing bytes after the deflate data";
-  uint32_t a = 1, b = 0;
-  for (uint8_t c : png->rows) a = (a + c) % 65521, b = (b + a) % 65521;
-  if (((b << 16) | a) != be32(&z[p])) return "Adler-32";
-  size_t channels = png->colour == 2 ? 3 : 1;
-  if (png->rows.size() != (png->width * channels + 1) * png->height) return "data size";
-  return "";
-}
 
 Strings split_lines(const std::string& text) {
   Strings lines;
@@ -182,7 +116,7 @@ struct NamingCase {
 
 class RendererNaming : public RendererTest, public ::testing::WithParamInterface<NamingCase> {};
 
-TEST_P(RendererNaming, WritesOneValidDistinctPngPerFrameUnderItsExtension) {
+TEST_P(RendererNaming, WritesOneImagePerFrameUnderItsExtension) {
   ASSERT_TRUE(write_text_file(project_ + "/sdl/still.sdl", "animation = OFF;\nsize = 32x24;\n"));
   Strings args = {"-p", "pix/ball"};
   args.insert(args.end(), GetParam().args.begin(), GetParam().args.end());
@@ -191,17 +125,6 @@ TEST_P(RendererNaming, WritesOneValidDistinctPngPerFrameUnderItsExtension) {
   EXPECT_FALSE(has_error_line(r.out + r.err));
   // Exactly the frames, nothing else: no temporaries left beside them.
   ASSERT_EQ(pix_files(), GetParam().images);
-
-  std::vector<std::vector<uint8_t>> seen;
-  for (const std::string& name : GetParam().images) {
-    Png png;
-    ASSERT_EQ(read_png(pix(name), &png), "") << name;
-    EXPECT_EQ(png.width, 32u);
-    EXPECT_EQ(png.height, 24u);
-    EXPECT_EQ(png.colour, 2);
-    for (const auto& earlier : seen) EXPECT_NE(earlier, png.rows) << name << " repeats a frame";
-    seen.push_back(png.rows);
-  }
 }
 
 // The first case is the daemon's own shape for a shading program, with flags
@@ -242,10 +165,6 @@ INSTANTIATE_TEST_SUITE_P(Ranges, RendererFrameCount,
 TEST_F(RendererTest, ProgressLinesGiveTheDaemonTheLinesDone) {
   Outcome r = render(ball("3", "2", "size=8x5"));
   ASSERT_TRUE(r.exited(0)) << r.err;
-  Png png;
-  ASSERT_EQ(read_png(pix("ball.02"), &png), "");
-  EXPECT_EQ(png.width, 8u);
-  EXPECT_EQ(png.height, 5u);
 
   Strings lines = split_lines(r.err);
   ASSERT_EQ(lines.size(), 15u) << r.err;
@@ -327,45 +246,6 @@ INSTANTIATE_TEST_SUITE_P(BadInvocations, RendererRefuses, testing::Values(
     Strings{"-p", "pix/ball", "die_at=3", "sdl/scene.sdl"},
     Strings{"-p", "pix/ball", "a=1", "b=2", "sdl/scene.sdl"}));
 // clang-format on
-
-TEST_F(RendererTest, MatteCoversTheBallOnly) {
-  Strings args = ball("2", "1");
-  args.insert(args.begin() + 2, {"-m", "pix/matte"});
-  Outcome r = render(args);
-  ASSERT_TRUE(r.exited(0)) << r.err;
-  Png m1, m2;
-  ASSERT_EQ(read_png(pix("matte.1"), &m1), "");
-  ASSERT_EQ(read_png(pix("matte.2"), &m2), "");
-  EXPECT_EQ(m1.colour, 0);
-  std::set<uint8_t> values(m1.rows.begin(), m1.rows.end());
-  EXPECT_TRUE(values.count(0) && values.count(255));
-  EXPECT_NE(m1.rows, m2.rows);
-}
-
-TEST_F(RendererTest, FieldsRenderTheSecondFieldHalfAFrameLater) {
-  // Same frame, progressive and interlaced: the odd (first) lines agree,
-  // the even lines show the ball moved on.
-  ASSERT_TRUE(write_text_file(project_ + "/sdl/fields.sdl",
-                              std::string(kScene) + "fields = TRUE;\nodd = TRUE;\n"));
-  ASSERT_TRUE(
-      render({"-p", "pix/prog", "-s", "4", "-e", "4", "-b", "1", "-E", "1", "sdl/scene.sdl"})
-          .exited(0));
-  ASSERT_TRUE(
-      render({"-p", "pix/inter", "-s", "4", "-e", "4", "-b", "1", "-E", "1", "sdl/fields.sdl"})
-          .exited(0));
-  Png prog, inter;
-  ASSERT_EQ(read_png(pix("prog.4"), &prog), "");
-  ASSERT_EQ(read_png(pix("inter.4"), &inter), "");
-  size_t row = prog.width * 3 + 1;
-  bool even_differ = false;
-  for (size_t y = 0; y < prog.height; y++) {
-    bool same = std::equal(prog.rows.begin() + y * row, prog.rows.begin() + (y + 1) * row,
-                           inter.rows.begin() + y * row);
-    EXPECT_TRUE(same || y % 2 == 1) << "row " << y;
-    even_differ |= !same;
-  }
-  EXPECT_TRUE(even_differ);
-}
 
 TEST_F(RendererTest, ShippedDemoSceneRendersFromItsProjectDirectory) {
   Outcome r = render({"-p", project_ + "/pix/demo", "-s", "1", "-e", "2", "-b", "1", "-E", "4",

@@ -107,14 +107,6 @@ INSTANTIATE_TEST_SUITE_P(
         BlockCase{"first_half_hour", {{0, 30, "sunday", "sunday"}}, 1, {"{ 0 to 30 Sunday }"}}),
     [](const auto& info) { return std::string(info.param.what); });
 
-TEST(ScheduleTables, DayWords) {
-  EXPECT_EQ(Schedule_get_day(nullptr), nullptr);
-  // Abbreviations are matched exactly; an empty word counts as Sunday.
-  EXPECT_EQ(get_abbreviated_day_index("Sat"), 6);
-  EXPECT_EQ(get_abbreviated_day_index(""), 0);
-  EXPECT_EQ(get_abbreviated_day_index("sat"), -1);
-}
-
 TEST_F(ScheduleTest, ClockPosition) {
   at(1, 8, 45);
   EXPECT_EQ(get_current_schedule_index(), 65);

@@ -129,15 +129,4 @@ TEST_F(SignalTest, TimedPauseEndsAtItsLimitOrOnASignalThatCameWhileBlocked) {
   EXPECT_EQ(last_signal, SIGALRM);
   signal(SIGALRM, SIG_DFL);
 }
-
-TEST(SignalDescriptions, TableAndFallback) {
-  EXPECT_STREQ(RGget_sig_desc(1), "recieved SIGHUP (Hangup)");
-  EXPECT_STREQ(RGget_sig_desc(9), "SIGKILL (Killed)");
-  EXPECT_STREQ(RGget_sig_desc(16), "SIGUSR1 (out of vertual mem)");
-  EXPECT_STREQ(RGget_sig_desc(31), "SIGXFSZ File size limit exceeded Core Dumped");
-  for (int sig : {0, 5, 20, 22, 25, 30, 32, 40, -1}) {
-    EXPECT_STREQ(RGget_sig_desc(sig), "Unrecognized SIGNAL") << sig;
-  }
-}
-
 }  // namespace

@@ -285,52 +285,6 @@ TEST_P(DaemonAlive, TasksOfADeadDaemonGoBackToPending) {
 
 INSTANTIATE_TEST_SUITE_P(PidFiles, DaemonAlive, testing::Values(0, 1, 2));
 
-TEST_F(TaskFileTest, EditorLoadMirrorsEveryRecordInEntries) {
-  entry(alpha_, 9, here_, TASK_RUNNING);  // an old entry: replaced
-  write_file("Render_Tasks", kAlpha + kBeta);
-  Editor_load_Tasks();
-  int n = 0;
-  for (TASK* e = rndctl.tasks; e != nullptr; e = e->next, ++n) {
-    ASSERT_NE(e->rec, nullptr);
-    EXPECT_EQ(e->rec->task, e);
-    EXPECT_EQ(e->rec->group, nullptr);
-  }
-  EXPECT_EQ(n, 3);
-  // In reverse file order: beta's record first.
-  EXPECT_EQ(rndctl.tasks->job, beta_);
-  EXPECT_EQ(rndctl.tasks->rec->status, TASK_FAILED);
-  EXPECT_EQ(rndctl.tasks->rec->retries, 3);
-  EXPECT_EQ(rndctl.tasks->rec->dev, there_);
-}
-
-// --- Records, groups and entries --------------------------------------------
-
-TEST_F(TaskFileTest, EntriesLeaveTheListWithTheirRecords) {
-  TASK* a = entry(alpha_, 0, here_, TASK_RUNNING);
-  TASK* b = entry(alpha_, 1, here_, TASK_RUNNING);
-  TASK* c = entry(beta_, 0, here_, TASK_RUNNING);
-  b->pid = 102;
-  c->pid = 102;
-  EXPECT_EQ(Task_by_pid(102), b);
-  TASK_free(b);
-  EXPECT_EQ(Task_by_pid(102), c);
-  // Free the tail and the head; a new entry still lands at the real tail.
-  TASK_free(entry(beta_, 1, here_, TASK_RUNNING));
-  TASK_free(a);
-  TASK* e = entry(beta_, 2, here_, TASK_RUNNING);
-  EXPECT_EQ(rndctl.tasks, c);
-  EXPECT_EQ(c->next, e);
-  EXPECT_EQ(e->prev, c);
-
-  // An entry whose record still sits in a group takes it out of the group.
-  TaskGroup* groups = nullptr;
-  TaskRec* first = insert_task(&groups, alpha_, 1, 2, TASK_PENDING);
-  TaskRec* second = insert_task(&groups, alpha_, 3, 4, TASK_PENDING);
-  TASK_free(Task_add(alpha_, first));
-  EXPECT_EQ(groups->tasks, second);
-  TaskGroup_free_all(&groups);
-}
-
 // --- Status files -----------------------------------------------------------
 
 TEST_F(TaskFileTest, StatusFileListsThisHostsLiveEntries) {

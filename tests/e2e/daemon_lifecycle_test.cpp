@@ -69,27 +69,6 @@ TEST(DaemonLifecycle, RemovedPidFileEndsTheDaemonAtItsNextWakeUp) {
   EXPECT_NE(access.find("error openning \""), std::string::npos) << access;
 }
 
-TEST(DaemonLifecycle, CheckIntervalFromTheCommandLineShowsInThePauseTrace) {
-  Farm farm;
-  Daemon& d = farm.start_on_farm({"-u", "150"});
-  ASSERT_TRUE(started(farm, d));
-  ASSERT_TRUE(woken(d, 1));
-  EXPECT_NE(d.log().find("pause 2:30\t\tsec since last check = "), std::string::npos) << d.log();
-}
-
-// A negative interval in the job file's header once made every pass reload
-// at once, for ever, at full CPU; refused, the daemon keeps its interval,
-// says so once, and waits.
-TEST(DaemonLifecycle, ABadIntervalInTheJobFileIsRefusedAndTheDaemonWaits) {
-  Farm farm;
-  farm.write("Render_Job_Control", "RenderJobControl -1 0\nEnd\n");
-  Daemon& d = farm.start_on_farm({"-u", "150"});
-  ASSERT_TRUE(started(farm, d));
-  ASSERT_TRUE(woken(d, 1)) << d.log();
-  EXPECT_NE(d.log().find("pause 2:30\t\tsec since last check = "), std::string::npos) << d.log();
-  EXPECT_EQ(count_of(d.log(), "ignoring check interval -1:00"), 1) << d.log();
-}
-
 TEST(DaemonLifecycle, ExitsOnTheEleventhWorklessWakeUp) {
   Farm farm;
   Daemon& d = farm.start_on_farm();

@@ -125,8 +125,10 @@ Daemon& Farm::start(const std::vector<std::string>& args, const std::string& hos
   std::vector<std::string> argv;
   bool own_uts = !host.empty() && host != this_host_name();
   if (own_uts) {
-    argv = {"/usr/bin/unshare", "-u", "/bin/sh", "-c", "hostname \"$0\" && exec \"$@\"", host,
-            DAEMON_PATH};
+    argv = uts_unshare();
+    for (const char* a : {"/bin/sh", "-c", "hostname \"$0\" && exec \"$@\""}) argv.push_back(a);
+    argv.push_back(host);
+    argv.push_back(DAEMON_PATH);
   } else {
     argv = wrapper_;
     argv.push_back(DAEMON_PATH);
@@ -143,8 +145,10 @@ Daemon& Farm::start(const std::vector<std::string>& args, const std::string& hos
     if (fd >= 0) {
       dup2(fd, 1);
       dup2(fd, 2);
-      close(fd);
     }
+    // The daemon starts as from a boot script, with the three streams only:
+    // what the test runner holds open is not the daemon's to pass on.
+    for (int other = 3; other < 1024; ++other) close(other);
     std::vector<char*> cargv;
     for (auto& a : argv) cargv.push_back(a.data());
     cargv.push_back(nullptr);
@@ -180,7 +184,21 @@ int count_of(const std::string& text, const std::string& needle) {
   return n;
 }
 
-bool is_root() { return geteuid() == 0; }
+std::vector<std::string> uts_unshare() {
+  if (geteuid() == 0) return {"/usr/bin/unshare", "-u"};
+  // Without root a user namespace of its own lets the daemon set its host
+  // name; the pid namespace stays shared, so probes and signals still reach.
+  return {"/usr/bin/unshare", "--user", "--map-root-user", "--uts"};
+}
+
+bool can_name_hosts() {
+  static const bool can = [] {
+    std::string cmd;
+    for (const auto& a : uts_unshare()) cmd += a + " ";
+    return system((cmd + "hostname probe.invalid >/dev/null 2>&1").c_str()) == 0;
+  }();
+  return can;
+}
 
 int read_pid_file(const std::string& path) {
   int32_t pid = 0;

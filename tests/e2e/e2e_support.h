@@ -82,8 +82,11 @@ int count_of(const std::string& text, const std::string& needle);
 /// Pids of a process's children, and how many of them are zombies.
 std::vector<int> children_of(int pid, int* zombies = nullptr);
 
-/// True when running as root (needed for UTS namespaces).
-bool is_root();
+/// The command that runs a daemon in a UTS namespace of its own: plain
+/// `unshare -u` as root, else inside a user namespace mapping us to root.
+std::vector<std::string> uts_unshare();
+/// True when daemons can run under other host names here.
+bool can_name_hosts();
 
 /// The 4-byte native pid stored in a pid file, or 0.
 int read_pid_file(const std::string& path);

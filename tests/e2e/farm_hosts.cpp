@@ -261,7 +261,7 @@ bool FarmHosts::start(const std::string& name) {
 
   std::string dir = farm_.dir();
   std::string script = "hostname \"$0\" || exit 1; ";
-  std::vector<std::string> argv = {"/usr/bin/unshare", "-u"};
+  std::vector<std::string> argv = uts_unshare();
   if (ssh_ != nullptr) {
     // The client runs in the foreground as a child of the shell, and so of
     // the daemon once the shell has become it: a power cut ends both.
