@@ -57,6 +57,8 @@ TEST_F(SignalTest, OneHandlerCallJudgesEveryChildThatEnded) {
   rndctl.running = 4;
 
   sig_handler(SIGCHLD);
+  EXPECT_EQ(rndctl.running, 4);  // the handler only records the exits
+  EXPECT_EQ(Task_judge_exits(), 4);
 
   EXPECT_EQ(rndctl.running, 0);
   EXPECT_EQ(rndctl.signal_seen, 1);
@@ -78,6 +80,7 @@ TEST_F(SignalTest, AChildEndingTouchesTheHostUpdateTime) {
   ended_child(0);
   rndctl.running = 1;
   sig_handler(SIGCHLD);
+  Task_judge_exits();
   EXPECT_GT(daemon_updatetime_get("testhost"), before);
 }
 

@@ -158,7 +158,10 @@ enum class Wake { kSignal, kTouched };
 Wake wait_for_wake(const char* host, bool* settled) {
   RJ_alarm(20);
   for (int polls = 1;; ++polls) {
-    if (RJ_pause_for(200) != 0) return Wake::kSignal;
+    if (RJ_pause_for(200) != 0) {
+      Task_judge_exits();
+      return Wake::kSignal;
+    }
     if (daemon_updatetime_get(host) != rndctl.last_update) return Wake::kTouched;
     if (!*settled && polls % 5 == 0 && rj_update_time_settled(rndctl.last_update, rj_heartbeat())) {
       *settled = true;

@@ -55,6 +55,19 @@ void append_access_log(const char* message) {
 
 }  // namespace
 
+namespace {
+mode_t saved_umask = 0;
+bool umask_saved = false;
+}  // namespace
+
+void rj_note_original_umask(mode_t mask) {
+  if (umask_saved) return;
+  saved_umask = mask;
+  umask_saved = true;
+}
+
+mode_t get_original_umask() { return saved_umask; }
+
 void rj_set_access_stream(FILE* stream) { access_stream = stream; }
 
 time_t (*rj_clock)() = system_clock;

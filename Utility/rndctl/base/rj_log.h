@@ -36,6 +36,13 @@ const char* rj_tmpdir();
 /// exec and in a signal handler.
 void rj_write_all(int fd, const char* text, size_t length);
 
+/// The umask the process started with.  The locked file operations set the
+/// process's own (1: shared files are made group- and world-writable) and
+/// note the first one here; a render program gets the original back.
+/// Only the first note counts.
+void rj_note_original_umask(mode_t mask);
+mode_t get_original_umask();
+
 /// The access log stream, or null while none is open (lines are dropped).
 /// The locked file operations set it when they open the control directory.
 void rj_set_access_stream(FILE* stream);

@@ -22,8 +22,6 @@
 #include "Utility/rndctl/base/rj_text.h"
 #include "Utility/rndctl/ctldir/rj_fileio.h"
 #include "Utility/rndctl/proc/rj_signal.h"
-#include "Utility/rndctl/records/rj_recindex.h"
-#include "Utility/rndctl/records/rj_records.h"
 
 namespace {
 
@@ -87,16 +85,6 @@ int read_table(FILE* fp) {
   return n;
 }
 
-// Frees every job and resource that the dead editor `pid` had current.
-void release_records_of(int pid) {
-  for (Job* job = rndctl.jobs; job != nullptr; job = job->next) {
-    if (job->lock_pid == pid) job->lock_pid = 0;
-  }
-  for (Dev* dev = rndctl.devs; dev != nullptr; dev = dev->next) {
-    if (dev->lock_pid == pid) dev->lock_pid = 0;
-  }
-}
-
 // The registry could not be opened: say so and let go of its lock.
 void give_up_open(const char* path) {
   dbgpnt("ERROR: failed to open %s\n", path);
@@ -106,7 +94,7 @@ void give_up_open(const char* path) {
 
 }  // namespace
 
-void Editor_process_list(int mode) {
+void Editor_registry_update(int mode, std::vector<int>* dead) {
   char path[PATH_MAX];
   registry_path(path, sizeof path);
   end_table(0);
@@ -141,7 +129,7 @@ void Editor_process_list(int mode) {
       dbgpnt("%d %s = %d\n ", i, slot.host, slot.pid);
       if (RJ_signal(slot.host, slot.pid, 0) != 0) {
         dbgpnt("\t\t*** dead ***\n");
-        release_records_of(slot.pid);
+        if (dead != nullptr) dead->push_back(slot.pid);
         slot.pid = -1;
       } else {
         dbgpnt("\t\t*** ALIVE ***\n");

@@ -29,8 +29,6 @@
 #include "Utility/rndctl/base/rj_control.h"
 #include "Utility/rndctl/base/rj_log.h"
 #include "Utility/rndctl/base/rj_text.h"
-#include "Utility/rndctl/ctlfile/rj_ctlfile.h"
-#include "Utility/rndctl/records/rj_recindex.h"
 
 const char* const control_names[FILE_COUNT] = {
     "Render_Job_Control",    "Render_Resource_Control", "Render_Tasks",  "RndCtl_EditPids",
@@ -70,8 +68,6 @@ struct FileRecord {
 };
 
 FileRecord files[FILE_COUNT];
-mode_t saved_umask = 0;
-bool umask_saved = false;
 
 bool valid_index(int index) { return index >= 0 && index < FILE_COUNT; }
 
@@ -335,16 +331,11 @@ void forget_stream(FileRecord& rec) {
   rec.update.reset();
 }
 
-void after_open(int index, FILE* fp) {
+void after_open(FILE* fp) {
   // Fully buffered: whole files are read or rewritten under their lock, and
   // a line-buffered stream would cost one system call per line of a large
   // job file.
   setvbuf(fp, nullptr, _IOFBF, 1 << 16);
-  if (index == FILE_JOBS || index == FILE_RESOURCES) {
-    RJCin = fp;
-    RJCreadfile = files[index].path;
-    RJCpath = files[index].path;
-  }
 }
 
 }  // namespace
@@ -361,10 +352,7 @@ int init_fileop() {
   // Only the first initialisation sees the umask the process started with;
   // a later one (after fileop_reset) would see our own.
   mode_t previous = umask(1);
-  if (!umask_saved) {
-    saved_umask = previous;
-    umask_saved = true;
-  }
+  rj_note_original_umask(previous);
 
   FileRecord& log = files[FILE_ACCESS];
   if (log.stream == nullptr) {
@@ -397,7 +385,7 @@ FILE* read_fileop(int index) {
     return nullptr;
   }
   rec.stream = fp;
-  after_open(index, fp);
+  after_open(fp);
   return fp;
 }
 
@@ -415,7 +403,7 @@ FILE* update_fileop(int index) {
   }
   rec.stream = fp;
   rec.update = std::move(update);
-  after_open(index, fp);
+  after_open(fp);
   return fp;
 }
 
@@ -472,8 +460,6 @@ int fileop_rewrite(int index, bool (*change)(FILE* in, FILE* out, void* context)
   std::string data(buffer != nullptr ? buffer : "", length);
   return replace_file(files[index].path, old.old, old.old_st, data);
 }
-
-mode_t get_original_umask() { return saved_umask; }
 
 const char* fileop_path(int index) {
   if (!valid_index(index) || !ensure_paths(index)) return nullptr;

@@ -77,7 +77,6 @@ void rewind_fileop(int index);
 /// temporary is gone, and the path with the system's reason was reported to
 /// the user and the trace.
 [[nodiscard]] int close_and_truncate_fileop(int index);
-mode_t get_original_umask();
 /// The path of shared file `index` ("%s/%s"), building the table when needed.
 const char* fileop_path(int index);
 /// The path of the lock directory of file `index` ("%s/%s.lock"), likewise.

@@ -35,8 +35,6 @@
 #include "Utility/rndctl/base/rj_log.h"
 #include "Utility/rndctl/base/rj_text.h"
 #include "Utility/rndctl/ctldir/rj_fileio.h"
-#include "Utility/rndctl/records/rj_recindex.h"
-#include "Utility/rndctl/tasks/rj_task.h"
 
 namespace {
 

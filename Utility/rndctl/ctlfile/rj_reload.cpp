@@ -28,16 +28,16 @@
 #include "Utility/rndctl/records/rj_job.h"
 #include "Utility/rndctl/records/rj_recindex.h"
 #include "Utility/rndctl/records/rj_records.h"
-#include "Utility/rndctl/tasks/rj_taskrec.h"
+
+void (*RJC_records_hook)(int event) = nullptr;
 
 namespace {
 
-// Entries whose job is about to be dropped by the writer (deletion mark) lose
-// their job first, so that no entry keeps a pointer to a freed record.
+// Whoever points at records from outside the lists (the running-task
+// entries) lets go of jobs about to be dropped by the writer (deletion mark),
+// so that nothing keeps a pointer to a freed record.
 void detach_tasks_of_deleted_jobs() {
-  for (TASK* t = rndctl.tasks; t != nullptr; t = t->next) {
-    if (t->job != nullptr && t->job->deleted) t->job = nullptr;
-  }
+  if (RJC_records_hook != nullptr) RJC_records_hook(RJC_RECORDS_DROPPING_DELETED);
 }
 
 bool is_number_state(const char* text, float* value) {
@@ -436,13 +436,9 @@ void reconcile_from(const std::string& resources, const std::string& jobs, int e
   parse_bytes(FILE_RESOURCES, resources);
   parse_bytes(FILE_JOBS, jobs);
 
-  // Re-point every running-task entry at the fresh records (by index) while
-  // the old ones still exist.  Entries of jobs or resources that left the
-  // files end with a null pointer instead of a dangling one.
-  for (TASK* t = rndctl.tasks; t != nullptr; t = t->next) {
-    if (t->job != nullptr) t->job = Job_by_index(t->job->index);
-    if (t->rec != nullptr && t->rec->dev != nullptr) t->rec->dev = Dev_by_index(t->rec->dev->index);
-  }
+  // Pointers held outside the lists move to the fresh records while the old
+  // ones still exist.
+  if (RJC_records_hook != nullptr) RJC_records_hook(RJC_RECORDS_REPLACED);
 
   const char* host = rndctl.host.c_str();
   for (Job* J = old.jobs; J != nullptr; J = J->next) {

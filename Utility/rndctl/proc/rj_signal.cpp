@@ -5,7 +5,8 @@
 // The daemon keeps SIGALRM and SIGCHLD blocked all the time except inside
 // RJ_pause (sigsuspend), so the handler only ever runs while the service loop
 // waits and never interrupts its file or list work.  That is what makes the
-// traces and the list walk inside the handler safe.
+// traces inside the handler safe.  The handler only reaps and records
+// (pid, status) pairs; the service loop judges them (RJ_take_exit).
 #include "Utility/rndctl/proc/rj_signal.h"
 
 #include <fcntl.h>
@@ -23,12 +24,6 @@
 #include "Utility/rndctl/base/rj_control.h"
 #include "Utility/rndctl/base/rj_log.h"
 #include "Utility/rndctl/base/rj_text.h"
-#include "Utility/rndctl/ctldir/rj_fileio.h"
-#include "Utility/rndctl/ctldir/rj_updatetime.h"
-#include "Utility/rndctl/records/rj_recindex.h"
-#include "Utility/rndctl/tasks/rj_reclaim.h"
-#include "Utility/rndctl/tasks/rj_task.h"
-#include "Utility/rndctl/tasks/rj_taskrec.h"
 
 volatile int last_signal = 0;
 
@@ -41,36 +36,16 @@ int mask_op(int how, int sig) {
   return sigprocmask(how, &set, nullptr);
 }
 
-// Decodes one reaped child into its running-task entry.
-void judge_child(int pid, int status) {
-  rndctl.running = rndctl.running - 1;
-  rj_render_ended(pid);
-  daemon_updatetime_set(rndctl.host.c_str());
-  TASK* entry = Task_by_pid(pid);
-  if (entry == nullptr) {
-    dbgpnt("=======SIGCLD pid(%d) is UNKNOWN  remaining children(%d)\n", pid, rndctl.running);
-    return;
-  }
-  entry->waitstatus = 0;
-  if (status == 0) {
-    entry->pid = 0;
-  } else if ((status & 0xff) == 0) {
-    int code = (status >> 8) & 255;
-    dbgpnt("\t\tEXITED with to %d\n", code);
-    entry->pid = 0;
-    entry->waitstatus = code;
-  } else if (((status >> 8) & 255) == 0) {
-    entry->pid = 0;
-    entry->waitstatus = status & 127;
-  } else {
-    entry->pid = 0;
-    entry->waitstatus = 1;
-  }
-  const char* name = "no job";
-  if (entry->job != nullptr) name = entry->job->name.or_else("noname");
-  dbgpnt("=======SIGCLD %s(%d) %d  remaining children(%d)\n", name,
-         entry->rec != nullptr ? entry->rec->id : -1, pid, rndctl.running);
-}
+// Exits reaped by the handler and not yet taken by the service loop: a ring
+// the handler fills and RJ_take_exit empties, with SIGCHLD blocked.
+constexpr int kExitSlots = 256;
+struct ExitSlot {
+  int pid;
+  int status;
+};
+ExitSlot exits[kExitSlots];
+volatile int exits_head = 0;  // next to take
+volatile int exits_count = 0;
 
 // Runs argv with its stdout into `out_fd` and waits for it; true when it ran.
 bool run_probe(char* const argv[], int out_fd) {
@@ -204,6 +179,16 @@ int RJ_pause_for(long ms) {
 
 int RJ_wait(int* status) { return wait(status); }
 
+int RJ_take_exit(int* pid, int* status) {
+  if (exits_count == 0) return 0;
+  const ExitSlot& slot = exits[exits_head];
+  *pid = slot.pid;
+  *status = slot.status;
+  exits_head = (exits_head + 1) % kExitSlots;
+  exits_count = exits_count - 1;
+  return 1;
+}
+
 void sig_handler(int sig) {
   int saved_errno = errno;
   RJ_sighold(SIGALRM);
@@ -215,7 +200,10 @@ void sig_handler(int sig) {
       int status = 0;
       pid_t pid = waitpid(-1, &status, WNOHANG);
       if (pid <= 0) break;
-      judge_child(pid, status);
+      if (exits_count < kExitSlots) {
+        exits[(exits_head + exits_count) % kExitSlots] = ExitSlot{pid, status};
+        exits_count = exits_count + 1;
+      }
     }
   }
   rndctl.signal_seen = 1;

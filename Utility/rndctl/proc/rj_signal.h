@@ -15,3 +15,9 @@ int RJ_pause();
 /// handled, 0 when the time ran out.
 int RJ_pause_for(long ms);
 int RJ_wait(int* status);
+/// One exit the SIGCHLD handler reaped (every ended child is reaped by one
+/// call of the handler) and nobody has taken yet, oldest first: sets `pid`
+/// and `status` (as waitpid gives it) and returns 1; 0 when none is left.
+/// Call with SIGCHLD blocked (the daemon keeps it blocked outside its wait).
+/// At most 256 exits wait to be taken; a child beyond that is reaped unseen.
+int RJ_take_exit(int* pid, int* status);

@@ -316,3 +316,16 @@ int ISA_jobdif(Job* a, Job* b) {
   }
   return 0;
 }
+
+void Editor_process_list(int mode) {
+  std::vector<int> dead;
+  Editor_registry_update(mode, &dead);
+  for (int pid : dead) {
+    for (Job* job = rndctl.jobs; job != nullptr; job = job->next) {
+      if (job->lock_pid == pid) job->lock_pid = 0;
+    }
+    for (Dev* dev = rndctl.devs; dev != nullptr; dev = dev->next) {
+      if (dev->lock_pid == pid) dev->lock_pid = 0;
+    }
+  }
+}

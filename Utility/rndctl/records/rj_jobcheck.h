@@ -13,3 +13,7 @@ void Job_field_check();
 int Job_file_search(const char* host);
 int ISA_devdif(Dev* a, Dev* b);
 int ISA_jobdif(Job* a, Job* b);
+
+/// Updates the editor registry (Editor_registry_update) and frees every job
+/// and resource that an editor found dead had current (its lock_pid).
+void Editor_process_list(int mode);

@@ -17,10 +17,15 @@
 #include "Utility/rndctl/base/rj_log.h"
 #include "Utility/rndctl/base/rj_text.h"
 #include "Utility/rndctl/ctldir/rj_fileio.h"
+#include "Utility/rndctl/ctldir/rj_updatetime.h"
+#include "Utility/rndctl/ctlfile/rj_reload.h"
+#include "Utility/rndctl/proc/rj_signal.h"
 #include "Utility/rndctl/records/rj_dev.h"
+#include "Utility/rndctl/records/rj_job.h"
 #include "Utility/rndctl/records/rj_recindex.h"
 #include "Utility/rndctl/records/rj_records.h"
 #include "Utility/rndctl/tasks/rj_perform.h"
+#include "Utility/rndctl/tasks/rj_reclaim.h"
 #include "Utility/rndctl/tasks/rj_taskrec.h"
 #include "Utility/rndctl/tasks/rj_tskio.h"
 
@@ -225,7 +230,28 @@ int Task_retire_marked() {
   return dropped;
 }
 
+namespace {
+
+// Keeps the entries' record pointers valid across reloads of the lists.
+void follow_records(int event) {
+  for (TASK* t = rndctl.tasks; t != nullptr; t = t->next) {
+    if (event == RJC_RECORDS_DROPPING_DELETED) {
+      if (t->job != nullptr && t->job->deleted) t->job = nullptr;
+    } else if (event == RJC_RECORDS_REPLACED) {
+      // Entries of jobs or resources that left the files end with a null
+      // pointer instead of a dangling one.
+      if (t->job != nullptr) t->job = Job_by_index(t->job->index);
+      if (t->rec != nullptr && t->rec->dev != nullptr) {
+        t->rec->dev = Dev_by_index(t->rec->dev->index);
+      }
+    }
+  }
+}
+
+}  // namespace
+
 TASK* Task_add(Job* job, TaskRec* rec) {
+  RJC_records_hook = follow_records;
   dbgpnt("Task_add to \"%s\" id = %d start = %f\t%s\n",
          job != nullptr ? job->name.or_else("(null)") : "(null)", rec != nullptr ? rec->id : -1,
          rec != nullptr ? rec->start : 0.0f, GetTaskStatusStr(rec != nullptr ? rec->status : 0));
@@ -294,4 +320,50 @@ TASK* Task_by_pid(int pid) {
     if (e->pid == pid) return e;
   }
   return nullptr;
+}
+
+namespace {
+
+// Decodes one reaped child into its running-task entry.
+void judge_exit(int pid, int status) {
+  rndctl.running = rndctl.running - 1;
+  rj_render_ended(pid);
+  daemon_updatetime_set(rndctl.host.c_str());
+  TASK* entry = Task_by_pid(pid);
+  if (entry == nullptr) {
+    dbgpnt("=======SIGCLD pid(%d) is UNKNOWN  remaining children(%d)\n", pid, rndctl.running);
+    return;
+  }
+  entry->waitstatus = 0;
+  if (status == 0) {
+    entry->pid = 0;
+  } else if ((status & 0xff) == 0) {
+    int code = (status >> 8) & 255;
+    dbgpnt("\t\tEXITED with to %d\n", code);
+    entry->pid = 0;
+    entry->waitstatus = code;
+  } else if (((status >> 8) & 255) == 0) {
+    entry->pid = 0;
+    entry->waitstatus = status & 127;
+  } else {
+    entry->pid = 0;
+    entry->waitstatus = 1;
+  }
+  const char* name = "no job";
+  if (entry->job != nullptr) name = entry->job->name.or_else("noname");
+  dbgpnt("=======SIGCLD %s(%d) %d  remaining children(%d)\n", name,
+         entry->rec != nullptr ? entry->rec->id : -1, pid, rndctl.running);
+}
+
+}  // namespace
+
+int Task_judge_exits() {
+  int pid = 0;
+  int status = 0;
+  int n = 0;
+  while (RJ_take_exit(&pid, &status) != 0) {
+    judge_exit(pid, status);
+    n++;
+  }
+  return n;
 }

@@ -8,7 +8,14 @@
 
 TASK* Task_add(Job* job, TaskRec* rec);
 void TASK_free(TASK* entry);
-TASK* Task_by_pid(int pid);  // safe in the SIGCHLD handler (a list walk)
+TASK* Task_by_pid(int pid);
+/// Judges every exit the SIGCHLD handler recorded (RJ_take_exit): counts the
+/// child off `rndctl.running`, drops it from the render registry, touches
+/// this host's pid file, and when an entry renders that pid sets its `pid`
+/// to 0 and its `waitstatus` to the exit code (a signal's number for a
+/// killed render, 1 for anything else).  The service loop calls it after
+/// each wait.  Returns the number of exits judged.
+int Task_judge_exits();
 
 /// Who may write a record of Render_Tasks.  Another host or an editor may put
 /// a record back (PENDING) or another host may take it while its owner here
