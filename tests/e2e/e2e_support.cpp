@@ -115,13 +115,6 @@ void Farm::write(const std::string& name, const std::string& content) const {
 
 Daemon& Farm::start(const std::vector<std::string>& args, const std::string& host,
                     const std::vector<std::string>& env) {
-  auto* d = new Daemon();
-  daemons_.push_back(d);
-  d->host = host.empty() ? this_host_name() : host;
-  d->tmpdir = scratch_ + "/tmp" + std::to_string(counter_++);
-  mkdir(d->tmpdir.c_str(), 0777);
-  std::string early = d->tmpdir + "/early";
-
   std::vector<std::string> argv;
   bool own_uts = !host.empty() && host != this_host_name();
   if (own_uts) {
@@ -132,9 +125,21 @@ Daemon& Farm::start(const std::vector<std::string>& args, const std::string& hos
   } else {
     argv = wrapper_;
     argv.push_back(DAEMON_PATH);
-    d->wrapped = !wrapper_.empty();
   }
   for (const auto& a : args) argv.push_back(a);
+  Daemon& d = run(argv, host.empty() ? this_host_name() : host, env);
+  d.wrapped = !own_uts && !wrapper_.empty();
+  return d;
+}
+
+Daemon& Farm::run(std::vector<std::string> argv, const std::string& host,
+                  const std::vector<std::string>& env) {
+  auto* d = new Daemon();
+  daemons_.push_back(d);
+  d->host = host;
+  d->tmpdir = scratch_ + "/tmp" + std::to_string(counter_++);
+  mkdir(d->tmpdir.c_str(), 0777);
+  std::string early = d->tmpdir + "/early";
 
   pid_t pid = fork();
   if (pid == 0) {

@@ -57,6 +57,11 @@ class Farm {
   /// Its stdout and stderr before the log takes over go to "<tmpdir>/early".
   Daemon& start(const std::vector<std::string>& args, const std::string& host = "",
                 const std::vector<std::string>& env = {});
+  /// Starts `argv` (a daemon, or a command that becomes one) as the daemon
+  /// of `host`, with its own DRCTMPDIR and the three streams only; the farm
+  /// owns it and ends it at the latest when the farm goes.
+  Daemon& run(std::vector<std::string> argv, const std::string& host,
+              const std::vector<std::string>& env);
   /// A command (and its arguments) that the next daemons are started under,
   /// such as faketime with a date.
   void set_wrapper(const std::vector<std::string>& wrapper) { wrapper_ = wrapper; }
