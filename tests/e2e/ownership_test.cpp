@@ -125,9 +125,9 @@ TEST_F(Ownership, RestartWhileAHostIsStoppedRendersEveryFrameAgain) {
   };
   ASSERT_TRUE(wait_for(
       [&] {
-        kill(da.daemon_pid(), SIGSTOP);
+        kill(da.pid, SIGSTOP);
         if (!any_lock()) return true;
-        kill(da.daemon_pid(), SIGCONT);
+        kill(da.pid, SIGCONT);
         return false;
       },
       60));
@@ -146,7 +146,7 @@ TEST_F(Ownership, RestartWhileAHostIsStoppedRendersEveryFrameAgain) {
   farm_.write("Render_Tasks", "");
   rmdir(lock.c_str());
   ASSERT_TRUE(set_job_status(farm_, "spin", "pending", "hostB"));
-  ASSERT_EQ(kill(da.daemon_pid(), SIGCONT), 0);
+  ASSERT_EQ(kill(da.pid, SIGCONT), 0);
   utimensat(AT_FDCWD, farm_.path("hostA.pid").c_str(), nullptr, 0);
 
   ASSERT_TRUE(wait_for([&] { return job_status(farm_, "spin") == "finished"; }, 240, &da))
