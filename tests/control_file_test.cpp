@@ -258,40 +258,6 @@ TEST_F(ControlFileTest, LexicalErrorExitsWithMinusOne) {
   RJCreadfile = nullptr;
 }
 
-// Every text a record may hold, whatever its bytes, reads back as the
-// writer's form of it, and what is read back writes as the same text.
-class HostileTextTest : public ControlFileTest, public testing::WithParamInterface<const char*> {};
-
-TEST_P(HostileTextTest, ReadsBackAsWritten) {
-  survive_errors();
-  EXPECT_EQ(text_records::check({GetParam()}), "");
-  EXPECT_EQ(fatal_status, 0);
-}
-
-// clang-format off
-INSTANTIATE_TEST_SUITE_P(Texts, HostileTextTest, testing::Values(
-    "", "plain", "10.1.2.3", "12", "1.5", "-1", "-render", "1-2", "12abc", ".5", "render farm",
-    "status", "user", "host_name", "End", "TRUE", "to", "RenderJobControl", "users",
-    "a\"b", "\"", "\"\"status\"", "*/", "a*/b*/c", "**/", "*", "/*", "x*", "line\nbreak",
-    "tab\there", "bell\a\x1b[31m", "\x7f", "caf\xc3\xa9", "\xff\xfe\x80", "a;b", "{", "}",
-    "a,b", "=", "#x", "@", "new_resource", "dir/sub/name", "dir/", "/", "a/\"b c\"",
-    "Error: frame 12 */ \"bad\" \x01\x02 done"));
-// clang-format on
-
-TEST_F(ControlFileTest, LongTextsAreCutWhereTheReaderCutsThem) {
-  survive_errors();
-  for (size_t length :
-       {RJC_STRING_LIMIT - 1, RJC_STRING_LIMIT, RJC_STRING_LIMIT + 1, size_t{5000}}) {
-    SCOPED_TRACE(length);
-    EXPECT_EQ(text_records::check({std::string(length, 'w')}), "");
-    EXPECT_EQ(text_records::check({std::string(length, ' ')}), "");
-    // Quotes are dropped before the cut: the reader counts what is between them.
-    EXPECT_EQ(text_records::check({std::string(length, '"') + std::string(length, 'q')}), "");
-  }
-  EXPECT_EQ(RJC_string_form(std::string(3000, 'x').c_str()).size(), RJC_STRING_LIMIT);
-  EXPECT_EQ(fatal_status, 0);
-}
-
 // What the file shows: valid names keep their bytes, the rest is quoted.
 struct Shown {
   const char* text;

@@ -18,17 +18,9 @@ std::string this_host_name() {
   return host;
 }
 
-int Daemon::daemon_pid() const {
-  if (!wrapped) return pid;
-  std::vector<int> kids = children_of(pid);
-  return kids.empty() ? -1 : kids[0];
-}
-
 bool Daemon::in_loop() const {
   if (pid <= 0 || reaped) return false;
-  int target = daemon_pid();
-  if (target <= 0) return false;
-  std::string status = read_text_file("/proc/" + std::to_string(target) + "/status");
+  std::string status = read_text_file("/proc/" + std::to_string(pid) + "/status");
   size_t at = status.find("SigCgt:");
   if (at == std::string::npos) return false;
   unsigned long long caught = strtoull(status.c_str() + at + 7, nullptr, 16);
@@ -37,8 +29,7 @@ bool Daemon::in_loop() const {
 
 void Daemon::wake() const {
   if (pid <= 0 || reaped) return;
-  int target = daemon_pid();
-  if (target > 0) kill(target, SIGALRM);
+  kill(pid, SIGALRM);
 }
 
 bool Daemon::ended() {
@@ -60,7 +51,7 @@ int Daemon::exit_code() const {
 
 namespace {
 // Kills a process and everything below it (render programs run in process
-// groups of their own, and a wrapper such as faketime forks the daemon).
+// groups of their own).
 void kill_tree(int pid, std::vector<int>* killed) {
   for (int child : children_of(pid)) kill_tree(child, killed);
   kill(pid, SIGKILL);
@@ -115,13 +106,6 @@ void Farm::write(const std::string& name, const std::string& content) const {
 
 Daemon& Farm::start(const std::vector<std::string>& args, const std::string& host,
                     const std::vector<std::string>& env) {
-  auto* d = new Daemon();
-  daemons_.push_back(d);
-  d->host = host.empty() ? this_host_name() : host;
-  d->tmpdir = scratch_ + "/tmp" + std::to_string(counter_++);
-  mkdir(d->tmpdir.c_str(), 0777);
-  std::string early = d->tmpdir + "/early";
-
   std::vector<std::string> argv;
   bool own_uts = !host.empty() && host != this_host_name();
   if (own_uts) {
@@ -130,11 +114,20 @@ Daemon& Farm::start(const std::vector<std::string>& args, const std::string& hos
     argv.push_back(host);
     argv.push_back(DAEMON_PATH);
   } else {
-    argv = wrapper_;
     argv.push_back(DAEMON_PATH);
-    d->wrapped = !wrapper_.empty();
   }
   for (const auto& a : args) argv.push_back(a);
+  return run(argv, host.empty() ? this_host_name() : host, env);
+}
+
+Daemon& Farm::run(std::vector<std::string> argv, const std::string& host,
+                  const std::vector<std::string>& env) {
+  auto* d = new Daemon();
+  daemons_.push_back(d);
+  d->host = host;
+  d->tmpdir = scratch_ + "/tmp" + std::to_string(counter_++);
+  mkdir(d->tmpdir.c_str(), 0777);
+  std::string early = d->tmpdir + "/early";
 
   pid_t pid = fork();
   if (pid == 0) {

@@ -18,11 +18,8 @@ struct Daemon {
   pid_t pid = -1;
   int status = -1;  // wait status once reaped
   bool reaped = false;
-  std::string host;      // the host name it runs under
-  std::string tmpdir;    // its DRCTMPDIR (where its log is)
-  bool wrapped = false;  // started under a wrapper that forks (faketime)
-  /// The daemon process itself: `pid`, or the wrapper's child.
-  int daemon_pid() const;
+  std::string host;    // the host name it runs under
+  std::string tmpdir;  // its DRCTMPDIR (where its log is)
   std::string log_path() const { return tmpdir + "/zarno_render_demon.LOG"; }
   std::string log() const { return read_text_file(log_path()); }
   /// True once the daemon catches SIGALRM (it has entered its service loop;
@@ -57,9 +54,11 @@ class Farm {
   /// Its stdout and stderr before the log takes over go to "<tmpdir>/early".
   Daemon& start(const std::vector<std::string>& args, const std::string& host = "",
                 const std::vector<std::string>& env = {});
-  /// A command (and its arguments) that the next daemons are started under,
-  /// such as faketime with a date.
-  void set_wrapper(const std::vector<std::string>& wrapper) { wrapper_ = wrapper; }
+  /// Starts `argv` (a daemon, or a command that becomes one) as the daemon
+  /// of `host`, with its own DRCTMPDIR and the three streams only; the farm
+  /// owns it and ends it at the latest when the farm goes.
+  Daemon& run(std::vector<std::string> argv, const std::string& host,
+              const std::vector<std::string>& env);
   /// Starts a daemon on this control directory ("-l dir -d 1" plus `extra`).
   Daemon& start_on_farm(const std::vector<std::string>& extra = {}, const std::string& host = "",
                         const std::vector<std::string>& env = {});
@@ -69,7 +68,6 @@ class Farm {
   std::string scratch_;
   int counter_ = 0;
   std::vector<Daemon*> daemons_;
-  std::vector<std::string> wrapper_;
 };
 
 /// Polls `done` every few milliseconds, waking `daemon` (when given) now and

@@ -248,17 +248,12 @@ void FarmHosts::set_env(const std::vector<std::string>& extra) {
 Daemon* FarmHosts::daemon(const std::string& host) {
   auto it = hosts_.find(host);
   if (it == hosts_.end() || it->second.starts.empty()) return nullptr;
-  return it->second.starts.back().get();
+  return it->second.starts.back();
 }
 
 bool FarmHosts::start(const std::string& name) {
   if (hosts_.find(name) == hosts_.end()) order_.push_back(name);
   Host& host = hosts_[name];
-  auto d = std::make_unique<Daemon>();
-  d->host = name;
-  d->tmpdir = scratch_ + "/tmp_" + name + "_" + std::to_string(counter_++);
-  mkdir(d->tmpdir.c_str(), 0777);
-
   std::string dir = farm_.dir();
   std::string script = "hostname \"$0\" || exit 1; ";
   std::vector<std::string> argv = uts_unshare();
@@ -283,31 +278,12 @@ bool FarmHosts::start(const std::string& name) {
   argv.push_back("-d");
   argv.push_back("1");
 
-  std::string early = d->tmpdir + "/early";
-  pid_t pid = fork();
-  if (pid == 0) {
-    setenv("DRCTMPDIR", d->tmpdir.c_str(), 1);
-    unsetenv("RNDCTL_DEBUG");
-    for (const auto& e : env_) putenv(const_cast<char*>(e.c_str()));
-    int fd = open(early.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-    if (fd >= 0) {
-      dup2(fd, 1);
-      dup2(fd, 2);
-      close(fd);
-    }
-    std::vector<char*> cargv;
-    for (auto& a : argv) cargv.push_back(a.data());
-    cargv.push_back(nullptr);
-    execv(cargv[0], cargv.data());
-    _exit(127);
-  }
-  d->pid = pid;
-  Daemon* started = d.get();
-  host.starts.push_back(std::move(d));
+  Daemon* started = &farm_.run(argv, name, env_);
+  host.starts.push_back(started);
   host.frozen = false;
   bool up =
       wait_for([&] { return started->in_loop() || started->ended(); }, 30) && !started->ended();
-  if (up) host.namespaces.insert(uts_of(pid));
+  if (up) host.namespaces.insert(uts_of(started->pid));
   return up;
 }
 
@@ -378,7 +354,7 @@ void FarmHosts::thaw(const std::string& name) {
 void FarmHosts::wake_all() {
   for (auto& [name, host] : hosts_) {
     if (host.frozen || host.starts.empty()) continue;
-    Daemon* d = host.starts.back().get();
+    Daemon* d = host.starts.back();
     if (!d->ended() && d->in_loop()) d->wake();
   }
 }

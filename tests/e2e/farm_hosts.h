@@ -19,7 +19,6 @@
 
 #include <functional>
 #include <map>
-#include <memory>
 #include <set>
 #include <string>
 #include <vector>
@@ -124,8 +123,8 @@ class FarmHosts {
 
  private:
   struct Host {
-    std::vector<std::unique_ptr<Daemon>> starts;  // the latest last
-    std::set<std::string> namespaces;             // "uts:[...]" of every start
+    std::vector<Daemon*> starts;       // the latest last; owned by the farm
+    std::set<std::string> namespaces;  // "uts:[...]" of every start
     bool frozen = false;
   };
   std::vector<int> processes_of(const Host& host) const;
@@ -136,5 +135,4 @@ class FarmHosts {
   std::vector<std::string> env_;
   std::map<std::string, Host> hosts_;
   std::vector<std::string> order_;
-  int counter_ = 0;
 };

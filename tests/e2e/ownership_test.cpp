@@ -1,5 +1,5 @@
-// Who renders what: a resource named apart from its host, a restart while a
-// host is stopped, and a job deleted while it renders.  Every render goes
+// Who renders what: a restart while a host is stopped, and a job deleted
+// while it renders.  Every render goes
 // through a stand-in program that notes its pid and frame range before it
 // becomes the real render program, so that renders can be counted.
 #include <fcntl.h>
@@ -99,23 +99,6 @@ class Ownership : public testing::Test {
   std::vector<std::string> env_;
 };
 
-TEST_F(Ownership, ResourceNamedApartFromItsHostRendersEveryFrameOnce) {
-  std::string resources = resource_file({ResourceSpec{"fast1", 1, 2, 1, "AVAILABLE", ""}});
-  const std::string own = "host_name\t\t= fast1;";
-  resources.replace(resources.find(own), own.size(), "host_name\t\t= hostA;");
-  farm_.write("Render_Resource_Control", resources);
-  JobSpec spin;
-  spin.hosts = {"fast1"};
-  farm_.write("Render_Job_Control", job_file({spin}, scene_));
-
-  Daemon& da = farm_.start_on_farm({}, "hostA", env_);
-  ASSERT_TRUE(wait_for([&] { return job_status(farm_, "spin") == "finished"; }, 180, &da))
-      << da.log();
-  std::map<int, int> counts = frame_counts(renders(farm_));
-  EXPECT_EQ(counts.size(), 6u);
-  for (const auto& [frame, n] : counts) EXPECT_EQ(n, 1) << "frame " << frame;
-}
-
 TEST_F(Ownership, RestartWhileAHostIsStoppedRendersEveryFrameAgain) {
   farm_.write("Render_Resource_Control",
               resource_file({ResourceSpec{"hostA", 1, 2, 1, "AVAILABLE", ""},
@@ -142,9 +125,9 @@ TEST_F(Ownership, RestartWhileAHostIsStoppedRendersEveryFrameAgain) {
   };
   ASSERT_TRUE(wait_for(
       [&] {
-        kill(da.daemon_pid(), SIGSTOP);
+        kill(da.pid, SIGSTOP);
         if (!any_lock()) return true;
-        kill(da.daemon_pid(), SIGCONT);
+        kill(da.pid, SIGCONT);
         return false;
       },
       60));
@@ -163,7 +146,7 @@ TEST_F(Ownership, RestartWhileAHostIsStoppedRendersEveryFrameAgain) {
   farm_.write("Render_Tasks", "");
   rmdir(lock.c_str());
   ASSERT_TRUE(set_job_status(farm_, "spin", "pending", "hostB"));
-  ASSERT_EQ(kill(da.daemon_pid(), SIGCONT), 0);
+  ASSERT_EQ(kill(da.pid, SIGCONT), 0);
   utimensat(AT_FDCWD, farm_.path("hostA.pid").c_str(), nullptr, 0);
 
   ASSERT_TRUE(wait_for([&] { return job_status(farm_, "spin") == "finished"; }, 240, &da))

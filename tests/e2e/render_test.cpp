@@ -66,7 +66,7 @@ class RenderTest : public ::testing::Test {
   std::string scene_;
 };
 
-TEST_F(RenderTest, AJobIsRenderedInHostSizedTasksToFinished) {
+TEST_F(RenderTest, AJobIsRenderedToFinished) {
   JobSpec spin = job("spin", 1, 1, 7);
   Daemon& d = start({here(3, 2)}, {spin});
   ASSERT_TRUE(status_becomes(d, "spin", "finished")) << d.log();
@@ -74,49 +74,9 @@ TEST_F(RenderTest, AJobIsRenderedInHostSizedTasksToFinished) {
   for (int frame = 1; frame <= 7; ++frame) EXPECT_TRUE(exists(image("spin", frame))) << frame;
   EXPECT_FALSE(exists(image("spin", 8)));
 
-  std::string log = farm_.read("JOBLOG/spin");
-  EXPECT_EQ(log.rfind("spin 1 using the frame_painter\n", 0), 0u) << log;
-  EXPECT_NE(log.find("\tframes = 1.000000 to 7.000000 by 1.000000\n"), std::string::npos) << log;
-  // Cut at three frames a task: 1-3, 4-6, 7.
-  EXPECT_NE(log.find(" 1.000000 - 3.000000\t"), std::string::npos) << log;
-  EXPECT_NE(log.find(" 4.000000 - 6.000000\t"), std::string::npos) << log;
-  EXPECT_NE(log.find(" 7.000000 - 7.000000\t"), std::string::npos) << log;
-  EXPECT_EQ(count_of(log, "FINISHED"), 3) << log;
-
   // The finished job's group has left the task file.
   EXPECT_EQ(farm_.read("Render_Tasks").find("spin"), std::string::npos)
       << farm_.read("Render_Tasks");
-  EXPECT_NE(job_block(farm_, "spin").find("\tdoneframes\t= 7;\n"), std::string::npos)
-      << job_block(farm_, "spin");
-}
-
-TEST_F(RenderTest, AFailedTaskIsCutAtTheFrameItReachedAndFinishedOnRetry) {
-  JobSpec spin = job("spin", 1, 1, 6);
-  spin.opts = "fail_at=4 fail_once=" + farm_.path("failed_once");
-  Daemon& d = start({here(6, 1)}, {spin});
-  ASSERT_TRUE(status_becomes(d, "spin", "finished")) << d.log();
-
-  for (int frame = 1; frame <= 6; ++frame) EXPECT_TRUE(exists(image("spin", frame))) << frame;
-  std::string block = job_block(farm_, "spin");
-  EXPECT_NE(block.find("/*ERROR: " + host_ + " (" + host_ + ") frame 1.0\n"), std::string::npos)
-      << block;
-  EXPECT_NE(block.find("Error"), std::string::npos) << block;
-
-  std::string log = farm_.read("JOBLOG/spin");
-  // The first try rendered 1-3 and failed in frame 4: 1-3 counts as done,
-  // 4-6 was rendered again by the retry.
-  EXPECT_NE(log.find(" 1.000000 - 3.000000\t"), std::string::npos) << log;
-  EXPECT_NE(log.find(" 4.000000 - 6.000000\t"), std::string::npos) << log;
-}
-
-TEST_F(RenderTest, ATaskThatAlwaysFailsGivesUpAfterTenRetries) {
-  JobSpec spin = job("spin", 1, 1, 1);
-  spin.opts = "fail_at=1";
-  Daemon& d = start({here(3, 1)}, {spin});
-  ASSERT_TRUE(status_becomes(d, "spin", "failed", 120)) << d.log();
-  std::string log = farm_.read("JOBLOG/spin");
-  EXPECT_NE(log.find("FAILED  10\n"), std::string::npos) << log;
-  EXPECT_EQ(count_of(job_block(farm_, "spin"), "ERROR: "), 11) << job_block(farm_, "spin");
 }
 
 TEST_F(RenderTest, RenderProgramsEndingTogetherAreAllJudged) {
@@ -171,32 +131,6 @@ TEST_F(RenderTest, RenderProgramsInheritOnlyTheirThreeStreams) {
                              FRAME_PAINTER_PATH + " \"$@\"\n")});
   ASSERT_TRUE(status_becomes(d, "spin", "finished")) << d.log();
   EXPECT_EQ(farm_.read("fds"), "0\n1\n2\n3\n0\n1\n2\n3\n");
-}
-
-TEST_F(RenderTest, AnImmediateJobRunsBesideARunningOneWhileOthersWait) {
-  JobSpec busy = job("busy", 1, 1, 3);
-  busy.priority = 1;
-  busy.opts = "slow=4";
-  Daemon& d = start({here(3, 2)}, {busy});
-  ASSERT_TRUE(wait_for([&] { return children_of(d.pid).size() == 1; }, 30)) << d.log();
-
-  // An editor adds an immediate job and an ordinary one.
-  JobSpec now = job("now", 2, 1, 2);
-  now.priority = 0;
-  now.opts = "slow=1";
-  JobSpec later = job("later", 3, 1, 2);
-  later.priority = 1;
-  std::string more = job_file({now, later}, scene_);
-  more = more.substr(more.find('\n') + 1);
-  ASSERT_TRUE(edit_job_file(farm_, "End\n", more, host_));
-
-  ASSERT_TRUE(status_becomes(d, "now", "finished")) << d.log();
-  // "busy" still renders: "later" may not start beside it.
-  EXPECT_FALSE(exists(image("busy", 3)));
-  EXPECT_FALSE(exists(image("later", 1)));
-  EXPECT_NE(job_status(farm_, "later"), "finished");
-  ASSERT_TRUE(status_becomes(d, "later", "finished")) << d.log();
-  EXPECT_TRUE(exists(image("busy", 3)));
 }
 
 }  // namespace
