@@ -35,7 +35,9 @@ TEST(MaBuckets, RequestsGoToTheFirstBucketThatHoldsThemRoundedToEight) {
   };
   for (const BucketCase& c : cases) {
     EXPECT_EQ(MA_bucket_of(c.request), c.bucket) << c.request;
-    if (c.bucket >= 0) EXPECT_GE(MA_bucket_size(c.bucket), c.request) << c.request;
+    if (c.bucket >= 0) {
+      EXPECT_GE(MA_bucket_size(c.bucket), c.request) << c.request;
+    }
   }
 }
 
@@ -105,6 +107,7 @@ TEST(MaNormal, ThreadsAllocatingTogetherNeverShareABlock) {
 class MaDebug : public testing::Test {
  protected:
   void SetUp() override {
+    MA_init();  // reads the environment once; the settings below must win
     ma_debug = 1;
     ma_chkfree = 1;
     ma_stomp = 1;

@@ -321,11 +321,12 @@ bool ma_all_sound(int line, const char* unit) {
 }
 
 int bucket_of(size_t size) {
+  if (size > MA_MAXREQUEST) return -1;
   if (size <= kBucketSizes[kSmallBuckets - 1]) return small_bucket[(size + kAlign - 1) / kAlign];
   size_t r = round_up(size, kAlign);
   for (int b = kSmallBuckets; b < MA_NBUCKETS; ++b)
     if (kBucketSizes[b] >= r) return b;
-  return size <= MA_MAXREQUEST ? MA_NBUCKETS - 1 : -1;
+  return MA_NBUCKETS - 1;  // the last size is not a multiple of 8
 }
 
 void ma_setup_tables() {
