@@ -36,8 +36,7 @@ std::string job_file(const std::vector<JobSpec>& jobs, const std::string& scene)
              "\tuse_sdl_paths = FALSE;\n\toutput_mask = FALSE;\n\tanimate\t\t= TRUE;\n"
              "\tframes\t\t= %f, %f, %f;\n",
              j.name.c_str(), j.index, j.status.c_str(), j.priority, j.executable.c_str(),
-             scene.c_str(), j.name.c_str(),
-             j.start, j.end, j.by);
+             scene.c_str(), j.name.c_str(), j.start, j.end, j.by);
     out += line;
     if (j.save_out) out += "\tsave_out\t= TRUE;\n";
     if (!j.ctrl.empty()) out += "\tctrl\t\t= " + j.ctrl + ";\n";

@@ -84,4 +84,3 @@ void Rw_note(const char* format, ...) __attribute__((format(printf, 1, 2)));
 /// The renderer's program: the environment variable `env` when set and not
 /// empty, else `fallback`.
 std::string Rw_program(const char* env, const char* fallback);
-
