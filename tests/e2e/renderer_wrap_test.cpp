@@ -202,7 +202,7 @@ TEST_P(RealRenderer, RendersSixFramesInPiecesOfTwoWithProgress) {
   EXPECT_EQ(count_of(farm_.read("JOBLOG/ball"), "FINISHED"), 3) << farm_.read("JOBLOG/ball");
 }
 
-// Blender gets a scene that is no .blend, POV-Ray one that is not there.
+// Blender gets a scene that is no .blend, POV-Ray an .ini that is not there.
 TEST_P(RealRenderer, ABrokenOrMissingSceneFailsWithTheRenderersMessageInTheComment) {
   bool blender = std::string(GetParam().program) == "blender";
   std::string scene = project_ + (blender ? "/sdl/broken.blend" : "/sdl/missing.ini");
@@ -218,7 +218,7 @@ TEST_P(RealRenderer, ABrokenOrMissingSceneFailsWithTheRenderersMessageInTheComme
 INSTANTIATE_TEST_SUITE_P(
     Wrappers, RealRenderer,
     testing::Values(Renderer{"blender", "blender_render", "Error: File format is not supported"},
-                    Renderer{"povray", "povray_render", "Cannot find file"}),
+                    Renderer{"povray", "povray_render", "Error: Problem with option setting"}),
     [](const testing::TestParamInfo<Renderer>& info) { return std::string(info.param.program); });
 
 // ---- Install and supervision -------------------------------------------------

@@ -60,7 +60,8 @@ bool ends_with(const std::string& s, const char* tail) {
 
 bool reports_trouble(const std::string& line) {
   return line.find("Error") != std::string::npos || line.find(" error") != std::string::npos ||
-         line.find("Warning:") != std::string::npos || line.find("failed") != std::string::npos;
+         line.find("Warning:") != std::string::npos || line.find("failed") != std::string::npos ||
+         line.find("Failed") != std::string::npos || line.find("Problem with") != std::string::npos;
 }
 
 // A hidden directory beside the images, removed with whatever is left in it.
@@ -143,7 +144,13 @@ int main(int argc, char** argv) {
         Rw_progress(f.image, done, all);
         total = all;
       } else if (reports_trouble(line)) {
-        Rw_note("%s", line.c_str());
+        // An .ini that cannot be read is "Problem with option setting",
+        // which the daemon would not take for an error.
+        if (line.find("Problem with") != std::string::npos) {
+          Rw_error("%s (scene \"%s\")", line.c_str(), args.scene.c_str());
+        } else {
+          Rw_note("%s", line.c_str());
+        }
       }
     });
     if (status == -1) return 1;
