@@ -1,5 +1,7 @@
 # A thin front over CMake so that the everyday commands are short.
 #   make demo   build everything and render the demo farm on this machine
+#   make demo-blender, make demo-povray   the same farm with a real renderer
+#   make install PREFIX=/usr/local   daemon, tools and wrappers in PREFIX/bin
 #   make test   build and run every test (plain build)
 #   make asan   build and run every test with AddressSanitizer + UBSan
 #   make fuzz   build the fuzzers with clang and run each for a bounded time
@@ -7,8 +9,9 @@
 JOBS ?= $(shell nproc 2>/dev/null || echo 2)
 BUILD ?= build
 FUZZ_SECONDS ?= 60
+PREFIX ?= /usr/local
 
-.PHONY: all deps configure build test asan fuzz bench demo format clean
+.PHONY: all deps configure build test asan fuzz bench demo demo-blender demo-povray install format clean
 
 all: build
 
@@ -42,6 +45,14 @@ bench: build
 demo: configure
 	cmake --build $(BUILD) -j $(JOBS) --target zarno_render_demon frame_painter
 	demo/run.sh $(BUILD)
+
+demo-blender demo-povray: configure
+	@RJ_WITH_RENDERERS=1 tools/install-deps.sh
+	cmake --build $(BUILD) -j $(JOBS) --target zarno_render_demon frame_painter $(subst demo-,,$@)_render
+	DEMO_RENDERER=$(subst demo-,,$@) demo/run.sh $(BUILD)
+
+install: build
+	cmake --install $(BUILD) --prefix $(PREFIX)
 
 format:
 	clang-format -i $$(git ls-files '*.cpp' '*.h')

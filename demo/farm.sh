@@ -8,10 +8,12 @@
 # Paths are absolute throughout: the daemon changes its working directory to
 # a job's project (the directory holding "sdl") before starting each render.
 
-farm_init() {  # build_dir farm_dir
+farm_init() {  # build_dir_or_install_prefix farm_dir
   local build exe
   build=$(cd "$1" && pwd)
   daemon=$build/zarno_render_demon
+  # An install prefix keeps the daemon beside the render programs.
+  [ -x "$build/bin/zarno_render_demon" ] && daemon=$build/bin/zarno_render_demon
   painter_bin=$build/bin
   for exe in "$daemon" "$painter_bin/frame_painter"; do
     if [ ! -x "$exe" ]; then
@@ -44,13 +46,13 @@ END_OF_RESOURCES
 
 # One job block as the queue's own writer lays it out; whole frame numbers,
 # extensions counted from the first frame, four digits.
-farm_job() {  # name index scene first last rnd_opts
+farm_job() {  # name index scene first last rnd_opts [executable]
   cat <<END_OF_JOB
 $1 $2 {
 	user	 	= ${USER:-demo};
 	status 		= "pending";
 	priority 	= 0;
-	executable 	= frame_painter;
+	executable 	= ${7:-frame_painter};
 	sdl 		= "$3";
 	pix 		= "$project/pix/$1";
 	use_sdl_paths = FALSE;

@@ -234,7 +234,6 @@ TEST_P(RendererRefuses, WithAnErrorLineAndStatusOne) {
 
 // clang-format off
 INSTANTIATE_TEST_SUITE_P(BadInvocations, RendererRefuses, testing::Values(
-    Strings{"-p", "pix/ball", "-x", "sdl/scene.sdl"},
     Strings{"-p", "pix/ball", "-s", "one", "sdl/scene.sdl"},
     Strings{"-p", "pix/ball", "-s", "1", "-e"},
     Strings{"-p", "pix/ball", "sdl/missing.sdl"},

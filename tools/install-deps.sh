@@ -20,6 +20,11 @@ have_cmd sshfs || need+=(sshfs)
 have_pkg libgtest-dev || need+=(libgtest-dev)
 have_pkg libgmock-dev || need+=(libgmock-dev)
 have_pkg libbenchmark-dev || need+=(libbenchmark-dev)
+# The real renderers the wrappers drive (large: only on request; CI asks).
+if [ "${RJ_WITH_RENDERERS:-0}" = 1 ]; then
+  have_cmd blender || need+=(blender)
+  have_cmd povray || need+=(povray)
+fi
 if [ "${RJ_NEED_CLANG:-0}" = 1 ]; then
   have_cmd clang++ || need+=(clang)
   have_pkg libclang-rt-dev || have_pkg libclang-rt-14-dev || need+=(libclang-rt-dev)

@@ -39,6 +39,46 @@
 
 namespace {
 
+constexpr const char* kUsage =
+    "usage: zarno_render_demon [-l DIRECTORY] [-u SECONDS] [-d LEVEL] [-s]\n"
+    "       zarno_render_demon -h | --help\n"
+    "\n"
+    "The render daemon of this host: renders the work of the control directory's\n"
+    "jobs that this host may take, one daemon per host.\n"
+    "\n"
+    "  -l DIRECTORY  the control directory (else the preference\n"
+    "                ZARNO_RNDCTL_LOCATION)\n"
+    "  -u SECONDS    longest wait between two passes when nothing changes\n"
+    "                (0: only on changes)\n"
+    "  -d LEVEL      debug trace on (any non-zero level)\n"
+    "  -s            single-pass flag (stored only)\n"
+    "  -h, --help    this text\n"
+    "\n"
+    "Environment:\n"
+    "  RNDCTL_DEBUG               debug level when -d is not given\n"
+    "  ZARNO_RNDCTL_LOCATION      the control directory when -l is not given\n"
+    "                             (also read from the preferences file)\n"
+    "  ZARNO_RNDCTL_ACCESS_LOG    1: also log idle exits and timed-out locks in\n"
+    "                             Render_Access (also a preference)\n"
+    "  ZARNO_RNDCTL_HOST_TIMEOUT  seconds without a heartbeat before a host's\n"
+    "                             tasks are put back (default 600)\n"
+    "  DRCTMPDIR                  directory of the log zarno_render_demon.LOG and\n"
+    "                             of the task streams (default /usr/tmp, else\n"
+    "                             /var/tmp)\n"
+    "  ZARNO_LOCATION             install directory, where the site preferences\n"
+    "                             file .ZarnoPrefs is (default /usr/qm/zarno)\n"
+    "  HOME                       where the user's .ZarnoPrefs is\n"
+    "  ZARNO_RSH                  remote shell for liveness probes of other\n"
+    "                             hosts (default rsh)\n"
+    "\n"
+    "Exit status: 0 after -h, 2 on a usage error, -1 (255) without a usable\n"
+    "control directory, 1 on every other end.\n";
+
+[[noreturn]] void usage_error(const char* what, const char* option) {
+  fprintf(stderr, "%s: %s %s\n%s", PrgName, what, option, kUsage);
+  exit(2);
+}
+
 void pid_file_path(char* out, size_t size) {
   snprintf(out, size, "%s/%s.pid", rndctl.location.or_else("."), rndctl.host.or_else(""));
 }
@@ -296,10 +336,16 @@ int main(int argc, char* argv[]) {
   long interval = 0;
   const char* location = nullptr;
   bool debug_given = false;
-  opterr = 0;  // unknown options are ignored without a word
+  opterr = 0;  // our own messages below
+  static const struct option kLong[] = {{"help", no_argument, nullptr, 'h'},
+                                        {nullptr, 0, nullptr, 0}};
   int c;
-  while ((c = getopt(argc, argv, "u:l:d:s")) != -1) {
+  while ((c = getopt_long(argc, argv, ":hu:l:d:s", kLong, nullptr)) != -1) {
+    char bad[3] = {'-', static_cast<char>(optopt), '\0'};
     switch (c) {
+      case 'h':
+        fputs(kUsage, stdout);
+        exit(0);
       case 'u':
         // Read wide, so that a huge value is refused rather than wrapped.
         interval = strtol(optarg, nullptr, 10);
@@ -314,8 +360,11 @@ int main(int argc, char* argv[]) {
       case 's':
         rndctl.single_pass = 1;
         break;
+      case ':':
+        usage_error("option needs a value:", bad);
       default:
-        break;
+        // A bad long option leaves optopt 0; its text is the word just read.
+        usage_error("unknown option", optopt != 0 ? bad : argv[optind - 1]);
     }
   }
   if (!debug_given) {
@@ -329,6 +378,10 @@ int main(int argc, char* argv[]) {
 
   if (pid_file_startup_check() != 0) exit(1);
   open_log_file();
+  // Whoever can write the control directory chooses the programs this
+  // daemon runs: as root, that is every program on the host.
+  if (geteuid() == 0)
+    EDuprintf("%s: warning: running as root; every render program runs as root too", PrgName);
   RJC_in();
   // Nothing of this host renders now: what the file says it does was left
   // by a daemon that died.

@@ -32,11 +32,11 @@ std::string job_file(const std::vector<JobSpec>& jobs, const std::string& scene)
   for (const auto& j : jobs) {
     snprintf(line, sizeof line,
              "%s %d {\n\tuser\t \t= tester;\n\tstatus \t\t= \"%s\";\n\tpriority \t= %d;\n"
-             "\texecutable \t= frame_painter;\n\tsdl \t\t= \"%s\";\n\tpix \t\t= \"pix/%s\";\n"
+             "\texecutable \t= %s;\n\tsdl \t\t= \"%s\";\n\tpix \t\t= \"pix/%s\";\n"
              "\tuse_sdl_paths = FALSE;\n\toutput_mask = FALSE;\n\tanimate\t\t= TRUE;\n"
              "\tframes\t\t= %f, %f, %f;\n",
-             j.name.c_str(), j.index, j.status.c_str(), j.priority, scene.c_str(), j.name.c_str(),
-             j.start, j.end, j.by);
+             j.name.c_str(), j.index, j.status.c_str(), j.priority, j.executable.c_str(),
+             scene.c_str(), j.name.c_str(), j.start, j.end, j.by);
     out += line;
     if (j.save_out) out += "\tsave_out\t= TRUE;\n";
     if (!j.ctrl.empty()) out += "\tctrl\t\t= " + j.ctrl + ";\n";

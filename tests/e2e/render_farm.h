@@ -27,6 +27,7 @@ struct JobSpec {
   std::string ctrl;  // "SCHEDULE", "PAUSED", ... or empty
   std::string runs;  // e.g. "\t{ 800 to 900 Monday }"
   bool save_out = false;
+  std::string executable = "frame_painter";
 };
 
 std::string resource_file(const std::vector<ResourceSpec>& resources);

@@ -38,6 +38,7 @@ constexpr const char* kUsage =
     "usage: frame_painter -p PIX [-m MATTE] [-A] [-s START -e END -b BY]\n"
     "                     [-S FIRSTEXT -B EXTSTEP] [-E EXTSIZE] [-V] [-nN]\n"
     "                     [\"OPTIONS\"] SCENE\n"
+    "       frame_painter -h | --help\n"
     "\n"
     "Paints the frames START, START+BY, ... up to END of SCENE into PNG files\n"
     "named PIX.<extension> (MATTE.<extension> for the ball's matte with -m).\n"
@@ -145,7 +146,8 @@ bool to_signal(const std::string& s, int* out) {
   return false;
 }
 
-// Returns 0 when parsed, 1 for a usage error (reported), 2 after -h.
+// Returns 0 when parsed, 1 for a bad argument (reported), 2 after -h, 3 for
+// an unknown option (reported, with the usage on stderr).
 int parse_arguments(int argc, char** argv, Settings* st) {
   std::vector<const char*> positional;
   bool options_done = false;
@@ -172,8 +174,9 @@ int parse_arguments(int argc, char** argv, Settings* st) {
 
     static const std::string kWithValue = "pmsebSBE";
     if (opt.size() != 2 || kWithValue.find(opt[1]) == std::string::npos) {
-      error_line("unknown option \"%s\" (frame_painter -h for help)", a);
-      return 1;
+      error_line("unknown option \"%s\"", a);
+      fputs(kUsage, stderr);
+      return 3;
     }
     if (i + 1 >= argc) {
       error_line("option %s needs a value", a);
@@ -340,6 +343,7 @@ int main(int argc, char** argv) {
   Settings st;
   int rc = parse_arguments(argc, argv, &st);
   if (rc == 2) return 0;
+  if (rc == 3) return 2;
   if (rc != 0 || !parse_render_options(&st)) return 1;
 
   Scene scene;

@@ -35,6 +35,16 @@ void RJC_init_rndctl(const char* location) {
   const char* install = getenv("ZARNO_LOCATION");
   rndctl.install.set(install != nullptr ? install : "/usr/qm/zarno");
 
+  // The optional access-log lines (idle exits, timed-out locks): on when
+  // ZARNO_RNDCTL_ACCESS_LOG, from the environment or else the preferences
+  // file (only when there is one to read: its lookup complains otherwise),
+  // is a non-zero number.
+  const char* access_log = getenv("ZARNO_RNDCTL_ACCESS_LOG");
+  const char* prefs = access_log == nullptr ? find_variable_file(0, nullptr, nullptr) : nullptr;
+  if (prefs != nullptr && *prefs != '\0' && access(prefs, R_OK) == 0)
+    access_log = get_zarno_variable("ZARNO_RNDCTL_ACCESS_LOG");
+  if (access_log != nullptr && atoi(access_log) != 0) debug_fileacc = 1;
+
   dbgpnt("%s %d %s -------------------------------------------RJC_init_rndctl\n",
          rndctl.host.or_else(""), rndctl.pid, rndctl.user.or_else("(null)"));
 }

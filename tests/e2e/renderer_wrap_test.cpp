@@ -1,0 +1,264 @@
+// The installed programs from the outside: their command lines, the real
+// renderers' wrappers under the real daemon, the systemd units, and an
+// install into a scratch prefix whose daemon renders the demo.
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <regex>
+
+#include "tests/e2e/render_farm.h"
+
+namespace {
+
+struct Ran {
+  int status = -1;
+  std::string out, err;
+  int code() const { return WIFEXITED(status) ? WEXITSTATUS(status) : -1; }
+};
+
+// Runs argv (a path or a name found through PATH) with `cwd` as working
+// directory, its stdout and stderr in files under `scratch`.
+Ran run(const std::vector<std::string>& args, const std::string& scratch,
+        const std::string& cwd = "") {
+  std::string out_path = scratch + "/run.out", err_path = scratch + "/run.err";
+  std::vector<std::string> copy = args;
+  std::vector<char*> argv;
+  for (std::string& a : copy) argv.push_back(a.data());
+  argv.push_back(nullptr);
+  pid_t pid = fork();
+  if (pid == 0) {
+    int out = open(out_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    int err = open(err_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    if (out < 0 || err < 0 || (!cwd.empty() && chdir(cwd.c_str()) != 0)) _exit(127);
+    dup2(out, 1);
+    dup2(err, 2);
+    execvp(argv[0], argv.data());
+    _exit(127);
+  }
+  Ran r;
+  waitpid(pid, &r.status, 0);
+  r.out = read_text_file(out_path);
+  r.err = read_text_file(err_path);
+  return r;
+}
+
+bool on_path(const std::string& program) {
+  Farm scratch;
+  return run({"sh", "-c", "command -v " + program}, scratch.dir()).code() == 0;
+}
+
+// Width and height from a PNG's header; false when it is not a PNG.
+bool png_size(const std::string& path, int* width, int* height) {
+  std::string data = read_text_file(path);
+  if (data.size() < 24 || data.compare(0, 8, "\x89PNG\r\n\x1a\n") != 0 ||
+      data.compare(12, 4, "IHDR") != 0)
+    return false;
+  auto be32 = [&](size_t at) {
+    return (static_cast<unsigned char>(data[at]) << 24) |
+           (static_cast<unsigned char>(data[at + 1]) << 16) |
+           (static_cast<unsigned char>(data[at + 2]) << 8) |
+           static_cast<unsigned char>(data[at + 3]);
+  };
+  *width = be32(16);
+  *height = be32(20);
+  return true;
+}
+
+// ---- Command lines ----------------------------------------------------------
+
+struct Program {
+  const char* path;
+  std::vector<std::string> named;  // what the usage must name
+};
+
+class CommandLine : public ::testing::TestWithParam<Program> {};
+
+TEST_P(CommandLine, HelpExitsZeroAndABadOptionExitsTwoWithTheUsage) {
+  Farm scratch;
+  for (const char* help : {"-h", "--help"}) {
+    Ran r = run({GetParam().path, help}, scratch.dir());
+    EXPECT_EQ(r.code(), 0) << help << r.err;
+    EXPECT_NE(r.out.find("usage:"), std::string::npos) << r.out;
+    for (const std::string& word : GetParam().named)
+      EXPECT_NE(r.out.find(word), std::string::npos) << word << " missing from\n" << r.out;
+  }
+  // The bad option first: the daemon must not start on the directory "p"
+  // that getopt would read out of "--help-me".
+  mkdir(scratch.path("p").c_str(), 0777);
+  for (const char* bad : {"--help-me", "-x"}) {
+    Ran r = run({GetParam().path, bad, "-p", "pix/x", "scene"}, scratch.dir(), scratch.dir());
+    EXPECT_EQ(r.code(), 2) << bad << "\n" << r.err;
+    EXPECT_NE(r.err.find(bad), std::string::npos) << r.err;
+    EXPECT_NE(r.err.find("usage:"), std::string::npos) << r.err;
+  }
+  EXPECT_FALSE(access(scratch.path(this_host_name() + ".pid").c_str(), F_OK) == 0);
+}
+
+const std::vector<std::string> kWrapperWords = {"-p", "-m", "-A", "-s", "-e", "-b",
+                                                "-S", "-B", "-E", "-V", "-n", "OPTIONS"};
+std::vector<std::string> wrapper_words(const char* env) {
+  std::vector<std::string> w = kWrapperWords;
+  w.push_back(env);
+  return w;
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    InstalledPrograms, CommandLine,
+    testing::Values(Program{DAEMON_PATH,
+                            {"-l", "-u", "-d", "-s", "RNDCTL_DEBUG", "ZARNO_RNDCTL_LOCATION",
+                             "ZARNO_RNDCTL_ACCESS_LOG", "ZARNO_RNDCTL_HOST_TIMEOUT", "DRCTMPDIR",
+                             "ZARNO_LOCATION", "HOME", "ZARNO_RSH"}},
+                    Program{FRAME_PAINTER_PATH, kWrapperWords},
+                    Program{BLENDER_RENDER_PATH, wrapper_words("BLENDER")},
+                    Program{POVRAY_RENDER_PATH, wrapper_words("POVRAY")}));
+
+TEST(CommandLine, TheDaemonWarnsInItsLogWhenItRunsAsRoot) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root";
+  Farm farm;
+  farm.write("Render_Resource_Control", "RenderResourceControl\nEnd\n");
+  farm.write("Render_Job_Control", "RenderJobControl 0 0\nEnd\n");
+  Daemon& d = farm.start_on_farm();
+  ASSERT_TRUE(wait_for([&] { return d.log().find("running as root") != std::string::npos; }, 30))
+      << d.log();
+}
+
+// ---- Real renderers under the daemon ----------------------------------------
+
+struct Renderer {
+  const char* program;         // the renderer itself
+  const char* wrapper;         // the job's executable
+  const char* broken_message;  // in the job's comment for a broken scene
+};
+
+class RealRenderer : public ::testing::TestWithParam<Renderer> {
+ protected:
+  void SetUp() override {
+    if (!on_path(GetParam().program))
+      GTEST_SKIP() << GetParam().program
+                   << " is not installed (RJ_WITH_RENDERERS=1 tools/install-deps.sh)";
+    host_ = this_host_name();
+    project_ = farm_.path("project");
+    for (const char* dir : {"", "/sdl", "/pix"}) mkdir((project_ + dir).c_str(), 0777);
+  }
+  // The demo scene of the renderer, made or copied into the project.
+  std::string demo_scene() {
+    std::string demo = DEMO_DIR;
+    if (std::string(GetParam().program) == "blender") {
+      std::string scene = project_ + "/sdl/ball.blend";
+      Ran r = run({"blender", "-b", "--factory-startup", "--python",
+                   demo + "/blender/make_scene.py", "--", scene},
+                  farm_.dir());
+      EXPECT_EQ(r.code(), 0) << r.out << r.err;
+      return scene;
+    }
+    for (const char* f : {"ball.pov", "ball.ini"})
+      write_text_file(project_ + "/sdl/" + f, read_text_file(demo + "/povray/" + f));
+    return project_ + "/sdl/ball.ini";
+  }
+  Daemon& start(const std::string& scene, int processors) {
+    ResourceSpec r;
+    r.name = host_;
+    r.max_frames = 2;
+    r.num_processors = processors;
+    JobSpec j;
+    j.name = "ball";
+    j.start = 1;
+    j.end = 6;
+    j.hosts = {host_};
+    j.executable = GetParam().wrapper;
+    farm_.write("Render_Resource_Control", resource_file({r}));
+    farm_.write("Render_Job_Control", job_file({j}, scene));
+    return farm_.start_on_farm({}, "", render_env());
+  }
+
+  Farm farm_;
+  std::string host_, project_;
+};
+
+TEST_P(RealRenderer, RendersSixFramesInPiecesOfTwoWithProgress) {
+  Daemon& d = start(demo_scene(), 1);
+  // One processor: the pieces run one after the other, and the job shows
+  // its percentage between them.
+  std::regex progress("[0-9]+\\.[0-9][0-9]% ");
+  ASSERT_TRUE(
+      wait_for([&] { return std::regex_match(job_status(farm_, "ball"), progress); }, 120, &d))
+      << job_status(farm_, "ball") << "\n"
+      << d.log();
+  ASSERT_TRUE(
+      wait_for([&] { return job_status(farm_, "ball") == "finished" || d.ended(); }, 240, &d));
+  ASSERT_EQ(job_status(farm_, "ball"), "finished") << d.log();
+  for (int frame = 1; frame <= 6; ++frame) {
+    int w = 0, h = 0;
+    std::string image = project_ + "/pix/ball." + std::to_string(frame);
+    ASSERT_TRUE(png_size(image, &w, &h)) << image;
+    EXPECT_EQ(w, 64);
+    EXPECT_EQ(h, 48);
+  }
+  EXPECT_FALSE(access((project_ + "/pix/ball.7").c_str(), F_OK) == 0);
+  // The three pieces, as the job log lists them.
+  EXPECT_EQ(count_of(farm_.read("JOBLOG/ball"), "FINISHED"), 3) << farm_.read("JOBLOG/ball");
+}
+
+// Blender gets a scene that is no .blend, POV-Ray an .ini that is not there.
+TEST_P(RealRenderer, ABrokenOrMissingSceneFailsWithTheRenderersMessageInTheComment) {
+  bool blender = std::string(GetParam().program) == "blender";
+  std::string scene = project_ + (blender ? "/sdl/broken.blend" : "/sdl/missing.ini");
+  if (blender) write_text_file(scene, "sphere { <0, 0, 0> 1 }\n");
+  Daemon& d = start(scene, 2);
+  ASSERT_TRUE(wait_for(
+      [&] { return job_block(farm_, "ball").find("ERROR: ") != std::string::npos; }, 120, &d))
+      << job_block(farm_, "ball") << d.log();
+  EXPECT_NE(job_block(farm_, "ball").find(GetParam().broken_message), std::string::npos)
+      << job_block(farm_, "ball");
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Wrappers, RealRenderer,
+    testing::Values(Renderer{"blender", "blender_render", "Error: File format is not supported"},
+                    Renderer{"povray", "povray_render", "Error: Problem with option setting"}),
+    [](const testing::TestParamInfo<Renderer>& info) { return std::string(info.param.program); });
+
+// ---- Install and supervision -------------------------------------------------
+
+TEST(Install, TheInstalledDaemonRendersTheDemo) {
+  Farm scratch;
+  std::string prefix = scratch.path("prefix");
+  Ran install = run({"cmake", "--install", BUILD_DIR, "--prefix", prefix}, scratch.dir());
+  ASSERT_EQ(install.code(), 0) << install.out << install.err;
+  for (const char* program :
+       {"zarno_render_demon", "frame_painter", "blender_render", "povray_render"})
+    EXPECT_EQ(access((prefix + "/bin/" + program).c_str(), X_OK), 0) << program;
+  EXPECT_EQ(access((prefix + "/lib/systemd/system/zarno-render.service").c_str(), R_OK), 0);
+  EXPECT_EQ(access((prefix + "/lib/systemd/system/zarno-render@.service").c_str(), R_OK), 0);
+
+  // The installed demo script, run on the installed programs only.
+  Ran demo = run({"env", "PATH=/usr/bin:/bin", prefix + "/share/zarno_render/demo/run.sh", prefix},
+                 scratch.dir());
+  ASSERT_EQ(demo.code(), 0) << demo.out << demo.err;
+  EXPECT_NE(demo.out.find("ball: finished"), std::string::npos) << demo.out;
+  int w = 0, h = 0;
+  EXPECT_TRUE(png_size(prefix + "/demo_farm/project/pix/ball.0024", &w, &h)) << demo.out;
+}
+
+TEST(Install, SystemdAcceptsTheUnits) {
+  Farm scratch;
+  if (run({"sh", "-c", "command -v systemd-analyze"}, scratch.dir()).code() != 0)
+    GTEST_SKIP() << "systemd-analyze is not installed";
+  std::string unit_dir = scratch.path("units");
+  mkdir(unit_dir.c_str(), 0777);
+  for (const char* unit : {"zarno-render.service", "zarno-render@.service"})
+    write_text_file(unit_dir + "/" + unit, read_text_file(std::string(BUILD_DIR) + "/" + unit));
+  // A template is checked through an instance of it.
+  symlink((unit_dir + "/zarno-render@.service").c_str(),
+          (unit_dir + "/zarno-render@farm.service").c_str());
+  for (const char* unit : {"zarno-render.service", "zarno-render@farm.service"}) {
+    Ran r = run({"systemd-analyze", "verify", "--man=no", unit_dir + "/" + unit}, scratch.dir());
+    EXPECT_EQ(r.code(), 0) << unit << "\n" << r.out << r.err;
+    EXPECT_EQ(r.err.find(unit), std::string::npos) << r.err;
+  }
+}
+
+}  // namespace

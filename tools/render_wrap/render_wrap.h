@@ -1,0 +1,86 @@
+// render_wrap: what every wrapper around a real renderer shares.
+//
+// The daemon runs a job's render program with its own argument list
+//   -p PIX [-m MATTE] -A [-s START -e END -b BY [-S FIRSTEXT -B EXTSTEP] -E EXTSIZE]
+//   [-V] [-nN] ["OPTIONS"] SCENE
+// with stderr going to the task's stream file, whose last line it reads as
+// progress ("<image>.<extension> r <lines done + 2> of <lines>"), and stdout
+// going to the task's output file, whose first line holding "Error" becomes
+// the job's comment when the task fails.  A wrapper parses that list with
+// Rw_parse, lists the frames and the file names the daemon expects with
+// Rw_frames, runs its renderer with Rw_run (which hands it the renderer's
+// output line by line, carriage-return progress included), turns those lines
+// into Rw_progress and Rw_error calls, and moves each finished image into
+// place with Rw_move.  A wrapper exits 0 when every frame was written and 1
+// at the first frame that was not: the daemon then cuts the task at the last
+// frame reported.
+#pragma once
+
+#include <functional>
+#include <string>
+#include <vector>
+
+/// The daemon's argument list, as parsed.
+struct RwArgs {
+  std::string pix, matte, scene, options;
+  bool animate = false;  // -s was given: a frame range, else one still to PIX
+  float start = 1, end = 1, by = 1;
+  bool have_first_ext = false;
+  int first_ext = 0, ext_step = 1;
+  int ext_size = 1;
+  int processors = 0;  // from -nN, 0 when not given
+};
+
+/// One frame to render and the file the daemon expects for it.
+struct RwFrame {
+  float frame = 0;
+  int extension = 0;
+  std::string image;  // PIX.<extension, zero-padded to EXTSIZE>, or PIX for a still
+};
+
+enum class RwParse {
+  kOk,     // parsed
+  kHelp,   // -h/--help: the usage went to stdout; exit 0
+  kUsage,  // an unknown option: named on stderr with the usage; exit 2
+  kBad,    // a bad value or a missing argument: an error line went out; exit 1
+};
+
+/// Parses argv.  `usage` is the program's whole usage text.
+[[nodiscard]] RwParse Rw_parse(int argc, char** argv, const char* usage, RwArgs* out);
+/// The exit status for a parse result other than kOk.
+int Rw_parse_exit(RwParse result);
+
+/// The frames of the range as the queue counts them (values below the end,
+/// plus the end when the steps land on it), each with its extension: FIRSTEXT
+/// + i * EXTSTEP with -S, else the frame number with its fraction dropped.
+std::vector<RwFrame> Rw_frames(const RwArgs& args);
+
+/// The options argument cut at blanks.
+std::vector<std::string> Rw_words(const std::string& text);
+
+/// "<base name of image> r <done + 2> of <total>" on stderr (the reader
+/// subtracts 2 from the number it reads).
+void Rw_progress(const std::string& image, int done, int total);
+/// "Error: <message>" on stdout, where the daemon looks for the reason of a
+/// failed task.  Never on stderr: the last progress line must stay that
+/// stream's last line, for the daemon cuts a failed task at its frame.
+void Rw_error(const char* format, ...) __attribute__((format(printf, 1, 2)));
+/// A line for the job log (stdout).
+void Rw_note(const char* format, ...) __attribute__((format(printf, 1, 2)));
+
+/// Runs argv (through PATH) with stdout and stderr into one pipe and calls
+/// `line` for every line it writes, a line ending at '\n' or '\r', without
+/// the ending.  Returns the exit status, 128 + the signal when it died by
+/// one, or -1 when it could not be started (reported through Rw_error).
+/// The renderer stays in the wrapper's process group, so that the daemon's
+/// kill of the group ends it too.
+[[nodiscard]] int Rw_run(const std::vector<std::string>& argv,
+                         const std::function<void(const std::string&)>& line);
+
+/// Moves a rendered image to its name, by rename or, across file systems, by
+/// copy and unlink.  False (with the reason in *why) when it could not.
+[[nodiscard]] bool Rw_move(const std::string& from, const std::string& to, std::string* why);
+
+/// The renderer's program: the environment variable `env` when set and not
+/// empty, else `fallback`.
+std::string Rw_program(const char* env, const char* fallback);
