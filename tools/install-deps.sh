@@ -25,6 +25,10 @@ if [ "${RJ_WITH_RENDERERS:-0}" = 1 ]; then
   have_cmd blender || need+=(blender)
   have_cmd povray || need+=(povray)
 fi
+# The queue command-line tool: options, JSON output, and its terminal view's test.
+have_pkg libcli11-dev || need+=(libcli11-dev)
+have_pkg nlohmann-json3-dev || need+=(nlohmann-json3-dev)
+have_cmd tmux || need+=(tmux)
 if [ "${RJ_NEED_CLANG:-0}" = 1 ]; then
   have_cmd clang++ || need+=(clang)
   have_pkg libclang-rt-dev || have_pkg libclang-rt-14-dev || need+=(libclang-rt-dev)

@@ -1,0 +1,435 @@
+#include "tools/rndctl/commands.h"
+
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstdio>
+#include <cstring>
+#include <thread>
+
+#include "tools/rndctl/editor_side.h"
+#include "tools/rndctl/tables.h"
+
+namespace {
+
+int fail(const std::string& why) {
+  fprintf(stderr, "rndctl: %s\n", why.c_str());
+  return 1;
+}
+
+int finish(CtlEdit result, const std::string& why) { return result == CTL_WRITTEN ? 0 : fail(why); }
+
+bool grid_empty(const int* grid) {
+  for (int i = 0; i < RJ_WEEK; i++)
+    if (grid[i] != 0) return false;
+  return true;
+}
+
+// Finds the job and refuses one an editor holds, unless forced.
+Job* editable_job(const std::string& key, bool force, std::string* why) {
+  Job* job = Ctl_find_job(key);
+  if (job == nullptr) {
+    *why = "no job \"" + key + "\"";
+    return nullptr;
+  }
+  if (!force && Ctl_held(job->lock_pid)) {
+    *why = "job \"" + key + "\" is held by editor pid " + std::to_string(job->lock_pid) +
+           " (use --force)";
+    return nullptr;
+  }
+  return job;
+}
+
+Dev* editable_dev(const std::string& name, bool force, std::string* why) {
+  Dev* dev = Dev_by_name(name.c_str());
+  if (dev == nullptr) {
+    *why = "no host \"" + name + "\"";
+    return nullptr;
+  }
+  if (!force && Ctl_held(dev->lock_pid)) {
+    *why = "host \"" + name + "\" is held by editor pid " + std::to_string(dev->lock_pid) +
+           " (use --force)";
+    return nullptr;
+  }
+  return dev;
+}
+
+bool load(std::string* why) { return Ctl_load(why); }
+
+std::string read_whole(const std::string& path) {
+  std::string text;
+  FILE* fp = fopen(path.c_str(), "re");
+  if (fp == nullptr) return text;
+  char buf[1 << 14];
+  size_t n;
+  while ((n = fread(buf, 1, sizeof buf, fp)) > 0) text.append(buf, n);
+  fclose(fp);
+  return text;
+}
+
+}  // namespace
+
+int Cmd_submit(const SubmitOptions& o) {
+  std::string why;
+  // Everything the user typed is judged before anything is written.
+  CtlFrames frames;
+  bool have_frames = !o.frames.empty();
+  if (have_frames && !Ctl_parse_frames(o.frames, &frames, &why)) return fail(why);
+  std::vector<CtlBlock> blocks;
+  for (const auto& s : o.schedules) {
+    CtlBlock b;
+    if (!Ctl_parse_block(s, &b, &why)) return fail(why);
+    blocks.push_back(b);
+  }
+  std::string name = o.name;
+  if (name.empty()) {
+    size_t slash = o.scene.rfind('/');
+    name = slash == std::string::npos ? o.scene : o.scene.substr(slash + 1);
+  }
+  if (!Ctl_word_ok(name, &why)) return fail(why + "; give one with --name");
+  for (const std::string* s : {&o.scene, &o.pix, &o.matte, &o.opts})
+    if (!Ctl_string_ok(*s, &why)) return fail(why);
+  for (const auto& s : o.searchpaths)
+    if (!Ctl_string_ok(s, &why)) return fail(why);
+  if (!o.executable.empty() && !Ctl_word_ok(o.executable, &why)) return fail(why);
+  if (rndctl.user && !Ctl_word_ok(rndctl.user.c_str(), &why)) return fail("your user name: " + why);
+  struct stat st;
+  if (stat(o.scene.c_str(), &st) != 0 || !S_ISREG(st.st_mode))
+    return fail("cannot read scene \"" + o.scene + "\"");
+  std::vector<std::string> host_names =
+      o.hosts == "all" ? std::vector<std::string>{} : Ctl_split(o.hosts, ',');
+  if (o.hosts != "all" && host_names.empty()) return fail("no hosts given");
+
+  int index = 0;
+  std::string made;
+  CtlEdit r = Ctl_edit_jobs(
+      [&](std::string* why, std::vector<std::string>* wake) {
+        if (Job_by_name(name.c_str()) != nullptr) {
+          *why = "a job named \"" + name + "\" is already queued";
+          return false;
+        }
+        std::vector<Dev*> devs;
+        for (const auto& h : host_names) {
+          Dev* d = Dev_by_name(h.c_str());
+          if (d == nullptr) {
+            *why = "unknown host \"" + h + "\"";
+            return false;
+          }
+          devs.push_back(d);
+        }
+        if (devs.empty())
+          for (Dev* d = rndctl.devs; d != nullptr; d = d->next) devs.push_back(d);
+        if (devs.empty()) {
+          *why = "no hosts in the resource file";
+          return false;
+        }
+        index = RJCget_next_index(FILE_JOB_INDEX);
+        Job* job = Add_a_job(nullptr, o.scene.c_str(), index);
+        job->name.set(name.c_str());
+        job->user.set(rndctl.user.c_str());
+        job->status.set("pending");
+        job->priority = o.priority;
+        if (!o.executable.empty()) job->executable.set(o.executable.c_str());
+        if (!o.pix.empty()) {
+          job->pix.set(o.pix.c_str());
+          job->use_sdl_paths = 0;
+        }
+        if (!o.matte.empty()) job->matte.set(o.matte.c_str());
+        if (!o.opts.empty()) job->rnd_opts.set(o.opts.c_str());
+        for (const auto& p : o.searchpaths) RndPathList_add(job, p.c_str());
+        job->del_when_done = o.delete_when_done ? 1 : 0;
+        job->save_out = o.keep_output ? 1 : 0;
+        (void)Job_set_frame_range(job);
+        (void)Job_check_sdlfields(job);
+        if (have_frames) {
+          job->animate = 1;
+          job->frames[0] = frames.start;
+          job->frames[1] = frames.end;
+          job->frames[2] = frames.by;
+          job->totalframes = Calc_frame_range(frames.start, frames.end, frames.by);
+        }
+        if (job->animate && job->frames[2] <= 0) job->frames[2] = 1;
+        if (job->animate && job->frames[1] < job->frames[0]) {
+          *why = "the scene's frame range runs backwards; give one with --frames";
+          return false;
+        }
+        job->doneframes = 0;
+        job->ctrl = o.paused ? RUN_PAUSED : blocks.empty() ? RUN_AVAILABLE : RUN_SCHEDULE;
+        for (const auto& b : blocks)
+          Ctl_apply_block(b, [&](int s, int e, const char* f, const char* l) {
+            Schedule_job_runs(job, s, e, f, l);
+          });
+        for (Dev* d : devs) RndDevList_add(job, d);
+        made = job->name.c_str();
+        *wake = Ctl_job_hosts(job);
+        return true;
+      },
+      &why);
+  if (r != CTL_WRITTEN) return fail(why);
+  printf("%d %s\n", index, made.c_str());
+  return 0;
+}
+
+int Cmd_jobs(bool json) {
+  std::string why;
+  if (!load(&why)) return fail(why);
+  if (json) {
+    printf("%s\n", Out_jobs_json(nullptr).dump(2).c_str());
+  } else {
+    Out_jobs_table(stdout, Out_colour(stdout));
+  }
+  return 0;
+}
+
+int Cmd_show(const std::string& key, bool json) {
+  std::string why;
+  if (!load(&why)) return fail(why);
+  Job* job = Ctl_find_job(key);
+  if (job == nullptr) return fail("no job \"" + key + "\"");
+  CtlTasks tasks;
+  if (!Ctl_read_tasks(&tasks)) return fail("cannot read the task file");
+  std::string log_path =
+      std::string(rndctl.location.c_str()) + "/JOBLOG/" + RJC_label_form(job->name.c_str());
+  std::string log = read_whole(log_path);
+  if (json) {
+    nlohmann::json j = Out_job_json(job, &tasks);
+    j["log"] = log;
+    printf("%s\n", j.dump(2).c_str());
+  } else {
+    Out_job_full(stdout, job, tasks);
+    if (!log.empty()) printf("  log\n%s", log.c_str());
+  }
+  return 0;
+}
+
+int Cmd_job_change(const std::string& what, const std::string& key, bool force) {
+  std::string why;
+  return finish(Ctl_edit_jobs(
+                    [&](std::string* why, std::vector<std::string>* wake) {
+                      Job* job = editable_job(key, force, why);
+                      if (job == nullptr) return false;
+                      *wake = Ctl_job_hosts(job);
+                      if (what == "pause") {
+                        job->ctrl = RUN_PAUSED;
+                      } else if (what == "resume") {
+                        job->ctrl = grid_empty(job->runs) ? RUN_AVAILABLE : RUN_SCHEDULE;
+                      } else if (what == "abort") {
+                        job->status.set("aborted");
+                      } else {
+                        job->deleted = 1;
+                      }
+                      return true;
+                    },
+                    &why),
+                why);
+}
+
+int Cmd_restart(const std::string& key, bool force, double timeout_seconds) {
+  std::string why;
+  int index = 0;
+  // First the order to stop: the daemons abort the job's tasks they run.
+  CtlEdit r = Ctl_edit_jobs(
+      [&](std::string* why, std::vector<std::string>* wake) {
+        Job* job = editable_job(key, force, why);
+        if (job == nullptr) return false;
+        index = job->index;
+        job->status.set("restarted");
+        *wake = Ctl_job_hosts(job);
+        return true;
+      },
+      &why);
+  if (r != CTL_WRITTEN) return fail(why);
+  // Then wait until no task of the job is taken or running any more.
+  auto until = std::chrono::steady_clock::now() + std::chrono::duration<double>(timeout_seconds);
+  for (;;) {
+    if (!load(&why)) return fail(why);
+    Job* job = Job_by_index(index);
+    if (job == nullptr) return fail("job \"" + key + "\" left the queue while restarting");
+    CtlTasks tasks;
+    if (!Ctl_read_tasks(&tasks)) return fail("cannot read the task file");
+    int active = Ctl_active_tasks(tasks, job);
+    if (active == 0) break;
+    if (std::chrono::steady_clock::now() > until) {
+      return fail("job \"" + key + "\" still has " + std::to_string(active) +
+                  " task(s) running after " + std::to_string(static_cast<int>(timeout_seconds)) +
+                  " s; it stays \"restarted\" (run restart again later)");
+    }
+    std::this_thread::sleep_for(std::chrono::milliseconds(200));
+  }
+  // Clear the group, then make the job pending from frame one.
+  int cleared = Task_file_rewrite([&](TaskGroup** groups) {
+    Job* job = Job_by_index(index);
+    TaskGroup* g = job != nullptr ? TaskGroup_by_job(*groups, job) : nullptr;
+    if (g == nullptr) return false;
+    TaskGroup_free(groups, g);
+    return true;
+  });
+  if (cleared < 0) return fail("cannot rewrite the task file");
+  r = Ctl_edit_jobs(
+      [&](std::string* why, std::vector<std::string>* wake) {
+        Job* job = Job_by_index(index);
+        if (job == nullptr) {
+          *why = "job \"" + key + "\" left the queue while restarting";
+          return false;
+        }
+        job->doneframes = 0;
+        job->comment.reset();
+        job->status.set("pending");
+        *wake = Ctl_job_hosts(job);
+        return true;
+      },
+      &why);
+  return finish(r, why);
+}
+
+int Cmd_hosts(bool json) {
+  std::string why;
+  if (!load(&why)) return fail(why);
+  CtlTasks tasks;
+  if (!Ctl_read_tasks(&tasks)) return fail("cannot read the task file");
+  if (json) {
+    printf("%s\n", Out_hosts_json(tasks).dump(2).c_str());
+  } else {
+    Out_hosts_table(stdout, tasks, Out_colour(stdout));
+  }
+  return 0;
+}
+
+int Cmd_host_change(const std::string& what, const HostOptions& o, bool force) {
+  std::string why;
+  if (what == "add" && !Ctl_word_ok(o.name, &why)) return fail(why);
+  if (!o.host.empty() && !Ctl_word_ok(o.host, &why)) return fail(why);
+  if (o.processors == 0 || o.processors < -1) return fail("--processors must be at least 1");
+  if (o.frames == 0 || o.frames < -1) return fail("--frames must be at least 1");
+  return finish(Ctl_edit_devs(
+                    [&](std::string* why, std::vector<std::string>* wake) {
+                      Dev* dev;
+                      if (what == "add") {
+                        if (Dev_by_name(o.name.c_str()) != nullptr) {
+                          *why = "host \"" + o.name + "\" exists already";
+                          return false;
+                        }
+                        dev = Add_a_dev(nullptr, o.name.c_str(), RJCget_next_index(FILE_DEV_INDEX));
+                        dev->host_name.set(o.host.empty() ? o.name.c_str() : o.host.c_str());
+                        dev->status = LOCK_AVAILABLE;
+                        dev->num_processors = 1;
+                      } else {
+                        dev = editable_dev(o.name, force, why);
+                        if (dev == nullptr) return false;
+                      }
+                      wake->push_back(dev->host_name.or_else(o.name.c_str()));
+                      if (what == "remove") {
+                        Dev_del(dev);
+                        return true;
+                      }
+                      if (what == "lock") dev->status = LOCK_LOCKED;
+                      if (what == "unlock")
+                        dev->status = grid_empty(dev->locks) ? LOCK_AVAILABLE : LOCK_SCHEDULE;
+                      if (!o.host.empty()) dev->host_name.set(o.host.c_str());
+                      if (o.processors > 0) dev->num_processors = o.processors;
+                      if (o.frames > 0) dev->max_frames = o.frames;
+                      wake->push_back(dev->host_name.c_str());
+                      return true;
+                    },
+                    &why),
+                why);
+}
+
+int Cmd_host_schedule(const std::string& name, const std::vector<std::string>& texts, bool force) {
+  std::string why;
+  std::vector<CtlBlock> blocks;
+  for (const auto& s : texts) {
+    CtlBlock b;
+    if (!Ctl_parse_block(s, &b, &why)) return fail(why);
+    blocks.push_back(b);
+  }
+  return finish(Ctl_edit_devs(
+                    [&](std::string* why, std::vector<std::string>* wake) {
+                      Dev* dev = editable_dev(name, force, why);
+                      if (dev == nullptr) return false;
+                      for (int i = 0; i < RJ_WEEK_SCAN; i++) dev->locks[i] = 0;
+                      for (const auto& b : blocks)
+                        Ctl_apply_block(b, [&](int s, int e, const char* f, const char* l) {
+                          Schedule_dev_lock(dev, s, e, f, l);
+                        });
+                      dev->status = blocks.empty() ? LOCK_AVAILABLE : LOCK_SCHEDULE;
+                      wake->push_back(dev->host_name.or_else(name.c_str()));
+                      return true;
+                    },
+                    &why),
+                why);
+}
+
+int Cmd_check(bool json) {
+  std::string why;
+  if (!load(&why)) return fail(why);
+  int put_back = 0;
+  for (Job* j = rndctl.jobs; j != nullptr; j = j->next) put_back += Task_file_check(j);
+  Editor_process_list(0);
+  int jobs_fixed = 0, devs_fixed = 0;
+  CtlEdit r = Ctl_edit_jobs(
+      [&](std::string*, std::vector<std::string>*) {
+        std::vector<std::pair<int, std::string>> before;
+        for (Job* j = rndctl.jobs; j != nullptr; j = j->next)
+          before.push_back({j->lock_pid, j->user.or_else("")});
+        Job_field_check();
+        size_t i = 0;
+        for (Job* j = rndctl.jobs; j != nullptr; j = j->next, i++)
+          if (before[i].first != j->lock_pid || before[i].second != j->user.or_else(""))
+            jobs_fixed++;
+        return true;
+      },
+      &why);
+  if (r != CTL_WRITTEN) return fail(why);
+  r = Ctl_edit_devs(
+      [&](std::string*, std::vector<std::string>*) {
+        std::vector<int> before;
+        for (Dev* d = rndctl.devs; d != nullptr; d = d->next) before.push_back(d->lock_pid);
+        Dev_field_check();
+        size_t i = 0;
+        for (Dev* d = rndctl.devs; d != nullptr; d = d->next, i++)
+          if (before[i] != d->lock_pid) devs_fixed++;
+        return true;
+      },
+      &why);
+  if (r != CTL_WRITTEN) return fail(why);
+  if (json) {
+    nlohmann::json j = {
+        {"jobs_put_back", put_back}, {"jobs_fixed", jobs_fixed}, {"hosts_fixed", devs_fixed}};
+    printf("%s\n", j.dump(2).c_str());
+  } else {
+    printf("jobs with tasks put back: %d\njobs fixed: %d\nhosts fixed: %d\n", put_back, jobs_fixed,
+           devs_fixed);
+  }
+  return 0;
+}
+
+int Cmd_log(const std::string& key, int task) {
+  std::string why;
+  if (!load(&why)) return fail(why);
+  Job* job = Ctl_find_job(key);
+  if (job == nullptr) return fail("no job \"" + key + "\"");
+  std::string path =
+      std::string(rndctl.location.c_str()) + "/JOBLOG/" + RJC_label_form(job->name.c_str());
+  if (task < 0) {
+    std::string log = read_whole(path);
+    if (log.empty()) return fail("job \"" + key + "\" has no log yet");
+    fputs(log.c_str(), stdout);
+    return 0;
+  }
+  CtlTasks tasks;
+  if (!Ctl_read_tasks(&tasks)) return fail("cannot read the task file");
+  for (TaskGroup* g = tasks.groups; g != nullptr; g = g->next) {
+    if (g->job == nullptr || g->job->index != job->index) continue;
+    for (TaskRec* r = g->tasks; r != nullptr; r = r->next) {
+      if (r->id != task) continue;
+      printf("task %d %g-%g %s at %g on %s\n", r->id, static_cast<double>(r->start),
+             static_cast<double>(r->end), GetTaskStatusStr(r->status),
+             static_cast<double>(r->current), r->dev != nullptr ? r->dev->name.or_else("-") : "-");
+      if (r->output) printf("%s\n", r->output.c_str());
+      return 0;
+    }
+  }
+  return fail("job \"" + key + "\" has no task " + std::to_string(task));
+}
