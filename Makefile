@@ -24,7 +24,10 @@ configure: deps
 build: configure
 	cmake --build $(BUILD) -j $(JOBS)
 
+# The tests also drive the real renderers the wrappers run, so they are
+# installed here (large; the demo does not need them).
 test: build
+	@RJ_WITH_RENDERERS=1 tools/install-deps.sh
 	cd $(BUILD) && ctest --output-on-failure -j $(JOBS)
 
 asan: deps
