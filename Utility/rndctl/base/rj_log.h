@@ -6,6 +6,14 @@
 /// set), a line each in the control directory's Render_Access once the
 /// locked file operations have opened it (before that, lines are dropped).
 /// Lines of several processes sharing one log file never interleave.
+///
+/// Calling order: none; every channel works from the first line of main.
+/// The access log lines appear once the locked file operations (ctldir/)
+/// opened the control directory and called rj_set_access_stream.
+///
+/// Control block: the trace and the access log read `rndctl.host` and
+/// `rndctl.pid` for their prefixes; nothing here writes it.  Nothing here is
+/// safe in a signal handler except rj_write_all.
 #pragma once
 
 #include <sys/types.h>
@@ -13,15 +21,19 @@
 #include <cstdio>
 #include <ctime>
 
-// Diagnostics and process identity (rj_rndctl).
-extern int debug;          // gates dbgpnt; any non-zero level acts as 1
-extern int debug_fileacc;  // gates dbg_logfile
-extern const char* PrgName;
+extern int debug;            // gates dbgpnt; any non-zero level acts as 1
+extern int debug_fileacc;    // gates dbg_logfile (ZARNO_RNDCTL_ACCESS_LOG)
+extern const char* PrgName;  // the program's name in the access log
 extern char* ProgramName;
 extern char ApplModeName[64];
 
+/// The trace: "HOST:\t" and the text on stderr while `debug` is set.  A
+/// text longer than 8191 bytes is cut.
 void dbgpnt(const char* format, ...) __attribute__((format(printf, 1, 2)));
+/// A message for the user: the text and a newline on stderr.
 void EDuprintf(const char* format, ...) __attribute__((format(printf, 1, 2)));
+/// One access-log line: "* TEXT --  HOST:PROGRAM(PID) DATE" (the date as
+/// ctime gives it).  dbg_logfile writes only while `debug_fileacc` is set.
 void wrt_logfile(const char* format, ...) __attribute__((format(printf, 1, 2)));
 void dbg_logfile(const char* format, ...) __attribute__((format(printf, 1, 2)));
 
@@ -47,10 +59,12 @@ mode_t get_original_umask();
 /// The locked file operations set it when they open the control directory.
 void rj_set_access_stream(FILE* stream);
 
-/// Compares two texts like strcmp, a null text ordering as an empty one.
+/// Compares two texts like strcmp; null equals null and orders before any
+/// text (-1 / 1), so that records with an unset field compare stably.
 int rj_strcmp(const char* a, const char* b);
 
-// Editor stubs: the daemon shares code with the editors.
+/// Hooks for the interactive editors, which share this library: in the
+/// daemon and the tools they do nothing (is_editor returns 0).
 int is_editor();
 void sounder(int code);
 void IR_repoint_editor_list();

@@ -1,26 +1,50 @@
+/// The control-file language: the lexer (RJClex.l), the grammar
+/// (RJCgram.y), which builds records as it reads, and the writer
+/// (rj_write), which prints the records in the same language.  Whatever the
+/// writer prints of any record, the reader reads back to the same record.
+///
+/// Calling order: hand the parser its stream (RJCin, or the bytes to
+/// RJC_parse_string) with RJCreadfile naming the file for messages; the
+/// grammar adds records to the lists through the record units (Add_a_job,
+/// Add_a_dev, ...).  A syntax or lexical error prints "******** MESSAGE:
+/// line N of FILE file" (and logs it), releases every lock this process
+/// holds and ends the process, or calls RJC_fatal_exit when one is set.
+///
+/// Control block: the grammar appends to `rndctl.jobs` / `rndctl.devs`, sets
+/// `current_job` / `current_dev` while it reads a record, and sets the check
+/// interval from the job file's header (RJC_set_check_interval).  The writer
+/// only reads the lists; it never deletes a record (the caller drops jobs
+/// marked deleted).
 #pragma once
 
 #include <cstddef>
 #include <cstdio>
 #include <string>
 
-// ---------------------------------------------------------------------------
-// Control-file language (RJClex.l, RJCgram.y, rj_write).
-extern FILE* RJCin;
-extern FILE* RJCout;
-extern const char* RJCreadfile;
-extern const char* RJCpath;
-extern int RJCcurrent_lineno;
-extern int RJClineno;
+extern FILE* RJCin;              // the parser's input stream
+extern FILE* RJCout;             // the lexer's echo stream (unused: null)
+extern const char* RJCreadfile;  // the file named in messages
+extern const char* RJCpath;      // the control file's path being read
+extern int RJCcurrent_lineno;    // line of the token being read
+extern int RJClineno;            // the lexer's line counter
+/// The generated parser and lexer: 0 when the whole input parsed.
 int RJCparse();
 int RJClex();
 int RJCwrap();
+/// Report a syntax error (resp. a character the lexer cannot read) and end
+/// the process through RJC_fatal_exit, releasing every lock held first.
 void RJCerror(const char* message);
 void RJClexerror(const char* text);
-/// How a syntax or lexical error ends the process; tests replace it.
+/// Null: a syntax or lexical error aborts the process.  Set (tests, fuzzers,
+/// tools that must survive a bad file): it is called instead, and when it
+/// returns the parse is abandoned: RJCparse returns non-zero and frees what
+/// it held.
 extern void (*RJC_fatal_exit)(int status);
-/// Parses a control file held in memory (for tests and fuzzers).
+/// Parses a control file held in memory, `file_name` naming it in messages;
+/// the parser's globals are restored afterwards.  0 when it parsed.
 int RJC_parse_string(const char* text, size_t length, const char* file_name);
+/// Prints every job (resp. resource) of the lists, in list order, with the
+/// file's header, to `fp`.
 void Job_control_write_dev(FILE* fp);
 void Resource_control_write_dev(FILE* fp);
 
