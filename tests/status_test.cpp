@@ -101,6 +101,7 @@ INSTANTIATE_TEST_SUITE_P(Lines, Progress, testing::Values(
     ProgressCase{"other_text_last_changes_nothing", "pix.0003 r 10 of 100\nError: frame 4 did not build\n", 1, 0, 1, 10, 0, 1, 0, nullptr},
     ProgressCase{"letter_other_than_r_changes_nothing", "pix.0004 w 10 of 100\n", 1, 0, 1, 10, 0, 1, 0, nullptr},
     ProgressCase{"step_two_counts_frames", "pix.0005 r 10 of 100\n", 2, 0, 1, 9, 1, 5, 61.6f, "pix.0005"},
+    ProgressCase{"half_step_counts_its_own_numbers", "pix.0005 r 10 of 100\n", 0.5f, 0, 2, 4, 1, 3, 61.6f, "pix.0005"},
     ProgressCase{"job_extension_numbers", "pix.0140 r 10 of 100\n", 1, 1, 4, 6, 1, 5, 69.33333f, "pix.0140"}),
     label_of);
 // clang-format on
