@@ -16,11 +16,9 @@
 namespace {
 
 // Only shell builtins read /proc: a forking shell blocks every signal for a
-// moment, and an outside reader could catch it in that window.  The first
-// line is the command line as "prog|arg|arg...".
+// moment, and an outside reader could catch it in that window.
 constexpr const char* kReporter =
     "#!/bin/sh\n"
-    "printf '%s' \"${0##*/}\"; for a in \"$@\"; do printf '|%s' \"$a\"; done; echo\n"
     "while read -r key value; do\n"
     "  case \"$key\" in SigBlk:|SigIgn:) echo \"$key $value\";; esac\n"
     "done < /proc/$$/status\n"
@@ -40,14 +38,11 @@ class PerformTest : public TaskFixture {
   void SetUp() override {
     TaskFixture::SetUp();
     mkdir_p("bin");
-    for (const char* name : {"shadepass", "glintcast", "glintwalk", "myrender"}) {
-      write_file(std::string("bin/") + name, kReporter);
-      chmod(path(std::string("bin/") + name).c_str(), 0755);
-    }
+    write_file("bin/myrender", kReporter);
+    chmod(path("bin/myrender").c_str(), 0755);
     const char* old = getenv("PATH");
     old_path_ = old != nullptr ? old : "";
     setenv("PATH", (path("bin") + ":" + old_path_).c_str(), 1);
-    dev_->num_processors = 4;
   }
   void TearDown() override {
     setenv("PATH", old_path_.c_str(), 1);
@@ -71,51 +66,49 @@ struct ArgCase {
   const char* label;
   const char* executable;
   float by;
-  int extension;  // 0: none; else ext_start 100, ext_by 10, ext_size 4
+  int extension;  // 0: none; else from 100 by 10
   int output_mask;
   int animate;
   const char* rnd_opts;
   float start, end;
-  const char* argv;  // joined by '|'; $PIX, $MATTE, $SDL stand for the job's paths
+  const char* argv;  // joined by '|'
 };
 
-class PerformArgs : public PerformTest, public testing::WithParamInterface<ArgCase> {};
+class BuildArgv : public testing::TestWithParam<ArgCase> {};
 
-TEST_P(PerformArgs, BuildsTheProgramsArgumentList) {
+TEST_P(BuildArgv, ProgramOptionsFramesAndNumbering) {
   const ArgCase& c = GetParam();
-  job_->executable.set(c.executable);
-  job_->frames[2] = c.by;
-  job_->output_mask = c.output_mask;
-  job_->animate = c.animate;
-  job_->rnd_opts.set(c.rnd_opts);
-  if (c.extension != 0) {
-    job_->extension = 291;
-    job_->ext_start = 100;
-    job_->ext_by = 10;
-    job_->ext_size = 4;
+  Job job;
+  job.executable.set(c.executable);
+  job.pix.set("P");
+  job.matte.set("M");
+  job.sdl.set("S");
+  job.frames[0] = 1;
+  job.frames[2] = c.by;
+  job.output_mask = c.output_mask;
+  job.animate = c.animate;
+  job.rnd_opts.set(c.rnd_opts);
+  job.extension = c.extension != 0 ? 291 : 0;  // the numbers below count only when set
+  job.ext_start = 100;
+  job.ext_by = 10;
+  job.ext_size = 4;
+  std::string joined;
+  for (const std::string& a : Task_build_argv(&job, 4, c.start, c.end)) {
+    joined += (joined.empty() ? "" : "|") + a;
   }
-  std::string out = perform(add_entry(job_, dev_, c.start, c.end, TASK_STARTED));
-
-  std::string expected = c.argv;
-  for (auto [key, value] : {std::pair{"$PIX", job_->pix.c_str()},
-                            {"$MATTE", job_->matte.c_str()},
-                            {"$SDL", job_->sdl.c_str()}}) {
-    size_t at = expected.find(key);
-    if (at != std::string::npos) expected.replace(at, strlen(key), value);
-  }
-  EXPECT_EQ(out.substr(0, out.find('\n')), expected) << out;
+  EXPECT_EQ(joined, c.argv);
 }
 
 // clang-format off
-INSTANTIATE_TEST_SUITE_P(Programs, PerformArgs, testing::Values(
-    ArgCase{"edgepass_runs_shadepass_verbose", "edgepass", 1, 0, 0, 1, nullptr, 1, 3, "shadepass|-V|-p|$PIX|-A|-s|1.000000|-e|3.000000|-b|1.000000|-E|1|$SDL"},
-    ArgCase{"glintcast_gets_processors", "glintcast", 1, 0, 0, 1, nullptr, 4, 4, "glintcast|-n4|-p|$PIX|-A|-s|4.000000|-e|4.000000|-b|1.000000|-E|1|$SDL"},
-    ArgCase{"glintwalk_gets_processors", "glintwalk", 1, 0, 0, 0, nullptr, 1, 1, "glintwalk|-n4|-p|$PIX|-A|$SDL"},
-    ArgCase{"mask_and_options_as_one_argument", "myrender", 1, 0, 1, 0, "-q  high", 1, 1, "myrender|-p|$PIX|-m|$MATTE|-A|-q  high|$SDL"},
-    ArgCase{"options_of_blanks_only_are_dropped", "myrender", 1, 0, 0, 0, "   ", 1, 1, "myrender|-p|$PIX|-A|$SDL"},
-    ArgCase{"half_step_numbers_the_frames", "myrender", 0.5f, 0, 0, 1, nullptr, 2, 3, "myrender|-p|$PIX|-A|-s|2.000000|-e|3.000000|-b|0.500000|-S|3|-B|1|-E|1|$SDL"},
-    ArgCase{"whole_step_keeps_frame_numbers", "myrender", 2, 0, 0, 1, nullptr, 3, 7, "myrender|-p|$PIX|-A|-s|3.000000|-e|7.000000|-b|2.000000|-E|1|$SDL"},
-    ArgCase{"job_extension_numbers", "myrender", 1, 1, 0, 1, nullptr, 4, 6, "myrender|-p|$PIX|-A|-s|4.000000|-e|6.000000|-b|1.000000|-S|130|-B|10|-E|4|$SDL"}),
+INSTANTIATE_TEST_SUITE_P(Programs, BuildArgv, testing::Values(
+    ArgCase{"edgepass_runs_shadepass_verbose", "edgepass", 1, 0, 0, 1, nullptr, 1, 3, "shadepass|-V|-p|P|-A|-s|1.000000|-e|3.000000|-b|1.000000|-E|4|S"},
+    ArgCase{"glintcast_gets_processors", "glintcast", 1, 0, 0, 1, nullptr, 4, 4, "glintcast|-n4|-p|P|-A|-s|4.000000|-e|4.000000|-b|1.000000|-E|4|S"},
+    ArgCase{"glintwalk_gets_processors", "glintwalk", 1, 0, 0, 0, nullptr, 1, 1, "glintwalk|-n4|-p|P|-A|S"},
+    ArgCase{"mask_and_options_as_one_argument", "myrender", 1, 0, 1, 0, "-q  high", 1, 1, "myrender|-p|P|-m|M|-A|-q  high|S"},
+    ArgCase{"options_of_blanks_only_are_dropped", "myrender", 1, 0, 0, 0, "   ", 1, 1, "myrender|-p|P|-A|S"},
+    ArgCase{"half_step_numbers_the_frames", "myrender", 0.5f, 0, 0, 1, nullptr, 2, 3, "myrender|-p|P|-A|-s|2.000000|-e|3.000000|-b|0.500000|-S|3|-B|1|-E|4|S"},
+    ArgCase{"whole_step_keeps_frame_numbers", "myrender", 2, 0, 0, 1, nullptr, 3, 7, "myrender|-p|P|-A|-s|3.000000|-e|7.000000|-b|2.000000|-E|4|S"},
+    ArgCase{"job_extension_numbers", "myrender", 1, 1, 0, 1, nullptr, 4, 6, "myrender|-p|P|-A|-s|4.000000|-e|6.000000|-b|1.000000|-S|130|-B|10|-E|4|S"}),
     [](const testing::TestParamInfo<ArgCase>& info) { return std::string(info.param.label); });
 // clang-format on
 
@@ -152,6 +145,8 @@ TEST_F(PerformTest, RenderProgramRunsInProjectDirWithItsOwnStreamsGroupAndSignal
   EXPECT_EQ(signal_mask(out, "SigBlk:") & 0x7fffffffULL, 0ULL) << out;
   EXPECT_EQ(signal_mask(out, "SigIgn:") & 0x7fffffffULL, 0ULL) << out;
   EXPECT_EQ(read_file("stream"), "pix.0001 r 5 of 10\n");
+  // Only the child's environment has it.
+  EXPECT_EQ(getenv("ZARNO_PIX_SEARCHPATH"), nullptr);
 }
 
 TEST_F(PerformTest, PixWithoutDirectoryWritesOutputBesideTheProgramAndCountsUp) {
@@ -162,22 +157,43 @@ TEST_F(PerformTest, PixWithoutDirectoryWritesOutputBesideTheProgramAndCountsUp) 
   // Beside the program, in the project directory, where the daemon finds it
   // too.
   EXPECT_EQ(read_file("proj/out.img.testhost.render1.2147483647"), out);
-  EXPECT_EQ(out.rfind("myrender|", 0), 0u) << out;
   EXPECT_EQ(rndctl.out_counter, 0);
 }
 
-TEST_F(PerformTest, ExecFailureIsReportedInBothFilesAndEndsWith255) {
-  char prog[] = "no_such_render_program";
-  char* argv[] = {prog, nullptr};
+struct ExecCase {
+  const char* label;
+  const char* program;  // on PATH as bin/PROGRAM with `text` and `mode` unless text is null
+  const char* text;
+  int mode;
+  int exit_code;
+  const char* out;  // the stdout file; also the stream when the exec failed
+};
+
+class ExecOutcome : public PerformTest, public testing::WithParamInterface<ExecCase> {};
+
+TEST_P(ExecOutcome, ProgramIsFoundOnPathOrTheChildReportsWhy) {
+  const ExecCase& c = GetParam();
+  if (c.text != nullptr) {
+    write_file(std::string("bin/") + c.program, c.text);
+    chmod(path(std::string("bin/") + c.program).c_str(), static_cast<mode_t>(c.mode));
+  }
+  std::string prog = c.program;
+  char* argv[] = {prog.data(), nullptr};
   int pid = rj_system(argv, path("stream").c_str(), path("out").c_str(), job_);
   ASSERT_GT(pid, 0);
   int status = wait_for(pid);
-  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 255) << status;
-  const char* message =
-      "system(\"no_such_render_program\") failed at exec <No such file or directory>\n";
-  EXPECT_EQ(read_file("out"), message);
-  EXPECT_EQ(read_file("stream"), message);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == c.exit_code) << status;
+  EXPECT_EQ(read_file("out"), c.out);
+  EXPECT_EQ(read_file("stream"), c.exit_code == 255 ? c.out : "");
 }
+
+// clang-format off
+INSTANTIATE_TEST_SUITE_P(Programs, ExecOutcome, testing::Values(
+    ExecCase{"missing", "no_such_render_program", nullptr, 0, 255, "system(\"no_such_render_program\") failed at exec <No such file or directory>\n"},
+    ExecCase{"not_executable", "readonly", "echo ran\n", 0644, 255, "system(\"readonly\") failed at exec <Permission denied>\n"},
+    ExecCase{"script_without_interpreter_line", "plain", "echo ran \"$1\"\n", 0755, 0, "ran \n"}),
+    [](const testing::TestParamInfo<ExecCase>& info) { return std::string(info.param.label); });
+// clang-format on
 
 TEST_F(PerformTest, PlantedLinkDoesNotRedirectTheStream) {
   write_file("victim", "untouched");

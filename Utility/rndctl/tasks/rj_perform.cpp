@@ -1,11 +1,3 @@
-// Starting render programs for running-task entries, the per-job log under
-// JOBLOG, and killing this daemon's render processes.
-//
-// A render program runs as a child of the daemon in its own process group,
-// with its error output in the task's log stream (which the progress reading
-// follows) and its stdout in an output file next to the images.  The child is
-// reaped by the SIGCHLD handler, which clears the entry's pid and stores the
-// exit value; UpdateRunningTasks judges the outcome on the next pass.
 #include "Utility/rndctl/tasks/rj_perform.h"
 
 #include <fcntl.h>
@@ -16,6 +8,7 @@
 #include <cerrno>
 #include <climits>
 #include <csignal>
+#include <cstdarg>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -28,13 +21,12 @@
 #include "Utility/rndctl/base/rj_log.h"
 #include "Utility/rndctl/base/rj_text.h"
 #include "Utility/rndctl/proc/rj_signal.h"
+#include "Utility/rndctl/proc/rj_spawn.h"
 #include "Utility/rndctl/records/rj_dev.h"
-#include "Utility/rndctl/records/rj_jobcheck.h"
-#include "Utility/rndctl/records/rj_recindex.h"
+#include "Utility/rndctl/records/rj_frames.h"
 #include "Utility/rndctl/records/rj_records.h"
 #include "Utility/rndctl/tasks/rj_reclaim.h"
 #include "Utility/rndctl/tasks/rj_status.h"
-#include "Utility/rndctl/tasks/rj_task.h"
 #include "Utility/rndctl/tasks/rj_taskrec.h"
 #include "Utility/rndctl/tasks/rj_tskio.h"
 
@@ -59,137 +51,23 @@ struct MaFree {
 };
 using ScopedBlock = std::unique_ptr<char, MaFree>;
 
-std::string format_float(float value) {
+std::string formatted(const char* format, ...) __attribute__((format(printf, 1, 2)));
+std::string formatted(const char* format, ...) {
   char buf[64];
-  snprintf(buf, sizeof buf, "%f", static_cast<double>(value));
+  va_list ap;
+  va_start(ap, format);
+  vsnprintf(buf, sizeof buf, format, ap);
+  va_end(ap);
   return buf;
 }
 
-std::string format_int(int value) {
-  char buf[32];
-  snprintf(buf, sizeof buf, "%d", value);
-  return buf;
-}
-
-// Extension numbers count frames from the job's first frame: the job's own
-// extension start and step when it names them, else the start frame
-// (truncated) counting up by one.
-void extension_base_step(const Job* job, int* base, int* step) {
-  if (job->extension != 0) {
-    *base = job->ext_start;
-    *step = job->ext_by;
-  } else {
-    *base = static_cast<int>(job->frames[0]);
-    *step = 1;
-  }
-}
-
-int extension_of_frame(const Job* job, float frame) {
-  int base = 0;
-  int step = 1;
-  extension_base_step(job, &base, &step);
-  return (Calc_frame_range(job->frames[0], frame, job->frames[2]) - 1) * step + base;
-}
-
-// --- The child side of rj_system -------------------------------------------
-// Between fork and exec only async-signal-safe calls: the daemon's heap and
-// stdio locks may be in any state in the copy.  Everything the child needs is
-// prepared by the parent.
-
-size_t put_text(char* buf, size_t size, size_t at, const char* text) {
-  if (text == nullptr) text = "(null)";
-  while (*text != '\0' && at + 1 < size) buf[at++] = *text++;
-  buf[at] = '\0';
-  return at;
-}
-
-struct ChildPlan {
-  char* const* argv;        // non-owning, built by the caller
-  const char* stream_path;  // non-owning
-  const char* out_path;     // non-owning
-  const char* workdir;      // non-owning; null: stay where the daemon is
-  const char* host;         // non-owning; the trace prefix
-  bool trace;
-};
-
-void child_trace(const ChildPlan& plan, const char* text) {
-  if (!plan.trace) return;
-  char line[1024];
-  size_t at = put_text(line, sizeof line, 0, plan.host);
-  at = put_text(line, sizeof line, at, ":\t");
-  at = put_text(line, sizeof line, at, text);
-  rj_write_all(STDERR_FILENO, line, at);
-}
-
-// Puts a fresh file on `target`.  The stream lives in a world-writable
-// temporary directory, so a planted symbolic link must not redirect it.
-bool child_reopen(const char* path, int target) {
-  if (path == nullptr) return false;
-  int fd;
-  do {
-    fd = open(path, O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0666);
-  } while (fd < 0 && errno == EINTR);
-  if (fd < 0) return false;
-  // dup2 leaves close-on-exec off on the target.
-  int ok = dup2(fd, target);
-  close(fd);
-  return ok >= 0;
-}
-
-[[noreturn]] void child_exec(const ChildPlan& plan) {
-  // Handlers are dropped by exec anyway, but ignored dispositions and the
-  // signal mask are inherited: the daemon keeps SIGALRM and SIGCHLD blocked
-  // outside its wait, and a render program must not start with them blocked.
-  struct sigaction dfl {};
-  dfl.sa_handler = SIG_DFL;
-  sigemptyset(&dfl.sa_mask);
-  for (int sig = 1; sig < NSIG; ++sig) {
-    if (sig == SIGKILL || sig == SIGSTOP) continue;
-    sigaction(sig, &dfl, nullptr);
-  }
-  sigset_t none;
-  sigemptyset(&none);
-  sigprocmask(SIG_SETMASK, &none, nullptr);
-
-  // Its own group, so that the program and whatever it starts can be told
-  // apart from the daemon's own process group.
-  setpgid(0, 0);
-
-  // The output path may be relative to the project directory: change first.
-  if (plan.workdir != nullptr) {
-    if (chdir(plan.workdir) != 0) {
-      // Stays in the daemon's directory, as a missing project directory did
-      // when the daemon changed directory itself.
-    }
-  }
-
-  char line[1024];
-  if (!child_reopen(plan.stream_path, STDERR_FILENO)) {
-    size_t at = put_text(line, sizeof line, 0, "eeeeeeeeeeeeeeeeeeeeeeee failed to reopen \"");
-    at = put_text(line, sizeof line, at, plan.stream_path);
-    put_text(line, sizeof line, at, "\" as stderr\n");
-    child_trace(plan, line);
-  }
-  if (!child_reopen(plan.out_path, STDOUT_FILENO)) {
-    size_t at = put_text(line, sizeof line, 0, "oooooooooooooooooooooooo failed to reopen \"");
-    at = put_text(line, sizeof line, at, plan.out_path);
-    put_text(line, sizeof line, at, "\" as stdout\n");
-    child_trace(plan, line);
-  }
-
-  execvp(plan.argv[0], plan.argv);
-
-  const char* reason = strerrordesc_np(errno);
-  if (reason == nullptr) reason = "Unknown error";
-  size_t at = put_text(line, sizeof line, 0, "system(\"");
-  at = put_text(line, sizeof line, at, plan.argv[0]);
-  at = put_text(line, sizeof line, at, "\") failed at exec <");
-  at = put_text(line, sizeof line, at, reason);
-  at = put_text(line, sizeof line, at, ">\n");
-  child_trace(plan, line);
-  rj_write_all(STDERR_FILENO, line, at);
-  rj_write_all(STDOUT_FILENO, line, at);
-  _exit(-1);
+// The NULL-terminated array execve takes, pointing into `texts`.
+std::vector<char*> c_array(std::vector<std::string>& texts) {
+  std::vector<char*> array;
+  array.reserve(texts.size() + 1);
+  for (std::string& t : texts) array.push_back(t.data());
+  array.push_back(nullptr);
+  return array;
 }
 
 // The project directory of a scene path: everything before the character
@@ -209,6 +87,55 @@ bool render_dir_of(const Job* job, std::string* dir) {
   if (job == nullptr || !project_dir_of(job->sdl.c_str(), dir)) return false;
   struct stat st;
   return stat(dir->c_str(), &st) == 0 && S_ISDIR(st.st_mode);
+}
+
+// The two paths of a job, for the trace only.
+void trace_paths(Job* job) {
+  if (debug == 0) return;
+  char* path = nullptr;
+  char* root = nullptr;
+  rj_set_paths(job, &path, &root);
+  dbgpnt("------ Perform_a_Task path: \"%s\", root: \"%s\"\n", path != nullptr ? path : "",
+         root != nullptr ? root : "");
+  MA_free(path, __LINE__, kUnit);
+  MA_free(root, __LINE__, kUnit);
+}
+
+// Names the file the render program's stdout goes to, "out.PIX.HOST.DEV.N"
+// beside the images, and counts the output counter on.
+void set_out_path(TASK* entry, const Job* job, const Dev* dev) {
+  char* pix_file = nullptr;
+  char* pix_dir = nullptr;
+  rj_splitpath(job->pix.c_str(), &pix_file, &pix_dir, "");
+  ScopedBlock pix_file_guard(pix_file);
+  ScopedBlock pix_dir_guard(pix_dir);
+  char out[4096];
+  snprintf(out, sizeof out, "%s/out.%s.%s.%s.%d", pix_dir != nullptr ? pix_dir : ".",
+           pix_file != nullptr ? pix_file : "", dev->host_name.or_else(""), dev->name.c_str(),
+           rndctl.out_counter);
+  // Wraps to 0 rather than going negative.
+  rndctl.out_counter = rndctl.out_counter == INT_MAX ? 0 : rndctl.out_counter + 1;
+  // The program opens its output from its own working directory; the
+  // daemon, which stays where it is, reads and removes the same file, so a
+  // relative path is anchored there for both.
+  std::string workdir;
+  if (out[0] != '/' && render_dir_of(job, &workdir)) {
+    if (workdir[0] != '/') {
+      char cwd[4096];
+      if (getcwd(cwd, sizeof cwd) != nullptr) workdir = std::string(cwd) + "/" + workdir;
+    }
+    entry->out_path.set((workdir + "/" + out).c_str());
+  } else {
+    entry->out_path.set(out);
+  }
+}
+
+void trace_argv(const std::vector<std::string>& args) {
+  if (debug == 0) return;
+  fprintf(stderr, "%s: ", rndctl.host.or_else(""));
+  for (const std::string& a : args) fprintf(stderr, "%s ", a.c_str());
+  fprintf(stderr, "\n");
+  fflush(stderr);
 }
 
 }  // namespace
@@ -262,8 +189,8 @@ int get_task_frame_range(TASK* entry, int* first_extension) {
   }
   const Job* job = entry->job;
   const TaskRec* rec = entry->rec;
-  if (first_extension != nullptr) *first_extension = extension_of_frame(job, rec->start);
-  return Calc_frame_range(rec->start, rec->end, job->frames[2]);
+  if (first_extension != nullptr) *first_extension = rj_frame_extension(job, rec->start);
+  return rj_frames_span(job, rec->start, rec->end);
 }
 
 int get_current_frame_extension(Job* job, Dev* dev, int* extension) {
@@ -271,7 +198,7 @@ int get_current_frame_extension(Job* job, Dev* dev, int* extension) {
     if (entry->job != job || entry->rec == nullptr) continue;
     if (entry->rec->dev != dev || entry->rec->status != TASK_RUNNING) continue;
     set_image_percentage_done(entry);
-    if (extension != nullptr) *extension = extension_of_frame(job, entry->rec->current);
+    if (extension != nullptr) *extension = rj_frame_extension(job, entry->rec->current);
     return 1;
   }
   return 0;
@@ -281,7 +208,8 @@ int rj_system(char* const argv[], const char* stream_path, const char* out_path,
   if (argv == nullptr || argv[0] == nullptr) return -1;
 
   // The render program finds its images through this; one entry per path,
-  // each after a space, so the value begins with a space.
+  // each after a space, so the value begins with a space.  Only the child's
+  // environment has it: the daemon's own is never changed.
   std::string search;
   if (job != nullptr) {
     for (RndPathList* p = job->searchpath; p != nullptr; p = p->next) {
@@ -289,35 +217,73 @@ int rj_system(char* const argv[], const char* stream_path, const char* out_path,
       search += p->path.or_else("");
     }
   }
-  setenv("ZARNO_PIX_SEARCHPATH", search.c_str(), 1);
+  std::vector<std::string> env = RJ_env_with("ZARNO_PIX_SEARCHPATH", search.c_str());
+  std::vector<char*> envp = c_array(env);
 
   // Only the child changes directory: the daemon holds relative paths.
   std::string workdir;
-  bool change_dir = render_dir_of(job, &workdir);
-
-  ChildPlan plan{argv,
-                 stream_path,
-                 out_path,
-                 change_dir ? workdir.c_str() : nullptr,
-                 rndctl.host.or_else(""),
-                 debug != 0};
-
-  pid_t pid = fork();
-  if (pid == 0) child_exec(plan);
+  RjSpawn spawn;
+  spawn.argv = argv;
+  spawn.envp = envp.data();
+  spawn.stderr_path = stream_path;
+  spawn.stdout_path = out_path;
+  spawn.workdir = render_dir_of(job, &workdir) ? workdir.c_str() : nullptr;
+  spawn.trace_prefix = debug != 0 ? rndctl.host.or_else("") : nullptr;
+  const int pid = RJ_spawn(spawn);
   if (pid < 0) {
     fprintf(stderr, "ERROR: Could not fork off\n");
     fflush(stderr);
     // Not counted: no child exists that the SIGCHLD side would ever reap.
     return -1;
   }
-  // The child makes itself the leader of its own group too; doing it here as
-  // well closes the window in which a kill of the group would find no group.
-  setpgid(pid, pid);
   rndctl.running = rndctl.running + 1;
   // Remembered outside the daemon, so that a daemon started after a crash
   // of this one can end the render instead of letting it run unowned.
   rj_render_started(pid);
   return pid;
+}
+
+std::vector<std::string> Task_build_argv(const Job* job, int num_processors, float start,
+                                         float end) {
+  std::vector<std::string> args;
+  if (job->executable.is("edgepass")) {
+    args.emplace_back("shadepass");
+    args.emplace_back("-V");
+  } else if (job->executable.is("glintcast") || job->executable.is("glintwalk")) {
+    args.emplace_back(job->executable.c_str());
+    args.push_back(formatted("-n%d", num_processors));
+  } else {
+    args.emplace_back(job->executable.or_else(""));
+  }
+  args.emplace_back("-p");
+  args.emplace_back(job->pix.or_else(""));
+  if (job->output_mask != 0) {
+    args.emplace_back("-m");
+    args.emplace_back(job->matte.or_else(""));
+  }
+  args.emplace_back("-A");
+  if (job->animate != 0) {
+    args.emplace_back("-s");
+    args.push_back(formatted("%f", static_cast<double>(start)));
+    args.emplace_back("-e");
+    args.push_back(formatted("%f", static_cast<double>(end)));
+    args.emplace_back("-b");
+    args.push_back(formatted("%f", static_cast<double>(job->frames[2])));
+    int step = 0;
+    if (rj_frames_numbering(job, &step) != 0) {
+      args.emplace_back("-S");
+      args.push_back(formatted("%d", rj_frame_extension(job, start)));
+      args.emplace_back("-B");
+      args.push_back(formatted("%d", step));
+    }
+    args.emplace_back("-E");
+    args.push_back(formatted("%d", job->ext_size));
+  }
+  if (job->rnd_opts && job->rnd_opts.c_str()[strspn(job->rnd_opts.c_str(), " ")] != '\0') {
+    args.emplace_back(job->rnd_opts.c_str());
+  }
+  args.emplace_back(job->sdl.or_else(""));
+  return args;
 }
 
 int Perform_a_Task(TASK* entry) {
@@ -328,104 +294,13 @@ int Perform_a_Task(TASK* entry) {
 
   dbgpnt("-----------------------------------Perform_a_Task( %d )\n", entry->rec->id);
   dev->last_task = entry;
+  trace_paths(job);
+  set_out_path(entry, job, dev);
 
-  char* path = nullptr;
-  char* root = nullptr;
-  rj_set_paths(job, &path, &root);
-  dbgpnt("------ Perform_a_Task path: \"%s\", root: \"%s\"\n", path != nullptr ? path : "",
-         root != nullptr ? root : "");
-  MA_free(path, __LINE__, kUnit);
-  MA_free(root, __LINE__, kUnit);
-
-  char* pix_file = nullptr;
-  char* pix_dir = nullptr;
-  rj_splitpath(job->pix.c_str(), &pix_file, &pix_dir, "");
-  ScopedBlock pix_file_guard(pix_file);
-  ScopedBlock pix_dir_guard(pix_dir);
-  char out[4096];
-  snprintf(out, sizeof out, "%s/out.%s.%s.%s.%d", pix_dir != nullptr ? pix_dir : ".",
-           pix_file != nullptr ? pix_file : "", dev->host_name.or_else(""), dev->name.c_str(),
-           rndctl.out_counter);
-  // Wraps to 0 rather than going negative.
-  rndctl.out_counter = rndctl.out_counter == INT_MAX ? 0 : rndctl.out_counter + 1;
-  // The program opens its output from its own working directory; the
-  // daemon, which stays where it is, reads and removes the same file, so a
-  // relative path is anchored there for both.
-  std::string workdir;
-  if (out[0] != '/' && render_dir_of(job, &workdir)) {
-    if (workdir[0] != '/') {
-      char cwd[4096];
-      if (getcwd(cwd, sizeof cwd) != nullptr) workdir = std::string(cwd) + "/" + workdir;
-    }
-    entry->out_path.set((workdir + "/" + out).c_str());
-  } else {
-    entry->out_path.set(out);
-  }
-
-  int first_extension = 0;
-  get_task_frame_range(entry, &first_extension);
-
-  std::vector<std::string> args;
-  if (job->executable.is("edgepass")) {
-    args.emplace_back("shadepass");
-    args.emplace_back("-V");
-  } else if (job->executable.is("glintcast") || job->executable.is("glintwalk")) {
-    args.emplace_back(job->executable.c_str());
-    char processors[32];
-    snprintf(processors, sizeof processors, "-n%d", dev->num_processors);
-    args.emplace_back(processors);
-  } else {
-    args.emplace_back(job->executable.c_str());
-  }
-  args.emplace_back("-p");
-  args.emplace_back(job->pix.or_else(""));
-  if (job->output_mask != 0) {
-    args.emplace_back("-m");
-    args.emplace_back(job->matte.or_else(""));
-  }
-  args.emplace_back("-A");
-  if (job->animate != 0) {
-    float by = job->frames[2];
-    int by_int = static_cast<int>(by);
-    if (by_int == 0) by_int = by < 0.0f ? -1 : 1;
-    args.emplace_back("-s");
-    args.push_back(format_float(entry->rec->start));
-    args.emplace_back("-e");
-    args.push_back(format_float(entry->rec->end));
-    args.emplace_back("-b");
-    args.push_back(format_float(by));
-    if (job->extension != 0) {
-      args.emplace_back("-S");
-      args.push_back(format_int(first_extension));
-      args.emplace_back("-B");
-      args.push_back(format_int(job->ext_by));
-    } else if (static_cast<float>(by_int) != by) {
-      // Fractional steps cannot name files by frame number: number them.
-      args.emplace_back("-S");
-      args.push_back(format_int(first_extension));
-      args.emplace_back("-B");
-      args.push_back(format_int(by_int));
-    }
-    args.emplace_back("-E");
-    args.push_back(format_int(job->ext_size));
-  }
-  if (job->rnd_opts && job->rnd_opts.c_str()[strspn(job->rnd_opts.c_str(), " ")] != '\0') {
-    args.emplace_back(job->rnd_opts.c_str());
-  }
-  args.emplace_back(job->sdl.or_else(""));
-
-  std::vector<char*> argv;
-  argv.reserve(args.size() + 1);
-  for (std::string& a : args) argv.push_back(a.data());
-  argv.push_back(nullptr);
-
-  if (debug != 0) {
-    fprintf(stderr, "%s: ", rndctl.host.or_else(""));
-    for (const std::string& a : args) fprintf(stderr, "%s ", a.c_str());
-    fprintf(stderr, "\n");
-    fflush(stderr);
-  }
-
+  std::vector<std::string> args =
+      Task_build_argv(job, dev->num_processors, entry->rec->start, entry->rec->end);
+  trace_argv(args);
+  std::vector<char*> argv = c_array(args);
   int pid = rj_system(argv.data(), entry->stream_path.c_str(), entry->out_path.c_str(), job);
   entry->pid = pid;
   dbgpnt("%s.%s = %d\n", job->name.c_str(), dev->name.c_str(), pid);
@@ -494,7 +369,7 @@ void Job_Log_out(Job* job) {
     const TaskRec* rec = entry->rec;
     fprintf(fp.get(), "\t%d\t %f - %f\t%d - %d\t %s\t %s  %d\n", rec->id,
             static_cast<double>(rec->start), static_cast<double>(rec->end),
-            extension_of_frame(job, rec->start), extension_of_frame(job, rec->end),
+            rj_frame_extension(job, rec->start), rj_frame_extension(job, rec->end),
             rec->dev != nullptr ? rec->dev->name.or_else("nodev") : "nodev",
             status_name(rec->status), rec->retries);
   }
