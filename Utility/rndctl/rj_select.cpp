@@ -74,15 +74,25 @@ struct PickView {
     return dev != nullptr && std::find(here.begin(), here.end(), dev) != here.end();
   }
 
+  // Tasks started or running on each of this host's resources, counted in
+  // the same walk: what Dev_processes_available would count, one walk of the
+  // list for all of them.
+  std::vector<int> active;
+
   PickView() {
     for (Dev* d = rndctl.devs; d != nullptr; d = d->next) {
       if (dev_on_this_host(d)) here.push_back(d);
     }
+    active.assign(here.size(), 0);
     for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
-      if (e->job == nullptr || e->rec == nullptr || !is_here(e->rec->dev)) continue;
-      int s = e->rec->status;
-      if (s == TASK_STARTED || s == TASK_RUNNING || s == TASK_FAILED) {
-        worked_on.insert({e->job, e->rec->dev});
+      const TaskRec* rec = e->rec;
+      if (rec == nullptr || rec->dev == nullptr) continue;
+      auto at = std::find(here.begin(), here.end(), rec->dev);
+      if (at == here.end()) continue;
+      int s = rec->status;
+      if (is_active(s)) ++active[static_cast<size_t>(at - here.begin())];
+      if (e->job != nullptr && (s == TASK_STARTED || s == TASK_RUNNING || s == TASK_FAILED)) {
+        worked_on.insert({e->job, rec->dev});
       }
     }
   }
@@ -90,7 +100,15 @@ struct PickView {
   int free_slots(Dev* dev) {
     auto it = slots.find(dev);
     if (it != slots.end()) return it->second;
-    int n = Dev_processes_available(dev);
+    int n;
+    auto at = std::find(here.begin(), here.end(), dev);
+    if (at == here.end() || debug) {
+      // The trace lists every entry it looks at; only the long way has it.
+      n = Dev_processes_available(dev);
+    } else {
+      if (dev->num_processors < 1) dev->num_processors = 1;
+      n = std::max(0, dev->num_processors - active[static_cast<size_t>(at - here.begin())]);
+    }
     slots.emplace(dev, n);
     return n;
   }
@@ -138,10 +156,34 @@ FILE* open_stream_file(const char* path) {
 // are worked through are filed under their job too.
 class EntryIndex {
  public:
-  EntryIndex() {
+  /// With `mark_stale`, also sets every entry's stale mark on the way: a
+  /// selection cycle needs both, and the list is long.
+  explicit EntryIndex(bool mark_stale = false) {
     for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
+      if (mark_stale) e->stale = 1;
       if (e->rec != nullptr) by_job_[e->job].push_back(e);
     }
+  }
+
+  /// Forgets the entries of a job whose entries have all been freed.
+  void drop(const Job* job) {
+    auto it = by_job_.find(job);
+    if (it != by_job_.end()) it->second.clear();
+    entries_ = nullptr;
+  }
+
+  /// Files a new entry under its job, wherever the selection stands.
+  void file(TASK* e) {
+    if (e != nullptr && e->rec != nullptr) by_job_[e->job].push_back(e);
+  }
+
+  /// The first entry of `job` in list order whose record is `rec`'s (the
+  /// answer of match_a_taskrec), once stale lives are gone: then the first
+  /// entry of an id is the only one that can match.
+  TASK* match(const Job* job, const TaskRec* rec) {
+    select(job);
+    TASK* e = find(rec->id);
+    return e != nullptr && Task_same_rec(e->rec, rec) ? e : nullptr;
   }
 
   /// Narrows the search to one job's entries.
@@ -223,12 +265,11 @@ bool held_status(int status) {
 // the one this host knew: the group vanished, its next id went below what
 // was seen here, or an id of it names another start frame.  Otherwise a
 // group built again from id 0 would be taken for the old one, id by id.
-void retire_other_lives(TaskGroup* groups, TaskAfterLock* after) {
+void retire_other_lives(TaskGroup* groups, TaskAfterLock* after, EntryIndex& index) {
   std::unordered_map<const Job*, const TaskGroup*> in_file;
   for (const TaskGroup* g = groups; g != nullptr; g = g->next) in_file.emplace(g->job, g);
   std::vector<const Job*> gone;
   {
-    EntryIndex index;
     index.for_each_job([&](const Job* job) {
       if (job == nullptr) return;  // its job left the file: UpdateRunningTasks ends those
       auto it = in_file.find(job);
@@ -249,7 +290,10 @@ void retire_other_lives(TaskGroup* groups, TaskAfterLock* after) {
       }
     });
   }
-  for (const Job* job : gone) Task_retire_job(job, after);
+  for (const Job* job : gone) {
+    Task_retire_job(job, after);
+    index.drop(job);
+  }
 }
 
 }  // namespace
@@ -336,14 +380,15 @@ TASK* Task_get() {
     opened = true;
     TaskGroup*& groups = *list;
     // Every entry that finds its record in the file loses the mark again;
-    // those that keep it have left the file.
-    for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) e->stale = 1;
-    retire_other_lives(groups, &after);
+    // those that keep it have left the file.  One index of the entries
+    // serves the whole cycle.
+    EntryIndex index(true);
+    retire_other_lives(groups, &after, index);
 
     insert_unknown_pending_jobs(&groups);
 
     if (TaskRec* rec = extract_pending_task(&groups)) {
-      chosen = match_a_taskrec(rec);
+      chosen = index.match(rec->group->job, rec);
       // The record is PENDING in the file: an entry here that still held it
       // lost it, and its render stops before the piece is taken again.
       if (chosen != nullptr && chosen->rec != rec) Task_settle(chosen, rec, &after);
@@ -352,6 +397,7 @@ TASK* Task_get() {
       if (rec->group->next_task_id != ids_before) after.wake(rec->group->job);
       if (chosen == nullptr) {
         chosen = Task_add(rec->group->job, rec);
+        index.file(chosen);
       } else if (chosen->rec != rec) {
         TaskRec* own = chosen->rec;
         own->start = rec->start;
@@ -369,7 +415,6 @@ TASK* Task_get() {
     }
 
     // Bring the mirror in line with the file, group by group.
-    EntryIndex index;
     for (TaskGroup* g = groups; g != nullptr; g = g->next) {
       Job* job = g->job;
       int uses_host = isa_job_using_host(host, job);
