@@ -343,6 +343,18 @@ void write_dev(Out& out, const Dev* dev) {
   out.lit("\t}\n\n");
 }
 
+// The writer touches every record once, and a record of ten thousand is
+// hardly ever in the cache: most of the write was waiting for memory.  The
+// next record (its fields and week grid) is asked for while this one is
+// written.
+template <class Record>
+void prefetch_record(const Record* record) {
+  if (record == nullptr) return;
+  const char* first = reinterpret_cast<const char*>(record);
+  const char* end = reinterpret_cast<const char*>(record + 1);
+  for (const char* p = first; p < end; p += 64) __builtin_prefetch(p);
+}
+
 }  // namespace
 
 void Job_control_write_dev(FILE* fp) {
@@ -353,6 +365,7 @@ void Job_control_write_dev(FILE* fp) {
   Job* job = rndctl.jobs;
   while (job != nullptr) {
     Job* next = job->next;
+    prefetch_record(next);
     // Editors only mark a job deleted; it leaves the queue here, when the
     // file that every other process reads no longer holds it.
     if (job->deleted != 0)
@@ -369,6 +382,7 @@ void Resource_control_write_dev(FILE* fp) {
   Out out(fp);
   out.lit("RenderResourceControl\n");
   for (const Dev* dev = rndctl.devs; dev != nullptr; dev = dev->next) {
+    prefetch_record(dev->next);
     if (dev->name) write_dev(out, dev);
   }
   out.lit("End\n");
