@@ -165,6 +165,12 @@ class EntryIndex {
     }
   }
 
+  /// True when `job` has entries.
+  bool has(const Job* job) const {
+    auto it = by_job_.find(job);
+    return it != by_job_.end() && !it->second.empty();
+  }
+
   /// Forgets the entries of a job whose entries have all been freed.
   void drop(const Job* job) {
     auto it = by_job_.find(job);
@@ -266,30 +272,33 @@ bool held_status(int status) {
 // was seen here, or an id of it names another start frame.  Otherwise a
 // group built again from id 0 would be taken for the old one, id by id.
 void retire_other_lives(TaskGroup* groups, TaskAfterLock* after, EntryIndex& index) {
-  std::unordered_map<const Job*, const TaskGroup*> in_file;
-  for (const TaskGroup* g = groups; g != nullptr; g = g->next) in_file.emplace(g->job, g);
+  // The groups are looked at in file order, in which their records lie in
+  // memory; the first group of a job is the one that counts.
+  std::unordered_set<const Job*> in_file;
   std::vector<const Job*> gone;
-  {
-    index.for_each_job([&](const Job* job) {
-      if (job == nullptr) return;  // its job left the file: UpdateRunningTasks ends those
-      auto it = in_file.find(job);
-      const TaskGroup* g = it != in_file.end() ? it->second : nullptr;
-      index.select(job);
-      int seen = 0;
-      for (const TASK* e : index.selected()) seen = std::max(seen, e->seen_next_id);
-      if (g == nullptr || g->next_task_id < seen) {
+  for (const TaskGroup* g = groups; g != nullptr; g = g->next) {
+    const Job* job = g->job;
+    if (!in_file.insert(job).second || job == nullptr || !index.has(job)) continue;
+    index.select(job);
+    int seen = 0;
+    for (const TASK* e : index.selected()) seen = std::max(seen, e->seen_next_id);
+    if (g->next_task_id < seen) {
+      gone.push_back(job);
+      continue;
+    }
+    for (const TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
+      TASK* e = index.find(rec->id);
+      if (e != nullptr && !Task_same_rec(e->rec, rec)) {
         gone.push_back(job);
-        return;
+        break;
       }
-      for (const TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
-        TASK* e = index.find(rec->id);
-        if (e != nullptr && !Task_same_rec(e->rec, rec)) {
-          gone.push_back(job);
-          return;
-        }
-      }
-    });
+    }
   }
+  // Entries whose job left the file (the null job) are UpdateRunningTasks'
+  // to end; a job with entries but no group has lost its group.
+  index.for_each_job([&](const Job* job) {
+    if (job != nullptr && in_file.count(job) == 0) gone.push_back(job);
+  });
   for (const Job* job : gone) {
     Task_retire_job(job, after);
     index.drop(job);
