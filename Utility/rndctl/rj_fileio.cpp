@@ -14,6 +14,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdint>
 #include <cstdio>
@@ -48,15 +49,19 @@ struct FdCloser {
 // space): the client first moves the open file aside under a hidden name,
 // and for that moment the file is not there for the other hosts.
 struct UpdateStream {
-  std::string old;             // the file as it was at the open
-  struct stat old_st {};       // and its mode and owner then
-  std::string out;             // the new contents, from the start of the file
-  int64_t pos = 0;             // the stream's position
+  std::string old;        // the file as it was at the open
+  struct stat old_st {};  // and its mode and owner then
+  std::string out;        // the new contents, from the start of the file
+  int64_t pos = 0;        // the stream's position
   bool written = false;
   bool rewound = false;  // rewound and written nothing: the new contents are empty
 };
 
 struct FileRecord {
+  // The room of the last update stream's new contents, kept for the next
+  // one: a rewrite of a file of megabytes would otherwise take fresh pages
+  // from the kernel every time.
+  std::string spare_out;
   char* path = nullptr;                  // "%s/%s": control directory, file name (owned)
   char* lock_path = nullptr;             // "%s/%s.lock" (owned)
   FILE* stream = nullptr;                // open between an open and a close operation (owned)
@@ -127,8 +132,15 @@ ssize_t update_write(void* cookie, const char* buf, size_t size) {
       return -1;
     }
     size_t at = static_cast<size_t>(u->pos);
-    if (at + size > u->out.size()) u->out.resize(at + size);
-    memcpy(&u->out[at], buf, size);
+    if (at == u->out.size()) {
+      // The usual case, a whole file written from its start: appended
+      // without first filling the room with zeros.
+      if (u->out.capacity() < at + size) u->out.reserve(std::max(at + size, u->old.size()));
+      u->out.append(buf, size);
+    } else {
+      if (at + size > u->out.size()) u->out.resize(at + size);
+      memcpy(&u->out[at], buf, size);
+    }
   } catch (const std::bad_alloc&) {
     errno = ENOMEM;
     return -1;
@@ -168,7 +180,6 @@ void report_write_failure(const char* path, int error) {
   EDuprintf("ERROR: failed to write %s: %s", path, strerror(error));
   dbgpnt("ERROR: failed to write %s: %s\n", path, strerror(error));
 }
-
 
 // Forces a directory entry change (a rename) to disk.  Failing that, the new
 // contents are in place but might not survive a crash of the file server;
@@ -283,6 +294,7 @@ int close_record(int index, bool cut_at_position) {
     }
     if (replace_file(rec.path, update->old, update->old_st, data) < 0) result = -1;
   }
+  if (update) rec.spare_out = std::move(update->out);
   return result;
 }
 
@@ -400,8 +412,10 @@ FILE* update_fileop(int index) {
   FileRecord& rec = files[index];
   forget_stream(rec);
   auto update = std::make_unique<UpdateStream>();
-  FILE* fp = read_old(index, update.get()) ? fopencookie(update.get(), "r+", kUpdateFunctions)
-                                           : nullptr;
+  update->out = std::move(rec.spare_out);
+  update->out.clear();
+  FILE* fp =
+      read_old(index, update.get()) ? fopencookie(update.get(), "r+", kUpdateFunctions) : nullptr;
   if (fp == nullptr) {
     report_open_failure(index, "create");
     sounder(3);
