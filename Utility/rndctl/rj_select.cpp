@@ -158,8 +158,14 @@ class EntryIndex {
  public:
   /// With `mark_stale`, also sets every entry's stale mark on the way: a
   /// selection cycle needs both, and the list is long.
-  explicit EntryIndex(bool mark_stale = false) {
+  /// With `rebuilt`, entries marked as of another life of their group are
+  /// collected there instead of being filed.
+  explicit EntryIndex(bool mark_stale = false, std::vector<TASK*>* rebuilt = nullptr) {
     for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
+      if (rebuilt != nullptr && e->rebuilt) {
+        rebuilt->push_back(e);
+        continue;
+      }
       if (mark_stale) e->stale = 1;
       if (e->rec != nullptr) by_job_[e->job].push_back(e);
     }
@@ -380,7 +386,6 @@ TASK* GetaPendingTask() {
 TASK* Get_a_task() { return Task_get(); }
 
 TASK* Task_get() {
-  Task_retire_marked();
   const char* host = rndctl.host.c_str();
   TaskAfterLock after;
   TASK* chosen = nullptr;
@@ -391,7 +396,15 @@ TASK* Task_get() {
     // Every entry that finds its record in the file loses the mark again;
     // those that keep it have left the file.  One index of the entries
     // serves the whole cycle.
-    EntryIndex index(true);
+    // Entries marked as of another life go first, as Task_retire_marked
+    // would drop them, found in the same walk of the list.
+    std::vector<TASK*> marked;
+    EntryIndex index(true, &marked);
+    for (TASK* e : marked) {
+      dbgpnt("freeing Task %x\n", px(e));
+      Task_let_go(e, &after);
+      TASK_free(e);
+    }
     retire_other_lives(groups, &after, index);
 
     insert_unknown_pending_jobs(&groups);
@@ -468,7 +481,10 @@ TASK* Task_get() {
 
     return true;
   });
-  if (!opened) return nullptr;
+  if (!opened) {
+    Task_retire_marked();
+    return nullptr;
+  }
   after.run();
   if (written != 1 && chosen != nullptr && chosen->rec != nullptr) {
     // The file does not say STARTED (the failure is reported): another host
