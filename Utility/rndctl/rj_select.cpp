@@ -418,6 +418,9 @@ TASK* Task_get() {
       split_a_task(rec->group, rec);
       if (rec->group->next_task_id != ids_before) after.wake(rec->group->job);
       if (chosen == nullptr) {
+        TaskRec** link = &rec->group->tasks;
+        while (*link != nullptr && *link != rec) link = &(*link)->next;
+        if (*link == rec) rec = TaskRec_unpool(link);
         chosen = Task_add(rec->group->job, rec);
         index.file(chosen);
       } else if (chosen->rec != rec) {
@@ -441,10 +444,12 @@ TASK* Task_get() {
       Job* job = g->job;
       int uses_host = isa_job_using_host(host, job);
       index.select(job);
-      for (TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
+      for (TaskRec** link = &g->tasks; *link != nullptr; link = &(*link)->next) {
+        TaskRec* rec = *link;
         TASK* e = index.find(rec->id);
         if (e != nullptr && !Task_same_rec(e->rec, rec)) e = nullptr;
         if (e == nullptr) {
+          rec = TaskRec_unpool(link);
           e = Task_add(job, rec);  // the entry owns the record from now on
           if (e != nullptr) index.add(e);
         } else if (e->rec != rec && uses_host) {
