@@ -285,6 +285,65 @@ TEST_P(DaemonAlive, TasksOfADeadDaemonGoBackToPending) {
 
 INSTANTIATE_TEST_SUITE_P(PidFiles, DaemonAlive, testing::Values(0, 1, 2));
 
+// Records read from the file share blocks.  Kept by an entry through
+// TaskRec_unpool, kept by an entry directly, or freed in any order, each
+// stays what it was: values, group link, owner, and the text around it.
+TEST_F(TaskFileTest, RecordsOfAReadOutliveTheReadAsTheirOwnersNeed) {
+  // Three blocks' worth of records in one group, then beta's.
+  std::string text = "\nalpha.sdl\t 1\t 2500\t 2500\n";
+  char line[128];
+  for (int i = 0; i < 2500; ++i) {
+    snprintf(line, sizeof line, "\t%d\t %d.000000\t %d.000000\t %d.000000  1\t 0\tPENDING\n", i, i,
+             i, i);
+    text += line;
+  }
+  text += kBeta;
+  TaskGroup* groups = read_groups(text);
+  TaskGroup* alpha = TaskGroup_by_job(groups, alpha_);
+  ASSERT_NE(alpha, nullptr);
+  EXPECT_EQ(write_groups(alpha), text.substr(0, text.size() - kBeta.size()));
+
+  // Unpooled at the head, in the middle and at the end of the group's list.
+  std::vector<TASK*> kept;
+  for (int at : {0, 1500, 2499}) {
+    TaskRec** link = &alpha->tasks;
+    for (int i = 0; i < at; ++i) link = &(*link)->next;
+    TaskRec* old = *link;
+    TaskRec* next = old->next;
+    TaskRec* own = TaskRec_unpool(link);
+    ASSERT_NE(own, old);
+    EXPECT_EQ(*link, own);
+    EXPECT_EQ(own->next, next);
+    EXPECT_EQ(own->group, alpha);
+    EXPECT_EQ(own->id, at);
+    EXPECT_EQ(own->dev, here_);
+    EXPECT_EQ(TaskRec_unpool(link), own);  // already its own
+    kept.push_back(Task_add(alpha_, own));
+  }
+  // Kept without unpooling: its block stays for it.
+  TASK* direct = Task_add(beta_, TaskGroup_by_job(groups, beta_)->tasks);
+  EXPECT_EQ(write_groups(groups),
+            text.substr(text.size() - kBeta.size()) + text.substr(0, text.size() - kBeta.size()));
+  // Some freed one by one, out of order, the rest with their groups.
+  for (int i = 2000; i > 1000; i -= 7) {
+    TaskRec* rec = alpha->tasks;
+    for (int k = 0; k < i && rec->next != nullptr; ++k) rec = rec->next;
+    if (rec->task == nullptr) TaskRec_free(rec);
+  }
+  TaskGroup_free_all(&groups);
+  ASSERT_EQ(kept.size(), 3u);
+  EXPECT_EQ(kept[1]->rec->id, 1500);
+  EXPECT_EQ(kept[2]->rec->start, 2499.0f);
+  EXPECT_EQ(direct->rec->status, TASK_FAILED);
+  EXPECT_EQ(direct->rec->retries, 3);
+  // A second read reuses the room and is read as the first.
+  groups = read_groups(text);
+  EXPECT_EQ(write_groups(groups),
+            text.substr(text.size() - kBeta.size()) + text.substr(0, text.size() - kBeta.size()));
+  TaskGroup_free_all(&groups);
+  while (rndctl.tasks != nullptr) TASK_free(rndctl.tasks);
+}
+
 // --- Status files -----------------------------------------------------------
 
 TEST_F(TaskFileTest, StatusFileListsThisHostsLiveEntries) {

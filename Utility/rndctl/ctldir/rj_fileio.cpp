@@ -16,6 +16,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdint>
 #include <cstdio>
@@ -61,6 +62,10 @@ struct UpdateStream {
 };
 
 struct FileRecord {
+  // The room of the last update stream's new contents, kept for the next
+  // one: a rewrite of a file of megabytes would otherwise take fresh pages
+  // from the kernel every time.
+  std::string spare_out;
   char* path = nullptr;                  // "%s/%s": control directory, file name (owned)
   char* lock_path = nullptr;             // "%s/%s.lock" (owned)
   FILE* stream = nullptr;                // open between an open and a close operation (owned)
@@ -129,8 +134,15 @@ ssize_t update_write(void* cookie, const char* buf, size_t size) {
       return -1;
     }
     size_t at = static_cast<size_t>(u->pos);
-    if (at + size > u->out.size()) u->out.resize(at + size);
-    memcpy(&u->out[at], buf, size);
+    if (at == u->out.size()) {
+      // The usual case, a whole file written from its start: appended
+      // without first filling the room with zeros.
+      if (u->out.capacity() < at + size) u->out.reserve(std::max(at + size, u->old.size()));
+      u->out.append(buf, size);
+    } else {
+      if (at + size > u->out.size()) u->out.resize(at + size);
+      memcpy(&u->out[at], buf, size);
+    }
   } catch (const std::bad_alloc&) {
     errno = ENOMEM;
     return -1;
@@ -284,6 +296,7 @@ int close_record(int index, bool cut_at_position) {
     }
     if (replace_file(rec.path, update->old, update->old_st, data) < 0) result = -1;
   }
+  if (update) rec.spare_out = std::move(update->out);
   return result;
 }
 
@@ -394,6 +407,8 @@ FILE* update_fileop(int index) {
   FileRecord& rec = files[index];
   forget_stream(rec);
   auto update = std::make_unique<UpdateStream>();
+  update->out = std::move(rec.spare_out);
+  update->out.clear();
   FILE* fp =
       read_old(index, update.get()) ? fopencookie(update.get(), "r+", kUpdateFunctions) : nullptr;
   if (fp == nullptr) {

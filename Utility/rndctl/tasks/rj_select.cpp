@@ -87,15 +87,25 @@ struct PickView {
     return dev != nullptr && std::find(here.begin(), here.end(), dev) != here.end();
   }
 
+  // Tasks started or running on each of this host's resources, counted in
+  // the same walk: what Dev_processes_available would count, one walk of the
+  // list for all of them.
+  std::vector<int> active;
+
   PickView() {
     for (Dev* d = rndctl.devs; d != nullptr; d = d->next) {
       if (dev_on_this_host(d)) here.push_back(d);
     }
+    active.assign(here.size(), 0);
     for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
-      if (e->job == nullptr || e->rec == nullptr || !is_here(e->rec->dev)) continue;
-      int s = e->rec->status;
-      if (s == TASK_STARTED || s == TASK_RUNNING || s == TASK_FAILED) {
-        worked_on.insert({e->job, e->rec->dev});
+      const TaskRec* rec = e->rec;
+      if (rec == nullptr || rec->dev == nullptr) continue;
+      auto at = std::find(here.begin(), here.end(), rec->dev);
+      if (at == here.end()) continue;
+      int s = rec->status;
+      if (is_active(s)) ++active[static_cast<size_t>(at - here.begin())];
+      if (e->job != nullptr && (s == TASK_STARTED || s == TASK_RUNNING || s == TASK_FAILED)) {
+        worked_on.insert({e->job, rec->dev});
       }
     }
   }
@@ -103,7 +113,15 @@ struct PickView {
   int free_slots(Dev* dev) {
     auto it = slots.find(dev);
     if (it != slots.end()) return it->second;
-    int n = Dev_processes_available(dev);
+    int n;
+    auto at = std::find(here.begin(), here.end(), dev);
+    if (at == here.end() || debug) {
+      // The trace lists every entry it looks at; only the long way has it.
+      n = Dev_processes_available(dev);
+    } else {
+      if (dev->num_processors < 1) dev->num_processors = 1;
+      n = std::max(0, dev->num_processors - active[static_cast<size_t>(at - here.begin())]);
+    }
     slots.emplace(dev, n);
     return n;
   }
@@ -151,10 +169,46 @@ FILE* open_stream_file(const char* path) {
 // are worked through are filed under their job too.
 class EntryIndex {
  public:
-  EntryIndex() {
+  /// With `mark_stale`, also sets every entry's stale mark on the way: a
+  /// selection cycle needs both, and the list is long.
+  /// With `rebuilt`, entries marked as of another life of their group are
+  /// collected there instead of being filed.
+  explicit EntryIndex(bool mark_stale = false, std::vector<TASK*>* rebuilt = nullptr) {
     for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
+      if (rebuilt != nullptr && e->rebuilt) {
+        rebuilt->push_back(e);
+        continue;
+      }
+      if (mark_stale) e->stale = 1;
       if (e->rec != nullptr) by_job_[e->job].push_back(e);
     }
+  }
+
+  /// True when `job` has entries.
+  bool has(const Job* job) const {
+    auto it = by_job_.find(job);
+    return it != by_job_.end() && !it->second.empty();
+  }
+
+  /// Forgets the entries of a job whose entries have all been freed.
+  void drop(const Job* job) {
+    auto it = by_job_.find(job);
+    if (it != by_job_.end()) it->second.clear();
+    entries_ = nullptr;
+  }
+
+  /// Files a new entry under its job, wherever the selection stands.
+  void file(TASK* e) {
+    if (e != nullptr && e->rec != nullptr) by_job_[e->job].push_back(e);
+  }
+
+  /// The first entry of `job` in list order whose record is `rec`'s (the
+  /// answer of match_a_taskrec), once stale lives are gone: then the first
+  /// entry of an id is the only one that can match.
+  TASK* match(const Job* job, const TaskRec* rec) {
+    select(job);
+    TASK* e = find(rec->id);
+    return e != nullptr && Task_same_rec(e->rec, rec) ? e : nullptr;
   }
 
   /// Narrows the search to one job's entries.
@@ -236,33 +290,38 @@ bool held_status(int status) {
 // the one this host knew: the group vanished, its next id went below what
 // was seen here, or an id of it names another start frame.  Otherwise a
 // group built again from id 0 would be taken for the old one, id by id.
-void retire_other_lives(TaskGroup* groups, TaskAfterLock* after) {
-  std::unordered_map<const Job*, const TaskGroup*> in_file;
-  for (const TaskGroup* g = groups; g != nullptr; g = g->next) in_file.emplace(g->job, g);
+void retire_other_lives(TaskGroup* groups, TaskAfterLock* after, EntryIndex& index) {
+  // The groups are looked at in file order, in which their records lie in
+  // memory; the first group of a job is the one that counts.
+  std::unordered_set<const Job*> in_file;
   std::vector<const Job*> gone;
-  {
-    EntryIndex index;
-    index.for_each_job([&](const Job* job) {
-      if (job == nullptr) return;  // its job left the file: UpdateRunningTasks ends those
-      auto it = in_file.find(job);
-      const TaskGroup* g = it != in_file.end() ? it->second : nullptr;
-      index.select(job);
-      int seen = 0;
-      for (const TASK* e : index.selected()) seen = std::max(seen, e->seen_next_id);
-      if (g == nullptr || g->next_task_id < seen) {
+  for (const TaskGroup* g = groups; g != nullptr; g = g->next) {
+    const Job* job = g->job;
+    if (!in_file.insert(job).second || job == nullptr || !index.has(job)) continue;
+    index.select(job);
+    int seen = 0;
+    for (const TASK* e : index.selected()) seen = std::max(seen, e->seen_next_id);
+    if (g->next_task_id < seen) {
+      gone.push_back(job);
+      continue;
+    }
+    for (const TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
+      TASK* e = index.find(rec->id);
+      if (e != nullptr && !Task_same_rec(e->rec, rec)) {
         gone.push_back(job);
-        return;
+        break;
       }
-      for (const TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
-        TASK* e = index.find(rec->id);
-        if (e != nullptr && !Task_same_rec(e->rec, rec)) {
-          gone.push_back(job);
-          return;
-        }
-      }
-    });
+    }
   }
-  for (const Job* job : gone) Task_retire_job(job, after);
+  // Entries whose job left the file (the null job) are UpdateRunningTasks'
+  // to end; a job with entries but no group has lost its group.
+  index.for_each_job([&](const Job* job) {
+    if (job != nullptr && in_file.count(job) == 0) gone.push_back(job);
+  });
+  for (const Job* job : gone) {
+    Task_retire_job(job, after);
+    index.drop(job);
+  }
 }
 
 }  // namespace
@@ -340,7 +399,6 @@ TASK* GetaPendingTask() {
 TASK* Get_a_task() { return Task_get(); }
 
 TASK* Task_get() {
-  Task_retire_marked();
   const char* host = rndctl.host.c_str();
   TaskAfterLock after;
   TASK* chosen = nullptr;
@@ -349,14 +407,23 @@ TASK* Task_get() {
     opened = true;
     TaskGroup*& groups = *list;
     // Every entry that finds its record in the file loses the mark again;
-    // those that keep it have left the file.
-    for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) e->stale = 1;
-    retire_other_lives(groups, &after);
+    // those that keep it have left the file.  One index of the entries
+    // serves the whole cycle.
+    // Entries marked as of another life go first, as Task_retire_marked
+    // would drop them, found in the same walk of the list.
+    std::vector<TASK*> marked;
+    EntryIndex index(true, &marked);
+    for (TASK* e : marked) {
+      dbgpnt("freeing Task %x\n", px(e));
+      Task_let_go(e, &after);
+      TASK_free(e);
+    }
+    retire_other_lives(groups, &after, index);
 
     insert_unknown_pending_jobs(&groups);
 
     if (TaskRec* rec = extract_pending_task(&groups)) {
-      chosen = match_a_taskrec(rec);
+      chosen = index.match(rec->group->job, rec);
       // The record is PENDING in the file: an entry here that still held it
       // lost it, and its render stops before the piece is taken again.
       if (chosen != nullptr && chosen->rec != rec) Task_settle(chosen, rec, &after);
@@ -364,7 +431,11 @@ TASK* Task_get() {
       split_a_task(rec->group, rec);
       if (rec->group->next_task_id != ids_before) after.wake(rec->group->job);
       if (chosen == nullptr) {
+        TaskRec** link = &rec->group->tasks;
+        while (*link != nullptr && *link != rec) link = &(*link)->next;
+        if (*link == rec) rec = TaskRec_unpool(link);
         chosen = Task_add(rec->group->job, rec);
+        index.file(chosen);
       } else if (chosen->rec != rec) {
         TaskRec* own = chosen->rec;
         own->start = rec->start;
@@ -382,15 +453,16 @@ TASK* Task_get() {
     }
 
     // Bring the mirror in line with the file, group by group.
-    EntryIndex index;
     for (TaskGroup* g = groups; g != nullptr; g = g->next) {
       Job* job = g->job;
       int uses_host = isa_job_using_host(host, job);
       index.select(job);
-      for (TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
+      for (TaskRec** link = &g->tasks; *link != nullptr; link = &(*link)->next) {
+        TaskRec* rec = *link;
         TASK* e = index.find(rec->id);
         if (e != nullptr && !Task_same_rec(e->rec, rec)) e = nullptr;
         if (e == nullptr) {
+          rec = TaskRec_unpool(link);
           e = Task_add(job, rec);  // the entry owns the record from now on
           if (e != nullptr) index.add(e);
         } else if (e->rec != rec && uses_host) {
@@ -427,7 +499,10 @@ TASK* Task_get() {
 
     return true;
   });
-  if (!opened) return nullptr;
+  if (!opened) {
+    Task_retire_marked();
+    return nullptr;
+  }
   after.run();
   if (written != 1 && chosen != nullptr && chosen->rec != nullptr) {
     // The file does not say STARTED (the failure is reported): another host

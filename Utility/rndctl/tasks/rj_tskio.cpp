@@ -365,6 +365,80 @@ void put_literal(TextOut& out, const char* s, size_t n) {
 }
 
 // ---------------------------------------------------------------------------
+// The records of a read come from blocks of many, in file order: a file of
+// a hundred thousand records would otherwise cost as many heap blocks taken
+// and given back per cycle, and lie scattered over the heap for every later
+// walk.  A record keeps its meaning (TaskRec_free releases it like any
+// other); a block goes back to the heap once every record in it has been
+// freed.  The selection cycle gives the records its entries keep a heap
+// block of their own (TaskRec_unpool), so that a block is not kept for one
+// survivor.
+struct RecBlock {
+  static constexpr size_t kRecords = 1024;
+  alignas(TaskRec) unsigned char space[kRecords * sizeof(TaskRec)];
+  size_t used = 0;  // records made so far
+  size_t live = 0;  // made and not yet freed
+
+  TaskRec* at(size_t i) { return reinterpret_cast<TaskRec*>(space) + i; }
+  bool holds(const TaskRec* rec) const {
+    auto p = reinterpret_cast<uintptr_t>(rec);
+    auto b = reinterpret_cast<uintptr_t>(space);
+    return p >= b && p < b + sizeof space;
+  }
+};
+
+// Every block with records in it, by address; the last one made is filled
+// first.
+std::vector<RecBlock*> rec_blocks;
+RecBlock* rec_current = nullptr;
+
+RecBlock* block_of(const TaskRec* rec) {
+  auto it = std::upper_bound(
+      rec_blocks.begin(), rec_blocks.end(), rec, [](const TaskRec* r, const RecBlock* b) {
+        return reinterpret_cast<uintptr_t>(r) < reinterpret_cast<uintptr_t>(b);
+      });
+  if (it == rec_blocks.begin()) return nullptr;
+  RecBlock* b = *(it - 1);
+  return b->holds(rec) ? b : nullptr;
+}
+
+TaskRec* pooled_rec() {
+  if (rec_current == nullptr || rec_current->used == RecBlock::kRecords) {
+    void* p = MA_malloc(sizeof(RecBlock), __LINE__, kUnit, 1);
+    if (p == nullptr) return nullptr;
+    RecBlock* b;
+    try {
+      rec_blocks.insert(
+          std::upper_bound(rec_blocks.begin(), rec_blocks.end(), static_cast<RecBlock*>(p)),
+          static_cast<RecBlock*>(p));
+    } catch (const std::bad_alloc&) {
+      MA_free(p, __LINE__, kUnit);
+      return nullptr;
+    }
+    b = new (p) RecBlock;
+    rec_current = b;
+  }
+  ++rec_current->live;
+  return new (rec_current->at(rec_current->used++)) TaskRec;
+}
+
+// Ends a record of a block; false when the record is a heap block of its own.
+bool release_pooled(TaskRec* rec) {
+  RecBlock* b = block_of(rec);
+  if (b == nullptr) return false;
+  rec->~TaskRec();
+  if (--b->live > 0) return true;
+  if (b == rec_current) {
+    b->used = 0;  // empty again: the next read fills it from the start
+    return true;
+  }
+  rec_blocks.erase(std::lower_bound(rec_blocks.begin(), rec_blocks.end(), b));
+  b->~RecBlock();
+  MA_free(b, __LINE__, kUnit);
+  return true;
+}
+
+// ---------------------------------------------------------------------------
 // Reading groups.
 
 enum class GroupRead { kGroup, kSkipped, kEnd };
@@ -420,8 +494,15 @@ GroupRead read_group(TokenSource& in, TaskGroup** out, bool* more) {
       return GroupRead::kEnd;
     }
     if (group == nullptr) continue;
-    TaskRec* rec = TaskRec_alloc(nullptr, start, end, current, Dev_by_index(dev_index),
-                                 TASK_PENDING, status, id);
+    TaskRec* rec = pooled_rec();
+    if (rec != nullptr) {
+      rec->start = start;
+      rec->end = end;
+      rec->current = current;
+      rec->dev = Dev_by_index(dev_index);
+      rec->id = id;
+      ISA_task_status(status, &rec->status);
+    }
     if (rec == nullptr) {
       *out = group;
       return GroupRead::kEnd;
@@ -662,7 +743,27 @@ void TaskRec_free(TaskRec* rec) {
   dbgpnt("TaskRec_free 0x%x\n", px(rec));
   rec->id = -1;
   rec->status = TASK_PENDING;
+  if (release_pooled(rec)) return;
   MA_delete(rec, __LINE__, kUnit);
+}
+
+TaskRec* TaskRec_unpool(TaskRec** link) {
+  if (link == nullptr || *link == nullptr) return nullptr;
+  TaskRec* rec = *link;
+  if (block_of(rec) == nullptr) return rec;
+  TaskRec* copy = MA_new<TaskRec>(__LINE__, kUnit, *rec);
+  if (copy == nullptr) return rec;  // stays where it is, and keeps its block
+  // Nothing else points at a record just read but its group's list (and an
+  // entry that owns it, if any).
+  if (rec->task != nullptr && rec->task->rec == rec) rec->task->rec = copy;
+  *link = copy;
+  rec->task = nullptr;
+  rec->group = nullptr;
+  rec->next = nullptr;
+  rec->id = -1;
+  rec->status = TASK_PENDING;
+  release_pooled(rec);
+  return copy;
 }
 
 void TaskRec_freeOnly(TaskRec* rec) {
@@ -998,7 +1099,8 @@ void Editor_load_Tasks() {
   }
   TaskGroup* groups = Task_read(fp);
   for (TaskGroup* g = groups; g != nullptr; g = g->next) {
-    for (TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) Task_add(g->job, rec);
+    for (TaskRec** link = &g->tasks; *link != nullptr; link = &(*link)->next)
+      Task_add(g->job, TaskRec_unpool(link));
   }
   (void)close_fileop(FILE_TASKS);  // read only: nothing to lose
   lock_fileop(FILE_TASKS, 0);

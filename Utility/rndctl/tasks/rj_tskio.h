@@ -13,6 +13,12 @@ int ISA_task_status(const char* text, int* code);
 TaskGroup* TaskGroup_alloc(Job* job, int next_task_id);
 TaskRec* TaskRec_alloc(TaskGroup* group, float start, float end, float current, Dev* dev,
                        int status, const char* status_text, int id);
+/// The records Task_read makes share larger blocks.  For the record at *link
+/// (a link of a group's list) that is one of them, puts a copy in a heap
+/// block of its own in its place (an entry that owns it owns the copy) and
+/// returns the copy; any other record is returned as it is.  For a record
+/// that an entry is to keep beyond the cycle that read it.
+TaskRec* TaskRec_unpool(TaskRec** link);
 void TaskRec_free(TaskRec* rec);
 void TaskRec_freeOnly(TaskRec* rec);
 void TaskGroup_free(TaskGroup** list, TaskGroup* group);
