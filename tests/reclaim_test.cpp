@@ -34,8 +34,11 @@ class ReclaimTest : public TaskFixture {
     rj_render_kill_leftovers();  // forgets whatever a test registered
     TaskFixture::TearDown();
   }
-  void set_age(const std::string& name, time_t seconds) {
-    struct timespec t[2] = {{time(nullptr) - seconds, 0}, {time(nullptr) - seconds, 0}};
+  // Ages are taken against `now` when given, so that a second that passes
+  // during the test does not shift them.
+  void set_age(const std::string& name, time_t seconds, time_t now = 0) {
+    if (now == 0) now = time(nullptr);
+    struct timespec t[2] = {{now - seconds, 0}, {now - seconds, 0}};
     ASSERT_EQ(utimensat(AT_FDCWD, path(name).c_str(), t, 0), 0);
   }
   // A child in its own process group that waits to be killed.
@@ -133,7 +136,7 @@ TEST_F(ReclaimTest, AnotherHostsTaskIsPutBackOnlyWhenItsHeartbeatIsOldAndItsDaem
     unlink(path("TSKSTAT/farhost").c_str());
     if (c.heartbeat_age >= 0) {
       write_file("TSKSTAT/farhost", "");
-      set_age("TSKSTAT/farhost", c.heartbeat_age);
+      set_age("TSKSTAT/farhost", c.heartbeat_age, now);
     }
     unlink(path("farhost.pid").c_str());
     if (c.daemon_alive) {
