@@ -478,6 +478,8 @@ TEST_P(PidfileClaimTest, OfClaimersStartingAtOnceExactlyOneWins) {
     ASSERT_GE(child, 0);
     if (child == 0) {
       rndctl.pid = getpid();
+      // Every claimer judges the file before any places its claim.
+      pidfile_claim_pause = [] { usleep(50000); };
       close(go[1]);
       close(done[1]);
       char byte;

@@ -126,6 +126,8 @@ bool place_claim(const std::string& claim, const std::string& path) {
 
 }  // namespace
 
+void (*pidfile_claim_pause)() = [] {};
+
 PidfileRead Pidfile_read(const char* host) { return read_path(rj_pid_path(host).c_str()); }
 
 int Pidfile_probe(const char* host) { return probe(host, Pidfile_read(host)); }
@@ -143,6 +145,7 @@ int Pidfile_claim() {
     int alive = probe(host, r);
     if (round == 0) (void)daemon_updatetime_set(host);  // the time set is of no use here
     if (alive) return 1;
+    pidfile_claim_pause();
     if (!write_claim(claim, rndctl.pid)) return 0;
     if (exists && take_away_stale(path, seen, r.pid) == Take::kChanged) {
       unlink(claim.c_str());

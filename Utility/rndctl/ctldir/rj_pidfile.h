@@ -54,3 +54,7 @@ struct PidfileRead {
 /// opened is logged ("error openning \"%s\", <%s>") in the access log, a
 /// short one traced and logged with its reason; both answer false.
 [[nodiscard]] bool Pidfile_self_check();
+
+/// Called by Pidfile_claim between judging the file and placing its claim;
+/// does nothing.  Tests replace it to make claimers meet.
+extern void (*pidfile_claim_pause)();
