@@ -6,10 +6,13 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdio>
 #include <string>
 #include <vector>
 
+#include "Utility/rndctl/ctldir/rj_paths.h"
+#include "Utility/rndctl/ctldir/rj_pidfile.h"
 #include "tests/support/test_support.h"
 
 namespace {
@@ -107,13 +110,19 @@ TEST_F(FileopTest, FreeLockHoldsHostFileWithPidAndReleaseRemovesBoth) {
   std::string holder = lock_dir(FILE_TASKS) + "/testhost";
   EXPECT_EQ(read_text_file(holder), std::to_string(getpid()) + "\n");
   EXPECT_EQ(mode_of(lock_dir(FILE_TASKS)), 0777u);
-  // Made aside and renamed into place: nothing else is left beside it.
+  // The holder is renamed in: nothing else is left beside the lock.
   EXPECT_EQ(entries(), std::vector<std::string>{"Render_Tasks.lock"});
   EXPECT_TRUE(pauses.empty());
 
   // The lock path is built on first use and the access log is opened with it.
   EXPECT_EQ(std::string(fileop_path(FILE_TASKS)), path("Render_Tasks"));
   EXPECT_EQ(read_file("Render_Access"), "\n\n *** Start of new process entries ***\n\n");
+  // Reading a missing file makes it, empty.
+  FILE* fp = read_fileop(FILE_TASKS);
+  ASSERT_NE(fp, nullptr);
+  EXPECT_EQ(fgetc(fp), EOF);
+  EXPECT_EQ(close_fileop(FILE_TASKS), 0);
+  EXPECT_EQ(read_file("Render_Tasks"), "");
 
   long before = fileop_hold_stats(FILE_TASKS).count;
   fake_mono += 3 * kSecond / 1000;
@@ -187,46 +196,6 @@ INSTANTIATE_TEST_SUITE_P(
         // An editor between its mkdir and its holder: respected for a while.
         BusyLock{"NoHolderFile", nullptr, "", 5, "abandoned without a holder pid"}),
     [](const testing::TestParamInfo<BusyLock>& info) { return std::string(info.param.name); });
-
-TEST_F(FileopTest, BackoffStartsInMillisecondsGrowsAndNeverPausesOverFiveSeconds) {
-  plant_lock(FILE_TASKS, "otherhost", "1\n");
-  testing::internal::CaptureStderr();
-  ASSERT_EQ(lock_fileop(FILE_TASKS, 1), 1);
-  testing::internal::GetCapturedStderr();
-  ASSERT_GE(pauses.size(), 10u);
-  EXPECT_LE(pauses[0], 2 * kSecond / 1000);
-  for (size_t i = 0; i < pauses.size(); i++) {
-    EXPECT_LE(pauses[i], 5 * kSecond) << i;
-    // Each pause is at least half its doubling ceiling: two steps on, longer.
-    if (i >= 2 && pauses[i - 2] < 2 * kSecond) {
-      EXPECT_GT(pauses[i], pauses[i - 2]) << i;
-    }
-  }
-  // 181 s of waiting in a few tens of attempts, not thousands.
-  EXPECT_LE(pauses.size(), 100u);
-  EXPECT_GE(fake_server - kLockMade, 181);
-}
-
-TEST_F(FileopTest, ServerClockIsTheTimeOfATouchedFileReadAtMostOnceASecond) {
-  fileop_server_clock = saved_server_;
-  ASSERT_EQ(init_fileop(), 1);
-  fake_mono = 0;
-  time_t first = fileop_server_clock();
-  const std::string clock_file = path(".clock.testhost");
-  struct stat st;
-  ASSERT_EQ(stat(clock_file.c_str(), &st), 0);
-  EXPECT_EQ(first, st.st_mtime);
-  // Within a second the reading is carried forward, the file left alone.
-  struct timespec times[2] = {{kLockMade, 0}, {kLockMade, 0}};
-  ASSERT_EQ(utimensat(AT_FDCWD, clock_file.c_str(), times, 0), 0);
-  fake_mono += kSecond / 2;
-  EXPECT_EQ(fileop_server_clock(), first);
-  fake_mono += kSecond;
-  time_t later = fileop_server_clock();
-  ASSERT_EQ(stat(clock_file.c_str(), &st), 0);
-  EXPECT_EQ(later, st.st_mtime);
-  EXPECT_GE(later, first);
-}
 
 TEST_F(FileopTest, StaleLockWithoutItsHolderFileIsBrokenAllTheSame) {
   plant_lock(FILE_TASKS, nullptr, "");
@@ -336,7 +305,7 @@ int rewrite(int index, Shape shape, const std::string& text) {
       return fwrite(text.data(), 1, text.size(), out) == text.size();
     });
   }
-  lock_fileop(index, 1);
+  FileopLock lock(index);
   FILE* fp = update_fileop(index);
   if (fp == nullptr) return -2;
   if (shape == Shape::kRewind) {
@@ -345,9 +314,7 @@ int rewrite(int index, Shape shape, const std::string& text) {
     rewind_fileop(index);
   }
   fwrite(text.data(), 1, text.size(), fp);
-  int result = close_and_truncate_fileop(index);
-  lock_fileop(index, 0);
-  return result;
+  return close_and_truncate_fileop(index);
 }
 
 class RewriteTest : public FileopTest, public testing::WithParamInterface<Shape> {
@@ -418,18 +385,6 @@ INSTANTIATE_TEST_SUITE_P(Shapes, RewriteTest,
                          testing::Values(Shape::kRewind, Shape::kWriteAtOnce,
                                          Shape::kRewriteHelper));
 
-TEST_F(FileopTest, ReadingAMissingFileCreatesItEmpty) {
-  ASSERT_EQ(lock_fileop(FILE_JOBS, 1), 1);
-  FILE* fp = read_fileop(FILE_JOBS);
-  ASSERT_NE(fp, nullptr);
-  EXPECT_EQ(fgetc(fp), EOF);
-  EXPECT_EQ(close_fileop(FILE_JOBS), 0);
-  lock_fileop(FILE_JOBS, 0);
-  struct stat st;
-  ASSERT_EQ(stat(path("Render_Job_Control").c_str(), &st), 0);
-  EXPECT_EQ(st.st_size, 0);
-}
-
 TEST_F(FileopTest, OriginalUmaskSurvivesReinitialisation) {
   umask(022);
   ASSERT_EQ(init_fileop(), 1);
@@ -437,6 +392,78 @@ TEST_F(FileopTest, OriginalUmaskSurvivesReinitialisation) {
   ASSERT_EQ(init_fileop(), 1);
   EXPECT_EQ(get_original_umask(), static_cast<mode_t>(022));
   EXPECT_EQ(umask(0), static_cast<mode_t>(1));
+}
+
+void write_pid(const std::string& file, int32_t pid, size_t bytes = sizeof(int32_t)) {
+  ASSERT_TRUE(write_text_file(file, std::string(reinterpret_cast<const char*>(&pid), bytes)));
+}
+
+// What start-up finds in the pid file; every time, of claimers starting at
+// once exactly one wins, the others see it alive, and no claim is left over.
+struct Found {
+  const char* name;
+  int bytes;  // of the pid of a process that has exited; -1: no file
+};
+class PidfileClaimTest : public FileopTest, public testing::WithParamInterface<Found> {};
+
+TEST_P(PidfileClaimTest, OfClaimersStartingAtOnceExactlyOneWins) {
+  pid_t gone = fork();
+  if (gone == 0) _exit(0);
+  ASSERT_EQ(waitpid(gone, nullptr, 0), gone);
+  if (GetParam().bytes >= 0) write_pid(path("testhost.pid"), gone, GetParam().bytes);
+  int go[2], results[2];
+  ASSERT_EQ(pipe(go), 0);
+  ASSERT_EQ(pipe(results), 0);
+  std::vector<pid_t> children;
+  for (int i = 0; i < 4; i++) {
+    pid_t child = fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+      rndctl.pid = getpid();
+      // Every claimer judges the file before any places its claim.
+      pidfile_claim_pause = [] { usleep(50000); };
+      close(go[1]);
+      char byte;
+      if (read(go[0], &byte, 1) != 0) _exit(3);
+      byte = static_cast<char>('0' + Pidfile_claim());
+      if (write(results[1], &byte, 1) != 1) _exit(4);
+      pause();  // alive until every claimer has judged
+      _exit(0);
+    }
+    children.push_back(child);
+  }
+  close(go[0]);
+  close(go[1]);
+  close(results[1]);
+  std::string answers;
+  char byte;
+  while (answers.size() < children.size() && read(results[0], &byte, 1) == 1) answers += byte;
+  PidfileRead now = Pidfile_read("testhost");
+  for (pid_t child : children) kill(child, SIGKILL);
+  for (pid_t child : children) ASSERT_EQ(waitpid(child, nullptr, 0), child);
+  EXPECT_EQ(std::count(answers.begin(), answers.end(), '0'), 1) << answers;
+  EXPECT_EQ(std::count(answers.begin(), answers.end(), '1'), 3) << answers;
+  ASSERT_EQ(now.status, PIDFILE_OK);
+  EXPECT_NE(std::find(children.begin(), children.end(), now.pid), children.end());
+  EXPECT_EQ(entries(), std::vector<std::string>{"testhost.pid"});
+}
+
+INSTANTIATE_TEST_SUITE_P(Found, PidfileClaimTest,
+                         testing::Values(Found{"NoFile", -1}, Found{"DeadPid", 4},
+                                         Found{"ShortFile", 2}),
+                         [](const testing::TestParamInfo<Found>& info) {
+                           return std::string(info.param.name);
+                         });
+
+TEST_F(FileopTest, SelfCheckPassesOnlyWhileThePidFileNamesThisProcess) {
+  ASSERT_EQ(init_fileop(), 1);
+  write_pid(path("testhost.pid"), rndctl.pid);
+  EXPECT_TRUE(Pidfile_self_check());
+  write_pid(path("testhost.pid"), rndctl.pid + 1);
+  EXPECT_FALSE(Pidfile_self_check());
+  write_pid(path("testhost.pid"), rndctl.pid, 3);
+  EXPECT_FALSE(Pidfile_self_check());
+  EXPECT_NE(read_file("Render_Access").find("* short pid file --  testhost:"), std::string::npos);
 }
 
 }  // namespace

@@ -23,6 +23,7 @@
 #include "Utility/rndctl/base/rj_control.h"
 #include "Utility/rndctl/base/rj_log.h"
 #include "Utility/rndctl/base/rj_text.h"
+#include "Utility/rndctl/ctldir/rj_pidfile.h"
 #include "Utility/rndctl/ctldir/rj_updatetime.h"
 #include "Utility/rndctl/ctlfile/rj_reload.h"
 #include "Utility/rndctl/proc/rj_signal.h"
@@ -77,67 +78,6 @@ constexpr const char* kUsage =
 [[noreturn]] void usage_error(const char* what, const char* option) {
   fprintf(stderr, "%s: %s %s\n%s", PrgName, what, option, kUsage);
   exit(2);
-}
-
-void pid_file_path(char* out, size_t size) {
-  snprintf(out, size, "%s/%s.pid", rndctl.location.or_else("."), rndctl.host.or_else(""));
-}
-
-// Reads the 4-byte native pid of this host's pid file; 0 when absent or short.
-// Returns false when the file cannot be opened.
-bool read_pid_file(int* pid, bool log_failures) {
-  char path[4096];
-  pid_file_path(path, sizeof path);
-  *pid = 0;
-  FILE* fp = fopen(path, "r");
-  if (fp == nullptr) {
-    if (log_failures) wrt_logfile("error openning \"%s\", <%s>", path, strerror(errno));
-    return false;
-  }
-  int32_t value = 0;
-  if (fread(&value, sizeof value, 1, fp) != 1) {
-    const char* why = ferror(fp) ? strerror(errno) : "short pid file";
-    dbgpnt("%s\n", why);
-    if (log_failures) wrt_logfile("%s", why);
-    value = 0;
-  }
-  fclose(fp);
-  *pid = value;
-  return true;
-}
-
-// Start-up pid check: 1 when another daemon is alive on this host, else
-// claims the pid file and returns 0.
-int pid_file_startup_check() {
-  int pid = 0;
-  read_pid_file(&pid, false);
-  int alive = 0;
-  if (pid != 0) {
-    if (RJ_signal(rndctl.host.c_str(), pid, 0) != 0) {
-      dbgpnt("process is DEAD --> %s:%d\n", rndctl.host.c_str(), pid);
-    } else {
-      dbgpnt("process is alive --> %s:%d\n", rndctl.host.c_str(), pid);
-      alive = 1;
-    }
-  }
-  daemon_updatetime_set(rndctl.host.c_str());
-  if (alive) return 1;
-
-  char path[4096];
-  pid_file_path(path, sizeof path);
-  FILE* fp = fopen(path, "w");
-  if (fp != nullptr) {
-    int32_t value = rndctl.pid;
-    if (fwrite(&value, sizeof value, 1, fp) != 1) EDuprintf("%s", strerror(errno));
-    if (fclose(fp) != 0) EDuprintf("%s", strerror(errno));
-  }
-  return 0;
-}
-
-bool self_check() {
-  int pid = 0;
-  if (!read_pid_file(&pid, true)) return false;
-  return pid == rndctl.pid;
 }
 
 int work_check() {
@@ -227,14 +167,23 @@ bool dead_host_check_due() {
 // Leaving: nothing this daemon started may go on rendering unowned.
 void leave() { Task_release_own_renders(); }
 
-// The service loop.  Returns when the daemon is to exit.
-void zrd() {
-  const char* host = rndctl.host.c_str();
+// The loop's state from one pass to the next.
+struct Loop {
+  const char* host;
+  // Whether the schedule locks this host (any non-zero value counts).
+  int locked;
+  int interval;  // seconds; 0: no timed reloads, negative: reload at once
+  int idle;      // workless wake-ups left before the daemon leaves
+};
+
+Loop prepare_loop() {
+  Loop loop;
+  loop.host = rndctl.host.c_str();
   VerifyRunningTasks();
   // Deliberately the unconverted index: a free host (-1) starts as "locked"
   // and a host locked in slot 0 as "free", so that the first wake-up in
   // either case performs a transition.
-  int locked = Dev_schedule_check(host);
+  loop.locked = Dev_schedule_check(loop.host);
 
   // SIGALRM and SIGCHLD are blocked since main's first line and stay so;
   // the waits let them through only while they wait.
@@ -242,99 +191,113 @@ void zrd() {
   RJ_sighold(SIGCHLD);
   RJ_sigset(SIGALRM, sig_handler);
   RJ_sigset(SIGCHLD, sig_handler);
-  int interval = interval_seconds();
+  loop.interval = interval_seconds();
   umask(2);
-  int idle = 10;
+  loop.idle = 10;
+  return loop;
+}
 
-  for (;;) {
-    time_t server_now = rj_heartbeat();
-    if (daemon_updatetime_get(host) != rndctl.last_update) Update_from_demon(0);
-    if (server_now != 0 && dead_host_check_due()) Task_reclaim_dead_hosts(server_now);
-    UpdateRunningTasks();
-    for (TASK* task = GetaPendingTask(); task != nullptr; task = GetaPendingTask()) {
-      if (Perform_a_Task(task) == 0) SetTaskStatus(task, TASK_FAILED);
-    }
-    UpdateRunningTasks();
-    bool settled = rj_update_time_settled(rndctl.last_update, rj_heartbeat());
+// One pass: take in what changed, put back the work of dead hosts, start
+// what this host may render.
+void run_pass(const Loop& loop) {
+  time_t server_now = rj_heartbeat();
+  if (daemon_updatetime_get(loop.host) != rndctl.last_update) Update_from_demon(0);
+  if (server_now != 0 && dead_host_check_due()) Task_reclaim_dead_hosts(server_now);
+  UpdateRunningTasks();
+  for (TASK* task = GetaPendingTask(); task != nullptr; task = GetaPendingTask()) {
+    if (Perform_a_Task(task) == 0) SetTaskStatus(task, TASK_FAILED);
+  }
+  UpdateRunningTasks();
+}
 
-    time_t start = time(nullptr);
-    bool reload = daemon_updatetime_get(host) != rndctl.last_update || interval < 0;
-    while (!reload) {
-      Wake wake = wait_for_wake(host, &settled);
-      if (!self_check()) {
-        wrt_logfile("Exiting due to self check failure");
-        leave();
-        return;
-      }
-      rj_heartbeat();
-      // A touch is work announced: straight to the reload.  Only the alarm
-      // and the other signals count as the idle wake-ups they always were.
-      if (wake == Wake::kTouched) break;
-      if (work_check() == 0) {
-        idle = idle - 1;
-        if (idle < 0) {
-          dbg_logfile("Exiting due to no work found");
-          leave();
-          return;
-        }
-      } else {
-        idle = 180;
-      }
-      interval = interval_seconds();
-      int elapsed = static_cast<int>(time(nullptr) - start);
-      dbgpnt("pause %d:%02d\t\tsec since last check = %d\n", rndctl.interval_min,
-             rndctl.interval_sec, elapsed);
-
-      int r = Dev_schedule_check(host);
-      if (r >= 0 && !locked) {
-        dbgpnt("locked = %d\n", 1);
-        daemon_updatetime_set(host);
-        daemon_kill_running_tasks(host);
-        locked = 1;
-      } else if (r < 0 && locked) {
-        dbgpnt("locked = %d\n", 0);
-        locked = 0;
-        daemon_updatetime_set(host);
-      }
-
-      if (daemon_updatetime_get(host) != rndctl.last_update) {
-        reload = true;
-      } else if (interval == 0 || elapsed < interval) {
-        continue;
-      } else {
-        reload = true;
-      }
-    }
-
-    RJ_sighold(SIGALRM);
-    RJ_sighold(SIGCHLD);
-    dbgpnt("good morning\n");
-    dbgpnt("somthings changed\n");  // read by log watchers: keep the spelling
-    RJC_in();
+// Follows the host's schedule: locking it kills its renders.  Either change
+// touches the pid file, so that a reload and a full pass follow at once.
+void follow_schedule(Loop* loop) {
+  int r = Dev_schedule_check(loop->host);
+  if (r >= 0 && !loop->locked) {
+    dbgpnt("locked = %d\n", 1);
+    (void)daemon_updatetime_set(loop->host);  // the time set is of no use here
+    daemon_kill_running_tasks(loop->host);
+    loop->locked = 1;
+  } else if (r < 0 && loop->locked) {
+    dbgpnt("locked = %d\n", 0);
+    loop->locked = 0;
+    (void)daemon_updatetime_set(loop->host);
   }
 }
 
-}  // namespace
+// Counts a wake-up against the idle allowance; false when it is used up.
+bool still_wanted(Loop* loop) {
+  if (work_check() != 0) {
+    loop->idle = 180;
+    return true;
+  }
+  loop->idle = loop->idle - 1;
+  return loop->idle >= 0;
+}
 
-int main(int argc, char* argv[]) {
-  // The wake-up signal of editors and tools may come before the handlers
-  // exist (while start-up waits for a lock): held, it ends the first wait
-  // instead of the process.
+enum class After { kReload, kExit };
+
+// Waits between passes until a reload is due, or until the daemon is to
+// exit (then the access log says why).
+After wait_for_reload(Loop* loop) {
+  bool settled = rj_update_time_settled(rndctl.last_update, rj_heartbeat());
+  time_t start = time(nullptr);
+  if (daemon_updatetime_get(loop->host) != rndctl.last_update || loop->interval < 0) {
+    return After::kReload;
+  }
+  for (;;) {
+    Wake wake = wait_for_wake(loop->host, &settled);
+    if (!Pidfile_self_check()) {
+      wrt_logfile("Exiting due to self check failure");
+      return After::kExit;
+    }
+    rj_heartbeat();
+    // A touch is work announced: straight to the reload.  Only the alarm
+    // and the other signals count as the idle wake-ups they always were.
+    if (wake == Wake::kTouched) return After::kReload;
+    if (!still_wanted(loop)) {
+      dbg_logfile("Exiting due to no work found");
+      return After::kExit;
+    }
+    loop->interval = interval_seconds();
+    int elapsed = static_cast<int>(time(nullptr) - start);
+    dbgpnt("pause %d:%02d\t\tsec since last check = %d\n", rndctl.interval_min, rndctl.interval_sec,
+           elapsed);
+    follow_schedule(loop);
+    if (daemon_updatetime_get(loop->host) != rndctl.last_update) return After::kReload;
+    if (loop->interval != 0 && elapsed >= loop->interval) return After::kReload;
+  }
+}
+
+void reload() {
   RJ_sighold(SIGALRM);
   RJ_sighold(SIGCHLD);
-  umask(2);
+  dbgpnt("good morning\n");
+  dbgpnt("somthings changed\n");  // read by log watchers: keep the spelling
+  RJC_in();
+}
 
-  const char* slash = strrchr(argv[0], '/');
-  PrgName = slash != nullptr ? slash + 1 : argv[0];
-  MA_init();
-  ProgramName = MA_strdup(PrgName, __LINE__, "Utility/stand/zarno_render_demon");
-  snprintf(ApplModeName, sizeof ApplModeName, "%s", PrgName);
+// The service loop: a pass, a wait, a reload, until the daemon is to exit.
+void zrd() {
+  Loop loop = prepare_loop();
+  for (;;) {
+    run_pass(loop);
+    if (wait_for_reload(&loop) == After::kExit) {
+      leave();
+      return;
+    }
+    reload();
+  }
+}
 
-  debug = 0;
-  rndctl.single_pass = 0;
-
+struct Options {
   long interval = 0;
   const char* location = nullptr;
+};
+
+Options parse_command_line(int argc, char* argv[]) {
+  Options o;
   bool debug_given = false;
   opterr = 0;  // our own messages below
   static const struct option kLong[] = {{"help", no_argument, nullptr, 'h'},
@@ -348,10 +311,10 @@ int main(int argc, char* argv[]) {
         exit(0);
       case 'u':
         // Read wide, so that a huge value is refused rather than wrapped.
-        interval = strtol(optarg, nullptr, 10);
+        o.interval = strtol(optarg, nullptr, 10);
         break;
       case 'l':
-        location = optarg;
+        o.location = optarg;
         break;
       case 'd':
         debug = atoi(optarg);
@@ -371,12 +334,38 @@ int main(int argc, char* argv[]) {
     const char* level = getenv("RNDCTL_DEBUG");
     if (level != nullptr) debug = atoi(level);
   }
+  return o;
+}
 
-  RJC_init_rndctl(location);
+void name_program(const char* argv0) {
+  const char* slash = strrchr(argv0, '/');
+  PrgName = slash != nullptr ? slash + 1 : argv0;
+  MA_init();
+  ProgramName = MA_strdup(PrgName, __LINE__, "Utility/stand/zarno_render_demon");
+  snprintf(ApplModeName, sizeof ApplModeName, "%s", PrgName);
+}
+
+}  // namespace
+
+int main(int argc, char* argv[]) {
+  // The wake-up signal of editors and tools may come before the handlers
+  // exist (while start-up waits for a lock): held, it ends the first wait
+  // instead of the process.
+  RJ_sighold(SIGALRM);
+  RJ_sighold(SIGCHLD);
+  umask(2);
+  name_program(argv[0]);
+  debug = 0;
+  rndctl.single_pass = 0;
+  Options options = parse_command_line(argc, argv);
+
+  RJC_init_rndctl(options.location);
   check_control_directory();
-  if (interval != 0) (void)RJC_set_check_interval(interval / 60, interval % 60, "-u");
-
-  if (pid_file_startup_check() != 0) exit(1);
+  if (options.interval != 0) {
+    (void)RJC_set_check_interval(options.interval / 60, options.interval % 60, "-u");
+  }
+  // One daemon per host: a live one keeps its place.
+  if (Pidfile_claim() != 0) exit(1);
   open_log_file();
   // Whoever can write the control directory chooses the programs this
   // daemon runs: as root, that is every program on the host.

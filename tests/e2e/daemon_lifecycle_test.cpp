@@ -56,18 +56,6 @@ TEST(DaemonLifecycle, SecondDaemonOnTheSameHostRefusesToStart) {
   EXPECT_FALSE(first.ended());
 }
 
-TEST(DaemonLifecycle, StalePidFileIsTakenOver) {
-  Farm farm;
-  int gone = dead_pid();
-  write_pid_file(farm.path(this_host_name() + ".pid"), gone);
-  Daemon& d = farm.start_on_farm();
-  ASSERT_TRUE(started(farm, d));
-  std::string early = read_text_file(d.tmpdir + "/early");
-  EXPECT_NE(early.find("process is DEAD --> " + d.host + ":" + std::to_string(gone)),
-            std::string::npos)
-      << early;
-}
-
 TEST(DaemonLifecycle, RemovedPidFileEndsTheDaemonAtItsNextWakeUp) {
   Farm farm;
   Daemon& d = farm.start_on_farm();

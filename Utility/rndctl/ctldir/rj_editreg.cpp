@@ -16,11 +16,13 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <string>
 
 #include "Utility/rndctl/base/rj_control.h"
 #include "Utility/rndctl/base/rj_log.h"
 #include "Utility/rndctl/base/rj_text.h"
 #include "Utility/rndctl/ctldir/rj_fileio.h"
+#include "Utility/rndctl/ctldir/rj_paths.h"
 #include "Utility/rndctl/proc/rj_signal.h"
 
 namespace {
@@ -39,10 +41,6 @@ EditSlot edit_table[kSlots];
 // Editor_process_validate.  Nanoseconds: a registration made within the same
 // second as the last load must still be seen.
 int64_t registry_load_time = 0;
-
-void registry_path(char* out, size_t size) {
-  snprintf(out, size, "%s/RndCtl_EditPids", rndctl.location.or_else("."));
-}
 
 void end_table(int n) {
   if (n < kSlots) edit_table[n].pid = 0;
@@ -85,21 +83,20 @@ int read_table(FILE* fp) {
   return n;
 }
 
-// The registry could not be opened: say so and let go of its lock.
-void give_up_open(const char* path) {
-  dbgpnt("ERROR: failed to open %s\n", path);
-  EDuprintf("ERROR: failed to open %s", path);
-  lock_fileop(FILE_EDITPIDS, 0);
+// The registry could not be opened: say so (the caller's lock goes with
+// its scope).
+void give_up_open(const std::string& path) {
+  dbgpnt("ERROR: failed to open %s\n", path.c_str());
+  EDuprintf("ERROR: failed to open %s", path.c_str());
 }
 
 }  // namespace
 
 void Editor_registry_update(int mode, std::vector<int>* dead) {
-  char path[PATH_MAX];
-  registry_path(path, sizeof path);
+  const std::string path = rj_control_path(FILE_EDITPIDS);
   end_table(0);
 
-  lock_fileop(FILE_EDITPIDS, 1);
+  FileopLock lock(FILE_EDITPIDS);
   FILE* fp = update_fileop(FILE_EDITPIDS);
   if (fp == nullptr) {
     give_up_open(path);
@@ -117,8 +114,8 @@ void Editor_registry_update(int mode, std::vector<int>* dead) {
       n++;
       end_table(n);
     } else {
-      EDuprintf("ERROR: editor registry %s is full (%d editors): %s:%d not registered", path,
-                kSlots, rndctl.host.or_else(""), rndctl.pid);
+      EDuprintf("ERROR: editor registry %s is full (%d editors): %s:%d not registered",
+                path.c_str(), kSlots, rndctl.host.or_else(""), rndctl.pid);
     }
   }
 
@@ -142,32 +139,29 @@ void Editor_registry_update(int mode, std::vector<int>* dead) {
     const EditSlot& slot = edit_table[i];
     if (slot.pid > 0) fprintf(fp, "%s %d %s\n", slot.host, slot.pid, slot.user);
   }
-  (void)close_and_truncate_fileop(
-      FILE_EDITPIDS);  // a failure is reported there; the old file stands
-  lock_fileop(FILE_EDITPIDS, 0);
+  // A failure is reported there; the old file stands.
+  (void)close_and_truncate_fileop(FILE_EDITPIDS);
 }
 
 int Editor_process_validate(int pid) {
-  char path[PATH_MAX];
-  registry_path(path, sizeof path);
+  const std::string path = rj_control_path(FILE_EDITPIDS);
   struct stat st;
   int64_t t = 0;
-  if (stat(path, &st) == 0) {
+  if (stat(path.c_str(), &st) == 0) {
     t = static_cast<int64_t>(st.st_mtim.tv_sec) * 1000000000LL + st.st_mtim.tv_nsec;
   }
 
   if (t > registry_load_time) {
     registry_load_time = t;
     end_table(0);
-    lock_fileop(FILE_EDITPIDS, 1);
+    FileopLock lock(FILE_EDITPIDS);
     FILE* fp = read_fileop(FILE_EDITPIDS);
     if (fp == nullptr) {
       give_up_open(path);
       return 0;
     }
     read_table(fp);
-    (void)close_fileop(FILE_EDITPIDS);  // a failure is reported there; the old file stands
-    lock_fileop(FILE_EDITPIDS, 0);
+    (void)close_fileop(FILE_EDITPIDS);  // read only: nothing to lose
   }
 
   int i = 0;

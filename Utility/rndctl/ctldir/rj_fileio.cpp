@@ -31,10 +31,6 @@
 #include "Utility/rndctl/base/rj_log.h"
 #include "Utility/rndctl/base/rj_text.h"
 
-const char* const control_names[FILE_COUNT] = {
-    "Render_Job_Control",    "Render_Resource_Control", "Render_Tasks",  "RndCtl_EditPids",
-    "Render_Dev_next_index", "Render_Job_next_index",   "Render_Access", "Render_Status"};
-
 namespace {
 
 constexpr const char* kUnit = "Utility/rndctl/rj_fileio";
@@ -76,13 +72,11 @@ FileRecord files[FILE_COUNT];
 
 bool valid_index(int index) { return index >= 0 && index < FILE_COUNT; }
 
-// Heap copy of a "%s/%s%s" path through the checking allocator.
-char* make_path(const char* dir, const char* name, const char* suffix, int line) {
-  int n = snprintf(nullptr, 0, "%s/%s%s", dir, name, suffix);
-  if (n < 0) return nullptr;
-  size_t size = static_cast<size_t>(n) + 1;
-  char* p = static_cast<char*>(MA_malloc(size, line, kUnit, 1));
-  if (p != nullptr) snprintf(p, size, "%s/%s%s", dir, name, suffix);
+// Heap copy of a path through the checking allocator.
+char* copy_path(const std::string& path, int line) {
+  if (path.empty()) return nullptr;
+  char* p = static_cast<char*>(MA_malloc(path.size() + 1, line, kUnit, 1));
+  if (p != nullptr) memcpy(p, path.c_str(), path.size() + 1);
   return p;
 }
 
@@ -355,12 +349,11 @@ void after_open(FILE* fp) {
 
 int init_fileop() {
   if (rndctl.location.none() || rndctl.location.c_str()[0] == '\0') rndctl.location.set(".");
-  const char* dir = rndctl.location.c_str();
   for (int i = 0; i < FILE_COUNT; i++) {
     MA_free(files[i].path, __LINE__, kUnit);
     MA_free(files[i].lock_path, __LINE__, kUnit);
-    files[i].path = make_path(dir, control_names[i], "", __LINE__);
-    files[i].lock_path = make_path(dir, control_names[i], ".lock", __LINE__);
+    files[i].path = copy_path(rj_control_path(i), __LINE__);
+    files[i].lock_path = copy_path(rj_lock_path(i), __LINE__);
   }
   // Only the first initialisation sees the umask the process started with;
   // a later one (after fileop_reset) would see our own.

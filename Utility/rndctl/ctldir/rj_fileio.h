@@ -6,51 +6,50 @@
 #include <cstdio>
 #include <ctime>
 
-// The shared files, by index into control_names.
-enum {
-  FILE_JOBS = 0,
-  FILE_RESOURCES = 1,
-  FILE_TASKS = 2,
-  FILE_EDITPIDS = 3,
-  FILE_DEV_INDEX = 4,
-  FILE_JOB_INDEX = 5,
-  FILE_ACCESS = 6,
-  FILE_STATUS = 7,
-  FILE_COUNT = 8
-};
+#include "Utility/rndctl/ctldir/rj_paths.h"
 
-// Locked file operations (rj_fileio, rj_lockdir).
-//
-// Mutual exclusion and atomic rewrites of the shared files.  Every shared
-// file has a fixed index (FILE_JOBS ...) and a lock directory "NAME.lock"
-// beside it that holds one holder file, named after the holder's host and
-// containing "%d\n" with its pid.
-//
-// Calling order, always:
-//   lock_fileop(i, 1)                     waits until the lock is this process's
-//   read_fileop(i) | update_fileop(i)     stream, or null (reported)
-//   ... read; for a rewrite rewind_fileop(i) and write from the start ...
-//   close_fileop(i) | close_and_truncate_fileop(i)   0, or -1 (reported)
-//   lock_fileop(i, 0)                     releases, only when it is ours
-// New code uses FileopLock and fileop_rewrite below instead.
-//
-// A rewrite never shows half done: an update stream reads the file as it
-// was, keeps what is written to it in memory, and close_and_truncate_fileop
-// (or fileop_rewrite) puts the new contents in a temporary file beside the
-// old one ("NAME.new.XXXXXX"), forces it to disk and renames it over the old
-// one; a reader sees the old file or the new one.  When the new contents
-// equal the old, nothing is written and the file keeps its inode and times.
-//
-// What a crash leaves behind: during a rewrite at most the temporary file,
-// which nobody reads (the old file stands); while holding a lock, the lock
-// directory: this host's next waiter breaks it at once (its holder pid is
-// dead), other hosts when it is 181 s old.  A lock is made aside
-// ("NAME.lock.HOST.PID.N") with its holder file and renamed into place, so
-// no lock directory of ours ever stands without its holder; a process
-// killed while waiting leaves its aside directory, which nobody reads.
-//
-// Nothing here is safe inside a signal handler.
-extern const char* const control_names[FILE_COUNT];
+/// Locked file operations (rj_fileio, rj_lockdir).
+///
+/// Mutual exclusion and atomic rewrites of the shared files.  Every shared
+/// file has a fixed index (FILE_JOBS ..., rj_paths.h) and a lock directory
+/// "NAME.lock" beside it that holds one holder file, named after the
+/// holder's host and containing "%d\n" with its pid.
+///
+/// Calling order.  A read:
+///   { FileopLock lock(i);                waits until the lock is this process's
+///     read_fileop(i) ... close_fileop(i) }   stream or null (reported); 0 or -1
+/// A rewrite: fileop_rewrite(i, change), which locks, reads, writes and
+/// releases in one call.  The pieces beneath, for writers that keep the
+/// shape of a read followed by a write on one stream:
+///   lock_fileop(i, 1)  update_fileop(i)  ... rewind_fileop(i) and write ...
+///   close_and_truncate_fileop(i)  lock_fileop(i, 0)
+/// A lock taken by hand is left held by any early return; FileopLock is not.
+///
+/// The control block: init_fileop (called by the first lock or open) sets
+/// rndctl.location to "." when it is unset or empty and reads it for every
+/// path; the locks read rndctl.host and rndctl.pid (the holder file).
+/// Nothing else of rndctl is read or written.  init_fileop also records the
+/// umask the process started with and hands the access log to rj_log.
+///
+/// A rewrite never shows half done: an update stream reads the file as it
+/// was, keeps what is written to it in memory, and close_and_truncate_fileop
+/// (or fileop_rewrite) puts the new contents in a temporary file beside the
+/// old one ("NAME.new.XXXXXX"), forces it to disk and renames it over the old
+/// one; a reader sees the old file or the new one.  When the new contents
+/// equal the old, nothing is written and the file keeps its inode and times.
+///
+/// What a crash leaves behind: during a rewrite at most the temporary file,
+/// which nobody reads (the old file stands); while holding a lock, the lock
+/// directory: this host's next waiter breaks it at once (its holder pid is
+/// dead), other hosts when it is 181 s old.  A crash between the mkdir of a
+/// lock and the rename of its holder file into it leaves a lock without a
+/// holder, which waiters break when it is 5 s old.  Breaks and releases
+/// rename the lock aside first ("NAME.lock.broken.HOST.PID.N",
+/// "NAME.lock.released.HOST.PID.N"); a crash then leaves that directory,
+/// which nobody reads.
+///
+/// Nothing here is safe inside a signal handler.
+/// Builds the path table and opens the access log (see above); returns 1.
 int init_fileop();
 /// take non-zero: waits (backing off, see fileop_poll_seconds) until the lock
 /// of file `index` is taken, breaking it when its holder is gone; returns 1.

@@ -30,11 +30,13 @@
 #include <cstring>
 #include <ctime>
 #include <memory>
+#include <string>
 
 #include "Utility/rndctl/base/rj_control.h"
 #include "Utility/rndctl/base/rj_log.h"
 #include "Utility/rndctl/base/rj_text.h"
 #include "Utility/rndctl/ctldir/rj_fileio.h"
+#include "Utility/rndctl/ctldir/rj_paths.h"
 
 namespace {
 
@@ -75,10 +77,8 @@ time_t touched_server_clock() {
   if (have && now - taken_at >= 0 && now - taken_at < kNsPerSecond) {
     return server + static_cast<time_t>((now - taken_at) / kNsPerSecond);
   }
-  char path[PATH_MAX];
-  snprintf(path, sizeof path, "%s/.clock.%s", rndctl.location.or_else("."),
-           rndctl.host.or_else(""));
-  int fd = open(path, O_WRONLY | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0666);
+  const std::string path = rj_clock_path(rndctl.host.or_else(""));
+  int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0666);
   struct stat st;
   // Setting the times to "now" lets the server stamp them with its own clock.
   bool ok = fd >= 0 && futimens(fd, nullptr) == 0 && fstat(fd, &st) == 0;

@@ -8,9 +8,11 @@
 #include <cstdio>
 #include <cstring>
 #include <ctime>
+#include <string>
 
 #include "Utility/rndctl/base/rj_control.h"
 #include "Utility/rndctl/base/rj_log.h"
+#include "Utility/rndctl/ctldir/rj_paths.h"
 
 long min_disk_space = 5242880;
 
@@ -18,40 +20,31 @@ namespace {
 int64_t to_ns(const struct timespec& ts) {
   return static_cast<int64_t>(ts.tv_sec) * 1000000000LL + ts.tv_nsec;
 }
-
-void pid_file_path(char* out, size_t size, const char* host) {
-  snprintf(out, size, "%s/%s.pid", rndctl.location.or_else("."), host);
-}
 }  // namespace
 
 int64_t daemon_updatetime_set(const char* host) {
   if (host == nullptr) return 0;
-  char path[4096];
-  pid_file_path(path, sizeof path, host);
+  const std::string path = rj_pid_path(host);
   // Full resolution: a change made within the second of the last reload must
   // still read as a change.  A missing file stays missing.
   struct timespec now;
   clock_gettime(CLOCK_REALTIME, &now);
   struct timespec times[2] = {now, now};
-  utimensat(AT_FDCWD, path, times, 0);
-  dbgpnt("daemon_updatetime_set( %s ) to %d \n", path, static_cast<int>(now.tv_sec));
+  (void)utimensat(AT_FDCWD, path.c_str(), times, 0);
+  dbgpnt("daemon_updatetime_set( %s ) to %d \n", path.c_str(), static_cast<int>(now.tv_sec));
   return to_ns(now);
 }
 
 int64_t daemon_updatetime_get(const char* host) {
   if (host == nullptr) return 0;
-  char path[4096];
-  pid_file_path(path, sizeof path, host);
   struct stat st;
-  if (stat(path, &st) != 0) return 0;
+  if (stat(rj_pid_path(host).c_str(), &st) != 0) return 0;
   return to_ns(st.st_mtim);
 }
 
 int64_t editor_updatetime_get() {
-  char path[4096];
-  snprintf(path, sizeof path, "%s/Render_Job_Control", rndctl.location.or_else("."));
   struct stat st;
-  if (stat(path, &st) != 0) return 0;
+  if (stat(rj_control_path(FILE_JOBS).c_str(), &st) != 0) return 0;
   return to_ns(st.st_mtim);
 }
 

@@ -207,17 +207,19 @@ bool unchanged(int index) {
 const Seen* read_file(int index) {
   if (unchanged(index)) return &seen[index];
   std::string bytes;
-  lock_fileop(index, 1);
-  FILE* fp = read_fileop(index);
-  bool ok = fp != nullptr;
-  if (fp != nullptr) {
-    char buf[1 << 16];
-    size_t n;
-    while (ok && (n = fread(buf, 1, sizeof buf, fp)) > 0) bytes.append(buf, n);
-    if (ferror(fp)) ok = false;
-    (void)close_fileop(index);  // a failure is reported there; the old file stands
+  bool ok;
+  {
+    FileopLock lock(index);
+    FILE* fp = read_fileop(index);
+    ok = fp != nullptr;
+    if (fp != nullptr) {
+      char buf[1 << 16];
+      size_t n;
+      while (ok && (n = fread(buf, 1, sizeof buf, fp)) > 0) bytes.append(buf, n);
+      if (ferror(fp)) ok = false;
+      (void)close_fileop(index);  // a failure is reported there; the old file stands
+    }
   }
-  lock_fileop(index, 0);
   if (!ok) {
     forget(index);
     return nullptr;
@@ -259,28 +261,19 @@ std::string render(int index) {
 // the newer version), -1 when the write failed (reported by the file
 // operations; the old file stands).
 int write_if_unchanged(int index, const std::string& text, const std::string& expected) {
-  lock_fileop(index, 1);
-  int result;
-  if (!holds(index, expected)) {
-    result = 0;
+  FileopLock lock(index);
+  if (!holds(index, expected)) return 0;
+  FILE* fp = update_fileop(index);
+  if (fp == nullptr) return -1;
+  rewind_fileop(index);
+  bool ok = fwrite(text.data(), 1, text.size(), fp) == text.size();
+  ok = close_and_truncate_fileop(index) == 0 && ok;
+  if (ok) {
+    remember(index, text);
   } else {
-    FILE* fp = update_fileop(index);
-    if (fp == nullptr) {
-      result = -1;
-    } else {
-      rewind_fileop(index);
-      bool ok = fwrite(text.data(), 1, text.size(), fp) == text.size();
-      ok = close_and_truncate_fileop(index) == 0 && ok;
-      result = ok ? 1 : -1;
-      if (ok) {
-        remember(index, text);
-      } else {
-        forget(index);
-      }
-    }
+    forget(index);
   }
-  lock_fileop(index, 0);
-  return result;
+  return ok ? 1 : -1;
 }
 
 // Reads one control file into the control block's lists (a plain reload).
@@ -387,25 +380,21 @@ int RRC_reload(int flag) {
 void Job_control_write(const char* /*dir*/) {
   dbgpnt("Job_control_write\n");
   detach_tasks_of_deleted_jobs();
-  lock_fileop(FILE_JOBS, 1);
+  FileopLock lock(FILE_JOBS);
   FILE* fp = update_fileop(FILE_JOBS);
-  if (fp != nullptr) {
-    Job_control_write_dev(fp);
-    (void)close_and_truncate_fileop(FILE_JOBS);  // a failure is reported there; the old file stands
-  }
-  lock_fileop(FILE_JOBS, 0);
+  if (fp == nullptr) return;
+  Job_control_write_dev(fp);
+  (void)close_and_truncate_fileop(FILE_JOBS);  // a failure is reported there; the old file stands
 }
 
 void Resource_control_write(const char* /*dir*/) {
   dbgpnt("Resource_control_write\n");
-  lock_fileop(FILE_RESOURCES, 1);
+  FileopLock lock(FILE_RESOURCES);
   FILE* fp = update_fileop(FILE_RESOURCES);
-  if (fp != nullptr) {
-    Resource_control_write_dev(fp);
-    (void)close_and_truncate_fileop(
-        FILE_RESOURCES);  // a failure is reported there; the old file stands
-  }
-  lock_fileop(FILE_RESOURCES, 0);
+  if (fp == nullptr) return;
+  Resource_control_write_dev(fp);
+  // A failure is reported there; the old file stands.
+  (void)close_and_truncate_fileop(FILE_RESOURCES);
 }
 
 int RJC_in() {

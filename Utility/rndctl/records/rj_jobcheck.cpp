@@ -46,7 +46,7 @@ const char* name_of(const Text& name) { return name.or_else("noname"); }
 }  // namespace
 
 int RJCget_next_index(int file_id) {
-  lock_fileop(file_id, 1);
+  FileopLock lock(file_id);
   FILE* fp = update_fileop(file_id);
   int result = 1;
   if (fp != nullptr && fscanf(fp, "%d", &result) != 1) result = 1;
@@ -60,7 +60,6 @@ int RJCget_next_index(int file_id) {
     fprintf(fp, "%ul\n", store);
     (void)close_and_truncate_fileop(file_id);  // a failure is reported there; the old file stands
   }
-  lock_fileop(file_id, 0);
   return result;
 }
 

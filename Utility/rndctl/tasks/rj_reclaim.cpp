@@ -25,6 +25,8 @@
 #include "Utility/rndctl/base/rj_log.h"
 #include "Utility/rndctl/base/rj_text.h"
 #include "Utility/rndctl/ctldir/rj_fileio.h"
+#include "Utility/rndctl/ctldir/rj_paths.h"
+#include "Utility/rndctl/ctldir/rj_pidfile.h"
 #include "Utility/rndctl/proc/rj_signal.h"
 #include "Utility/rndctl/records/rj_dev.h"
 #include "Utility/rndctl/records/rj_recindex.h"
@@ -64,35 +66,8 @@ int put_back_cycle(Pick pick) {
   return count;
 }
 
-// The pid a host's pid file names; 0 when there is none.
-int pid_file_pid(const char* host) {
-  char path[PATH_MAX];
-  snprintf(path, sizeof path, "%s/%s.pid", rndctl.location.or_else("."), host);
-  int fd = open(path, O_RDONLY | O_CLOEXEC);
-  if (fd < 0) return 0;
-  int32_t pid = 0;
-  ssize_t n;
-  do n = read(fd, &pid, sizeof pid);
-  while (n < 0 && errno == EINTR);
-  close(fd);
-  return n == static_cast<ssize_t>(sizeof pid) ? pid : 0;
-}
-
 // The daemon-alive test.
-bool daemon_alive(const char* host) {
-  int pid = pid_file_pid(host);
-  if (pid == 0) return false;
-  if (RJ_signal(host, pid, 0) == 0) {
-    dbgpnt("process is alive --> %s:%d\n", host, pid);
-    return true;
-  }
-  dbgpnt("process is DEAD --> %s:%d\n", host, pid);
-  return false;
-}
-
-void heartbeat_path(char* out, size_t size, const char* host) {
-  snprintf(out, size, "%s/TSKSTAT/%s", rndctl.location.or_else("."), host);
-}
+bool daemon_alive(const char* host) { return Pidfile_probe(host) != 0; }
 
 // --- The render registry -----------------------------------------------------
 // Written from the SIGCHLD handler too: fixed storage, plain system calls.
@@ -271,12 +246,10 @@ int Task_reclaim_dead_hosts(time_t server_now) {
     auto it = verdicts.find(host);
     if (it != verdicts.end()) return it->second;
     Verdict v{false, 0};
-    char path[PATH_MAX];
-    heartbeat_path(path, sizeof path, host);
     struct stat st;
     // Without a heartbeat file the host runs a daemon that keeps none: leave
     // it to a person's Task_file_check.
-    if (stat(path, &st) == 0) {
+    if (stat(rj_tskstat_path(host).c_str(), &st) == 0) {
       v.age = static_cast<long>(server_now - st.st_mtim.tv_sec);
       v.dead = v.age > bound && !daemon_alive(host);
     }
@@ -311,7 +284,7 @@ int Task_release_own_renders() {
 
   // A daemon that took the pid file over put back this host's records when
   // it started and may be rendering them again under the same ids.
-  int owner = pid_file_pid(host);
+  int owner = Pidfile_read(host).pid;
   if (owner != 0 && owner != rndctl.pid && RJ_signal(host, owner, 0) == 0) {
     dbgpnt("exit: %d render(s) killed, records left to daemon %d\n", killed, owner);
     return killed;
@@ -333,13 +306,11 @@ int Task_release_own_renders() {
 time_t rj_heartbeat() {
   const char* host = rndctl.host.c_str();
   if (host == nullptr) return 0;
-  char path[PATH_MAX];
-  snprintf(path, sizeof path, "%s/TSKSTAT", rndctl.location.or_else("."));
-  if (mkdir(path, 0775) != 0 && errno != EEXIST) return 0;
-  heartbeat_path(path, sizeof path, host);
+  if (mkdir(rj_tskstat_dir().c_str(), 0775) != 0 && errno != EEXIST) return 0;
+  const std::string path = rj_tskstat_path(host);
   // Never truncated here: the file also lists this host's tasks.
   int fd;
-  do fd = open(path, O_WRONLY | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0666);
+  do fd = open(path.c_str(), O_WRONLY | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0666);
   while (fd < 0 && errno == EINTR);
   if (fd < 0) return 0;
   // Null times: the file server stamps its own clock, the one every host's

@@ -198,12 +198,17 @@ void Task_mark_rebuilt(const Job* job) {
 }
 
 int Task_retire_rebuilt(const std::vector<Job*>& jobs) {
-  lock_fileop(FILE_TASKS, 1);
-  FILE* fp = read_fileop(FILE_TASKS);
-  TaskGroup* groups = fp != nullptr ? Task_read(fp) : nullptr;
-  bool read = fp != nullptr;
-  if (fp != nullptr) (void)close_fileop(FILE_TASKS);  // read only: nothing to lose
-  lock_fileop(FILE_TASKS, 0);
+  TaskGroup* groups = nullptr;
+  bool read;
+  {
+    FileopLock lock(FILE_TASKS);
+    FILE* fp = read_fileop(FILE_TASKS);
+    read = fp != nullptr;
+    if (read) {
+      groups = Task_read(fp);
+      (void)close_fileop(FILE_TASKS);  // read only: nothing to lose
+    }
+  }
   int dropped = 0;
   TaskAfterLock after;
   for (Job* job : jobs) {
