@@ -15,13 +15,7 @@ using Words = std::vector<std::string>;
 enum class Rules { kWrapper, kPainter, kStamp };
 
 RwScanRules rules_of(Rules which) {
-  RwScanRules r;
-  if (which == Rules::kWrapper) return r;
-  r.blank_is_word = false;
-  r.processors_positive = false;
-  r.by_positive = false;
-  r.long_options = which == Rules::kPainter;
-  return r;
+  return which == Rules::kWrapper ? RwScanRules{} : Rw_first_rules(which == Rules::kPainter);
 }
 
 struct ScanCase {

@@ -103,39 +103,39 @@ MaTag* ma_fresh(int b, int debug) {
 
 using namespace ma_detail;
 
+namespace {
+
+// The machine's memory as sysinfo says it, or false after `complaint` and
+// the reason on stderr.
+bool machine_memory(const char* complaint, struct sysinfo* si) {
+  if (sysinfo(si) == 0) return true;
+  perr("%s: %s\n", complaint, strerror(errno));
+  return false;
+}
+
+}  // namespace
+
 long MA_get_total_swap() {
   struct sysinfo si {};
-  if (sysinfo(&si) != 0) {
-    perr("Swapctl could not get freeswap number: %s\n", strerror(errno));
-    return -1;
-  }
+  if (!machine_memory("Swapctl could not get freeswap number", &si)) return -1;
   return kb(si.totalswap, si.mem_unit);
 }
 
 long MA_swap_available() {
   struct sysinfo si {};
-  if (sysinfo(&si) != 0) {
-    perr("Swapctl could not get freeswap number: %s\n", strerror(errno));
-    return -1;
-  }
+  if (!machine_memory("Swapctl could not get freeswap number", &si)) return -1;
   return kb(si.freeswap, si.mem_unit);
 }
 
 long MA_get_real_memory_size() {
   struct sysinfo si {};
-  if (sysinfo(&si) != 0) {
-    perr("Sysmp failed to get size of SINFO: %s\n", strerror(errno));
-    return -1;
-  }
+  if (!machine_memory("Sysmp failed to get size of SINFO", &si)) return -1;
   return kb(si.totalram, si.mem_unit);
 }
 
 long MA_get_total_free() {
   struct sysinfo si {};
-  if (sysinfo(&si) != 0) {
-    perr("Sysmp failed to get the amount of free memory: %s\n", strerror(errno));
-    return -1;
-  }
+  if (!machine_memory("Sysmp failed to get the amount of free memory", &si)) return -1;
   return kb(si.freeram, si.mem_unit) + kb(si.freeswap, si.mem_unit);
 }
 

@@ -24,7 +24,6 @@
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
-#include <sstream>
 #include <string>
 #include <vector>
 
@@ -126,11 +125,7 @@ bool to_signal(const std::string& s, int* out) {
 int parse_arguments(int argc, char** argv, Settings* st) {
   // Older than the wrappers' rules: "-t 2" is an unknown option, -n0 and
   // -b 0 pass.
-  RwScanRules rules;
-  rules.blank_is_word = false;
-  rules.processors_positive = false;
-  rules.by_positive = false;
-  RwScan scan = Rw_scan(argc, argv, rules, &st->args);
+  RwScan scan = Rw_scan(argc, argv, Rw_first_rules(true), &st->args);
   switch (scan.result) {
     case RwScanResult::kOk:
       return -1;
@@ -162,13 +157,11 @@ int parse_arguments(int argc, char** argv, Settings* st) {
 
 // Returns false (reported) on an unknown or malformed setting.
 bool parse_render_options(Settings* st) {
-  std::istringstream in(st->args.options);
-  std::string item;
-  while (in >> item) {
-    size_t eq = item.find('=');
-    std::string key = item.substr(0, eq);
-    std::string value = eq == std::string::npos ? "" : item.substr(eq + 1);
-    bool ok = eq != std::string::npos && !value.empty();
+  for (const RwSetting& setting : Rw_settings(st->args.options)) {
+    const std::string& key = setting.key;
+    const std::string& value = setting.value;
+    const char* item = setting.word.c_str();
+    bool ok = setting.has_value && !value.empty();
     if (!ok) {
       // fall through to the report below
     } else if (key == "size") {
@@ -188,11 +181,11 @@ bool parse_render_options(Settings* st) {
     } else if (key == "fail_once") {
       st->fail_once = value;
     } else {
-      error_line("unknown render option \"%s\"", item.c_str());
+      error_line("unknown render option \"%s\"", item);
       return false;
     }
     if (!ok) {
-      error_line("bad render option \"%s\"", item.c_str());
+      error_line("bad render option \"%s\"", item);
       return false;
     }
   }

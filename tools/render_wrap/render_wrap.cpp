@@ -229,6 +229,20 @@ std::vector<std::string> Rw_words(const std::string& text) {
   return words;
 }
 
+std::vector<RwSetting> Rw_settings(const std::string& text) {
+  std::vector<RwSetting> settings;
+  for (std::string& w : Rw_words(text)) {
+    RwSetting s;
+    size_t eq = w.find('=');
+    s.has_value = eq != std::string::npos;
+    s.key = w.substr(0, eq);
+    if (s.has_value) s.value = w.substr(eq + 1);
+    s.word = std::move(w);
+    settings.push_back(std::move(s));
+  }
+  return settings;
+}
+
 void Rw_progress(const std::string& image, int done, int total) {
   fprintf(stderr, "%s r %d of %d\n", base_name(image.c_str()), done + 2, total);
   fflush(stderr);
@@ -247,6 +261,34 @@ void Rw_note(const char* format, ...) {
   vline(stdout, "", format, ap);
   va_end(ap);
 }
+
+namespace {
+
+// In the child: the pipe as stdout and stderr, signals as a fresh program
+// expects them, then the renderer.
+[[noreturn]] void exec_child(int out, char** args) {
+  // Only async-signal-safe calls from here to the exec.
+  dup2(out, 1);
+  dup2(out, 2);
+  struct sigaction dfl {};
+  dfl.sa_handler = SIG_DFL;
+  for (int sig = 1; sig < NSIG; sig++) sigaction(sig, &dfl, nullptr);
+  sigset_t none;
+  sigemptyset(&none);
+  sigprocmask(SIG_SETMASK, &none, nullptr);
+  execvp(args[0], args);
+  // The marker line lets the parent tell "could not start" from a
+  // renderer that failed on its own.
+  const char* why = strerror(errno);
+  const char* parts[] = {"\nrender_wrap: cannot run ", args[0], ": ", why, "\n"};
+  for (const char* p : parts) {
+    ssize_t ignored = write(2, p, strlen(p));
+    (void)ignored;
+  }
+  _exit(127);
+}
+
+}  // namespace
 
 int Rw_run(const std::vector<std::string>& argv,
            const std::function<void(const std::string&)>& line) {
@@ -268,27 +310,7 @@ int Rw_run(const std::vector<std::string>& argv,
     Rw_error("fork: %s", strerror(errno));
     return -1;
   }
-  if (pid == 0) {
-    // Only async-signal-safe calls from here to the exec.
-    dup2(*write_end, 1);
-    dup2(*write_end, 2);
-    struct sigaction dfl {};
-    dfl.sa_handler = SIG_DFL;
-    for (int sig = 1; sig < NSIG; sig++) sigaction(sig, &dfl, nullptr);
-    sigset_t none;
-    sigemptyset(&none);
-    sigprocmask(SIG_SETMASK, &none, nullptr);
-    execvp(args[0], args.data());
-    // The marker line lets the parent tell "could not start" from a
-    // renderer that failed on its own.
-    const char* why = strerror(errno);
-    const char* parts[] = {"\nrender_wrap: cannot run ", args[0], ": ", why, "\n"};
-    for (const char* p : parts) {
-      ssize_t ignored = write(2, p, strlen(p));
-      (void)ignored;
-    }
-    _exit(127);
-  }
+  if (pid == 0) exec_child(*write_end, args.data());
   write_end.reset();
 
   bool exec_failed = false;

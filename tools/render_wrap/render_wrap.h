@@ -70,6 +70,15 @@ struct RwScan {
   const char* value = nullptr;  // its value, for kBadValue
 };
 
+/// The rules frame_painter and stamp_render were written with (stamp_render
+/// never had long options).
+inline RwScanRules Rw_first_rules(bool long_options) {
+  return RwScanRules{.long_options = long_options,
+                     .blank_is_word = false,
+                     .processors_positive = false,
+                     .by_positive = false};
+}
+
 /// Reads argv into *out, stopping at the first fault, and reports nothing:
 /// each program says a fault in its own words.  With kOk, scene and options
 /// are set and pix is not empty; the range is as given (no end is made up).
@@ -107,6 +116,15 @@ std::vector<RwFrame> Rw_frames(const RwArgs& args);
 
 /// The options argument cut at blanks.
 std::vector<std::string> Rw_words(const std::string& text);
+
+/// One "key=value" word of an options argument; key is the whole word and
+/// value empty when it has no '='.
+struct RwSetting {
+  std::string word, key, value;
+  bool has_value = false;  // the word has an '='
+};
+/// The options argument as settings, in order.
+std::vector<RwSetting> Rw_settings(const std::string& text);
 
 /// "<base name of image> r <done + 2> of <total>" on stderr (the reader
 /// subtracts 2 from the number it reads).

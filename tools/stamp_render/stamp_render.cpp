@@ -23,7 +23,6 @@
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
-#include <sstream>
 #include <string>
 #include <vector>
 
@@ -59,12 +58,9 @@ struct Settings {
 
 // Returns false after a usage error on stderr.
 bool parse_render_options(Settings* st) {
-  std::istringstream in(st->args.options);
-  std::string item;
-  while (in >> item) {
-    size_t eq = item.find('=');
-    std::string key = item.substr(0, eq);
-    std::string value = eq == std::string::npos ? "" : item.substr(eq + 1);
+  for (const RwSetting& setting : Rw_settings(st->args.options)) {
+    const std::string& key = setting.key;
+    const std::string& value = setting.value;
     float f = 0;
     if (key == "sleep" && Rw_to_float(value.c_str(), &f) && f >= 0 && f <= 3600) {
       st->sleep = f;
@@ -73,7 +69,7 @@ bool parse_render_options(Settings* st) {
     } else if (key == "fail_at" && Rw_to_float(value.c_str(), &st->fail_at)) {
       st->have_fail_at = true;
     } else if (key != "size" && key != "slow") {  // frame_painter's settings pass
-      fprintf(stderr, "stamp_render: bad render option \"%s\"\n", item.c_str());
+      fprintf(stderr, "stamp_render: bad render option \"%s\"\n", setting.word.c_str());
       return false;
     }
   }
@@ -84,12 +80,7 @@ bool parse_render_options(Settings* st) {
 int parse_arguments(int argc, char** argv, Settings* st) {
   // The plainest rules of the render programs: no long options, "-t 2" is
   // a bad option, -n0 and -b 0 pass.
-  RwScanRules rules;
-  rules.long_options = false;
-  rules.blank_is_word = false;
-  rules.processors_positive = false;
-  rules.by_positive = false;
-  RwScan scan = Rw_scan(argc, argv, rules, &st->args);
+  RwScan scan = Rw_scan(argc, argv, Rw_first_rules(false), &st->args);
   switch (scan.result) {
     case RwScanResult::kOk:
       break;
