@@ -24,13 +24,13 @@
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
-#include <sstream>
 #include <string>
 #include <vector>
 
 #include "tools/frame_painter/paint.h"
 #include "tools/frame_painter/png_writer.h"
 #include "tools/frame_painter/scene.h"
+#include "tools/render_wrap/render_wrap.h"
 
 namespace {
 
@@ -63,13 +63,7 @@ constexpr const char* kUsage =
 constexpr float kFrameTolerance = 0.001f;
 
 struct Settings {
-  std::string pix, matte, scene, render_options;
-  bool have_start = false, have_end = false, have_by = false;
-  float start = 0, end = 0, by = 1;
-  bool have_first_ext = false;
-  int first_ext = 0, ext_step = 1;
-  bool have_ext_size = false;
-  int ext_size = 1;
+  RwArgs args;  // the daemon's argument list; args.options holds the settings below
 
   int width = 0, height = 0;  // 0: the scene's size
   double slow = 0;
@@ -109,28 +103,9 @@ void frame_error_line(const char* fmt, ...) {
   va_end(ap);
 }
 
-bool to_float(const char* s, float* out) {
-  char* end = nullptr;
-  errno = 0;
-  float v = strtof(s, &end);
-  if (end == s || *end != '\0' || errno == ERANGE || !std::isfinite(v)) return false;
-  *out = v;
-  return true;
-}
-
-bool to_int(const char* s, int* out) {
-  char* end = nullptr;
-  errno = 0;
-  long v = strtol(s, &end, 10);
-  if (end == s || *end != '\0' || errno == ERANGE || v < -1000000000L || v > 1000000000L)
-    return false;
-  *out = static_cast<int>(v);
-  return true;
-}
-
 bool to_signal(const std::string& s, int* out) {
   int n = 0;
-  if (to_int(s.c_str(), &n)) {
+  if (Rw_to_int(s.c_str(), &n)) {
     if (n < 1 || n >= NSIG) return false;
     *out = n;
     return true;
@@ -146,124 +121,71 @@ bool to_signal(const std::string& s, int* out) {
   return false;
 }
 
-// Returns 0 when parsed, 1 for a bad argument (reported), 2 after -h, 3 for
-// an unknown option (reported, with the usage on stderr).
+// The exit status for a command line that is not to be run, else -1.
 int parse_arguments(int argc, char** argv, Settings* st) {
-  std::vector<const char*> positional;
-  bool options_done = false;
-  for (int i = 1; i < argc; i++) {
-    const char* a = argv[i];
-    if (options_done || a[0] != '-' || a[1] == '\0') {
-      positional.push_back(a);
-      continue;
-    }
-    std::string opt = a;
-    if (opt == "--") {
-      options_done = true;
-      continue;
-    }
-    if (opt == "-h" || opt == "--help") {
+  // Older than the wrappers' rules: "-t 2" is an unknown option, -n0 and
+  // -b 0 pass.
+  RwScan scan = Rw_scan(argc, argv, Rw_first_rules(true), &st->args);
+  switch (scan.result) {
+    case RwScanResult::kOk:
+      return -1;
+    case RwScanResult::kHelp:
       fputs(kUsage, stdout);
-      return 2;
-    }
-    if (opt == "-A" || opt == "-V") continue;
-    // The daemon passes the host's processor count as one word "-n4".
-    if (opt.compare(0, 2, "-n") == 0 && opt.size() > 2 &&
-        opt.find_first_not_of("0123456789", 2) == std::string::npos)
-      continue;
-
-    static const std::string kWithValue = "pmsebSBE";
-    if (opt.size() != 2 || kWithValue.find(opt[1]) == std::string::npos) {
-      error_line("unknown option \"%s\"", a);
+      return 0;
+    case RwScanResult::kUnknown:
+      error_line("unknown option \"%s\"", scan.word);
       fputs(kUsage, stderr);
-      return 3;
-    }
-    if (i + 1 >= argc) {
-      error_line("option %s needs a value", a);
-      return 1;
-    }
-    const char* v = argv[++i];
-    bool ok = true;
-    switch (opt[1]) {
-      case 'p':
-        st->pix = v;
-        break;
-      case 'm':
-        st->matte = v;
-        break;
-      case 's':
-        ok = to_float(v, &st->start), st->have_start = true;
-        break;
-      case 'e':
-        ok = to_float(v, &st->end), st->have_end = true;
-        break;
-      case 'b':
-        ok = to_float(v, &st->by), st->have_by = true;
-        break;
-      case 'S':
-        ok = to_int(v, &st->first_ext), st->have_first_ext = true;
-        break;
-      case 'B':
-        ok = to_int(v, &st->ext_step);
-        break;
-      case 'E':
-        ok = to_int(v, &st->ext_size) && st->ext_size >= 0 && st->ext_size <= 32;
-        st->have_ext_size = true;
-        break;
-    }
-    if (!ok) {
-      error_line("bad value \"%s\" for option %s", v, a);
-      return 1;
-    }
+      return 2;
+    case RwScanResult::kNoValue:
+      error_line("option %s needs a value", scan.word);
+      break;
+    case RwScanResult::kBadValue:
+      error_line("bad value \"%s\" for option %s", scan.value, scan.word);
+      break;
+    case RwScanResult::kNoScene:
+      error_line("no scene file given (frame_painter -h for help)");
+      break;
+    case RwScanResult::kTooMany:
+      error_line("too many arguments (frame_painter -h for help)");
+      break;
+    case RwScanResult::kNoPix:
+      error_line("no image path given (-p PIX)");
+      break;
   }
-
-  if (positional.empty() || positional.size() > 2) {
-    error_line(positional.empty() ? "no scene file given (frame_painter -h for help)"
-                                  : "too many arguments (frame_painter -h for help)");
-    return 1;
-  }
-  st->scene = positional.back();
-  if (positional.size() == 2) st->render_options = positional.front();
-  if (st->pix.empty()) {
-    error_line("no image path given (-p PIX)");
-    return 1;
-  }
-  return 0;
+  return 1;
 }
 
 // Returns false (reported) on an unknown or malformed setting.
 bool parse_render_options(Settings* st) {
-  std::istringstream in(st->render_options);
-  std::string item;
-  while (in >> item) {
-    size_t eq = item.find('=');
-    std::string key = item.substr(0, eq);
-    std::string value = eq == std::string::npos ? "" : item.substr(eq + 1);
-    bool ok = eq != std::string::npos && !value.empty();
+  for (const RwSetting& setting : Rw_settings(st->args.options)) {
+    const std::string& key = setting.key;
+    const std::string& value = setting.value;
+    const char* item = setting.word.c_str();
+    bool ok = setting.has_value && !value.empty();
     if (!ok) {
       // fall through to the report below
     } else if (key == "size") {
       ok = parse_size(value, &st->width, &st->height);
     } else if (key == "slow") {
       float s = 0;
-      ok = to_float(value.c_str(), &s) && s >= 0 && s <= 3600;
+      ok = Rw_to_float(value.c_str(), &s) && s >= 0 && s <= 3600;
       st->slow = s;
     } else if (key == "fail_at") {
-      ok = to_float(value.c_str(), &st->fail_at);
+      ok = Rw_to_float(value.c_str(), &st->fail_at);
       st->have_fail_at = true;
     } else if (key == "die_at") {
       size_t colon = value.find(':');
-      ok = colon != std::string::npos && to_float(value.substr(0, colon).c_str(), &st->die_at) &&
+      ok = colon != std::string::npos && Rw_to_float(value.substr(0, colon).c_str(), &st->die_at) &&
            to_signal(value.substr(colon + 1), &st->die_signal);
       st->have_die_at = true;
     } else if (key == "fail_once") {
       st->fail_once = value;
     } else {
-      error_line("unknown render option \"%s\"", item.c_str());
+      error_line("unknown render option \"%s\"", item);
       return false;
     }
     if (!ok) {
-      error_line("bad render option \"%s\"", item.c_str());
+      error_line("bad render option \"%s\"", item);
       return false;
     }
   }
@@ -274,18 +196,8 @@ bool parse_render_options(Settings* st) {
 // the end, plus the end itself when the steps land on it within a thousandth
 // of a step. A descending or single-frame range is its start frame alone.
 std::vector<float> frame_list(float start, float end, float by) {
-  std::vector<float> frames;
   if (end == start || by == 0.0f || end < start) return {start};
-  float f = start;
-  while (f < end) {
-    frames.push_back(f);
-    float next = f + by;
-    if (next == f) break;
-    f = next;
-  }
-  if (f >= end && std::fabs(static_cast<double>(f) - end) <= 0.001 * by) frames.push_back(end);
-  if (frames.empty()) frames.push_back(start);
-  return frames;
+  return Rw_frame_values(start, end, by);
 }
 
 std::string with_extension(const std::string& path, int ext, int size) {
@@ -337,62 +249,131 @@ void sleep_seconds(double seconds) {
   }
 }
 
+// What the command line and the scene together ask for.
+struct Plan {
+  int width = 0, height = 0;
+  bool animated = false;  // images get extensions; else one still to PIX
+  std::vector<float> frames;
+  std::vector<int> extensions;
+  int ext_size = 1;
+  // Field rendering: the second field of each frame is half a frame step
+  // later than the first, so fast motion combs the way video does.
+  bool interlaced = false;
+  float step = 1;
+  int first_field_parity = 0;  // row 0 is the first (odd) line
+};
+
+Plan make_plan(const Settings& st, const Scene& scene) {
+  const RwArgs& a = st.args;
+  Plan plan;
+  plan.width = st.width ? st.width : scene.width;
+  plan.height = st.height ? st.height : scene.height;
+  // The command line's range wins; without one the scene's own animation
+  // settings decide, so the program is also usable by hand.
+  plan.animated = a.animate || scene.animation;
+  plan.ext_size = a.have_ext_size ? a.ext_size : scene.extensionsize;
+  if (a.animate) {
+    plan.frames = frame_list(a.start, a.have_end ? a.end : a.start, a.have_by ? a.by : 1.0f);
+    for (size_t i = 0; i < plan.frames.size(); i++)
+      plan.extensions.push_back(a.have_first_ext ? a.first_ext + static_cast<int>(i) * a.ext_step
+                                                 : static_cast<int>(plan.frames[i]));
+  } else if (scene.animation) {
+    plan.frames = frame_list(scene.startframe, scene.endframe, scene.byframe);
+    for (size_t i = 0; i < plan.frames.size(); i++)
+      plan.extensions.push_back(scene.has_start_extension
+                                    ? scene.start_extension +
+                                          static_cast<int>(i) * scene.by_extension
+                                    : static_cast<int>(plan.frames[i]));
+  } else {
+    plan.frames = {scene.startframe};
+  }
+  if (plan.ext_size < 0 || plan.ext_size > 32) plan.ext_size = 1;
+  plan.interlaced = scene.fields && (scene.odd || scene.even);
+  plan.step = a.have_by ? a.by : scene.byframe;
+  plan.first_field_parity = scene.odd ? 0 : 1;
+  return plan;
+}
+
+struct Canvas {
+  std::vector<uint8_t> rgb;
+  std::vector<uint8_t> matte;  // empty without -m
+};
+
+// Paints frame i of the plan and writes its image (and matte); false after
+// an error line.
+bool paint_frame(const Settings& st, const Scene& scene, const Plan& plan, size_t i,
+                 Canvas* canvas) {
+  float f = plan.frames[i];
+  int width = plan.width, height = plan.height;
+  std::string image =
+      plan.animated ? with_extension(st.args.pix, plan.extensions[i], plan.ext_size) : st.args.pix;
+  size_t slash = image.rfind('/');
+  std::string image_name = slash == std::string::npos ? image : image.substr(slash + 1);
+  char stamp[32];
+  snprintf(stamp, sizeof stamp, "%g", f);
+
+  for (int y = 0; y < height; y++) {
+    float t = f;
+    if (plan.interlaced && (y % 2) != plan.first_field_parity) t += plan.step / 2;
+    size_t row = static_cast<size_t>(y) * width;
+    paint_row(scene, width, height, y, t, stamp, &canvas->rgb[row * 3],
+              canvas->matte.empty() ? nullptr : &canvas->matte[row]);
+    // The reader takes the number, adds the line count when it is 0 or
+    // less, then subtracts 2; reporting lines done + 2 makes that exact.
+    fprintf(stderr, "%s r %d of %d\n", image_name.c_str(), y + 1 + 2, height);
+    fflush(stderr);
+    sleep_seconds(st.slow / height);
+  }
+
+  int werr = png_write_file(image, png_encode(canvas->rgb, static_cast<uint32_t>(width),
+                                              static_cast<uint32_t>(height), PngColour::kRgb));
+  if (werr != 0) {
+    error_line("cannot write image \"%s\": %s", image.c_str(), strerror(werr));
+    return false;
+  }
+  printf("wrote %s\n", image.c_str());
+  if (!st.args.matte.empty()) {
+    std::string mpath = plan.animated
+                            ? with_extension(st.args.matte, plan.extensions[i], plan.ext_size)
+                            : st.args.matte;
+    werr = png_write_file(mpath, png_encode(canvas->matte, static_cast<uint32_t>(width),
+                                            static_cast<uint32_t>(height), PngColour::kGrey));
+    if (werr != 0) {
+      error_line("cannot write matte \"%s\": %s", mpath.c_str(), strerror(werr));
+      return false;
+    }
+    printf("wrote %s\n", mpath.c_str());
+  }
+  fflush(stdout);
+  return true;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
   Settings st;
   int rc = parse_arguments(argc, argv, &st);
-  if (rc == 2) return 0;
-  if (rc == 3) return 2;
-  if (rc != 0 || !parse_render_options(&st)) return 1;
+  if (rc >= 0) return rc;
+  if (!parse_render_options(&st)) return 1;
 
   Scene scene;
   std::string err;
-  if (!scene_load(st.scene, &scene, &err)) {
+  if (!scene_load(st.args.scene, &scene, &err)) {
     error_line("%s", err.c_str());
     return 1;
   }
-  int width = st.width ? st.width : scene.width;
-  int height = st.height ? st.height : scene.height;
-
-  // The command line's range wins; without one the scene's own animation
-  // settings decide, so the program is also usable by hand.
-  bool animated = st.have_start || scene.animation;
-  std::vector<float> frames;
-  std::vector<int> extensions;
-  int ext_size = st.have_ext_size ? st.ext_size : scene.extensionsize;
-  if (st.have_start) {
-    frames = frame_list(st.start, st.have_end ? st.end : st.start, st.have_by ? st.by : 1.0f);
-    for (size_t i = 0; i < frames.size(); i++)
-      extensions.push_back(st.have_first_ext ? st.first_ext + static_cast<int>(i) * st.ext_step
-                                             : static_cast<int>(frames[i]));
-  } else if (scene.animation) {
-    frames = frame_list(scene.startframe, scene.endframe, scene.byframe);
-    for (size_t i = 0; i < frames.size(); i++)
-      extensions.push_back(scene.has_start_extension
-                               ? scene.start_extension + static_cast<int>(i) * scene.by_extension
-                               : static_cast<int>(frames[i]));
-  } else {
-    frames = {scene.startframe};
-  }
-  if (ext_size < 0 || ext_size > 32) ext_size = 1;
-
-  // Field rendering: the second field of each frame is half a frame step
-  // later than the first, so fast motion combs the way video does.
-  bool interlaced = scene.fields && (scene.odd || scene.even);
-  float step = st.have_by ? st.by : scene.byframe;
-  int first_field_parity = scene.odd ? 0 : 1;  // row 0 is the first (odd) line
-
-  printf("frame_painter: scene \"%s\", %zu frame%s, %dx%d\n", st.scene.c_str(), frames.size(),
-         frames.size() == 1 ? "" : "s", width, height);
+  Plan plan = make_plan(st, scene);
+  printf("frame_painter: scene \"%s\", %zu frame%s, %dx%d\n", st.args.scene.c_str(),
+         plan.frames.size(), plan.frames.size() == 1 ? "" : "s", plan.width, plan.height);
   fflush(stdout);
 
   bool fail_first = !st.fail_once.empty() && !st.have_fail_at && !st.have_die_at;
-  std::vector<uint8_t> rgb(static_cast<size_t>(width) * height * 3);
-  std::vector<uint8_t> matte(st.matte.empty() ? 0 : static_cast<size_t>(width) * height);
+  Canvas canvas;
+  canvas.rgb.resize(static_cast<size_t>(plan.width) * plan.height * 3);
+  if (!st.args.matte.empty()) canvas.matte.resize(static_cast<size_t>(plan.width) * plan.height);
 
-  for (size_t i = 0; i < frames.size(); i++) {
-    float f = frames[i];
+  for (size_t i = 0; i < plan.frames.size(); i++) {
+    float f = plan.frames[i];
     if (st.have_die_at && same_frame(f, st.die_at) && failure_armed(st))
       die_by_signal(f, st.die_signal);
     if (((st.have_fail_at && same_frame(f, st.fail_at)) || (fail_first && i == 0)) &&
@@ -400,44 +381,7 @@ int main(int argc, char** argv) {
       frame_error_line("frame %g did not render (requested failure)", f);
       return 1;
     }
-
-    std::string image = animated ? with_extension(st.pix, extensions[i], ext_size) : st.pix;
-    size_t slash = image.rfind('/');
-    std::string image_name = slash == std::string::npos ? image : image.substr(slash + 1);
-    char stamp[32];
-    snprintf(stamp, sizeof stamp, "%g", f);
-
-    for (int y = 0; y < height; y++) {
-      float t = f;
-      if (interlaced && (y % 2) != first_field_parity) t += step / 2;
-      size_t row = static_cast<size_t>(y) * width;
-      paint_row(scene, width, height, y, t, stamp, &rgb[row * 3],
-                matte.empty() ? nullptr : &matte[row]);
-      // The reader takes the number, adds the line count when it is 0 or
-      // less, then subtracts 2; reporting lines done + 2 makes that exact.
-      fprintf(stderr, "%s r %d of %d\n", image_name.c_str(), y + 1 + 2, height);
-      fflush(stderr);
-      sleep_seconds(st.slow / height);
-    }
-
-    int werr = png_write_file(image, png_encode(rgb, static_cast<uint32_t>(width),
-                                                static_cast<uint32_t>(height), PngColour::kRgb));
-    if (werr != 0) {
-      error_line("cannot write image \"%s\": %s", image.c_str(), strerror(werr));
-      return 1;
-    }
-    printf("wrote %s\n", image.c_str());
-    if (!st.matte.empty()) {
-      std::string mpath = animated ? with_extension(st.matte, extensions[i], ext_size) : st.matte;
-      werr = png_write_file(mpath, png_encode(matte, static_cast<uint32_t>(width),
-                                              static_cast<uint32_t>(height), PngColour::kGrey));
-      if (werr != 0) {
-        error_line("cannot write matte \"%s\": %s", mpath.c_str(), strerror(werr));
-        return 1;
-      }
-      printf("wrote %s\n", mpath.c_str());
-    }
-    fflush(stdout);
+    if (!paint_frame(st, scene, plan, i, &canvas)) return 1;
   }
   return 0;
 }

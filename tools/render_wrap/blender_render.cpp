@@ -77,21 +77,9 @@ bool samples_of(const std::string& line, int* done, int* total) {
          *total > 0;
 }
 
-}  // namespace
-
-int main(int argc, char** argv) {
-  RwArgs args;
-  RwParse parsed = Rw_parse(argc, argv, kUsage, &args);
-  if (parsed != RwParse::kOk) return Rw_parse_exit(parsed);
-
-  std::vector<RwFrame> frames = Rw_frames(args);
-  for (const RwFrame& f : frames) {
-    if (args.animate && f.frame != std::floor(f.frame)) {
-      Rw_error("blender_render: Blender renders whole frames only, not frame %g", f.frame);
-      return 1;
-    }
-  }
-
+// Blender's command line: one run for all the task's frames, each saved to
+// a hidden name that the run's lines then map to the daemon's name.
+std::vector<std::string> blender_command(const RwArgs& args, const std::vector<RwFrame>& frames) {
   std::vector<std::string> cmd = {Rw_program("BLENDER", "blender"), "-b", args.scene,
                                   "--python-expr", kDenoiseOff};
   if (args.processors > 0) {
@@ -111,60 +99,92 @@ int main(int argc, char** argv) {
   } else {
     cmd.insert(cmd.end(), {"-f", "+0"});
   }
+  return cmd;
+}
+
+// Follows one Blender run's lines: progress, saved images, failures.
+struct BlenderRun {
+  const RwArgs& args;
+  const std::vector<RwFrame>& frames;
+  size_t saved = 0;
+  int current = 0;  // Blender's frame number of the lines now coming
+  int last_total = 1;
+  bool failed = false;
+
+  const RwFrame* image_of(int blender_frame) const {
+    if (!args.animate) return &frames.front();
+    for (const RwFrame& f : frames)
+      if (static_cast<int>(f.frame) == blender_frame) return &f;
+    return nullptr;
+  }
+
+  void status_line(const std::string& line) {
+    current = atoi(line.c_str() + 4);
+    int done = 0, total = 0;
+    const RwFrame* f = image_of(current);
+    if (f != nullptr && samples_of(line, &done, &total)) {
+      Rw_progress(f->image, done, total);
+      last_total = total;
+    }
+    // Blender's own failures come inside its status lines too.
+    if (line.find("| Error") != std::string::npos ||
+        line.find("OpenImageDenoiser") != std::string::npos)
+      Rw_note("%s", line.c_str());
+  }
+
+  void saved_line(const std::string& line) {
+    std::string path = line.substr(8, line.rfind('\'') - 8);
+    const RwFrame* f = image_of(current);
+    std::string why;
+    if (f == nullptr) {
+      Rw_error("blender_render: Blender saved frame %d, which is not one of this task's", current);
+      failed = true;
+    } else if (!Rw_move(path, f->image, &why)) {
+      Rw_error("blender_render: cannot write image \"%s\": %s", f->image.c_str(), why.c_str());
+      failed = true;
+    } else {
+      Rw_progress(f->image, last_total, last_total);
+      Rw_note("wrote %s", f->image.c_str());
+      saved++;
+    }
+  }
+
+  void line(const std::string& line) {
+    if (line.compare(0, 4, "Fra:") == 0) {
+      status_line(line);
+    } else if (line.compare(0, 8, "Saved: '") == 0 && line.size() > 9) {
+      saved_line(line);
+    } else {
+      Rw_note("%s", line.c_str());
+    }
+  }
+};
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  RwArgs args;
+  RwParse parsed = Rw_parse(argc, argv, kUsage, &args);
+  if (parsed != RwParse::kOk) return Rw_parse_exit(parsed);
+
+  std::vector<RwFrame> frames = Rw_frames(args);
+  for (const RwFrame& f : frames) {
+    if (args.animate && f.frame != std::floor(f.frame)) {
+      Rw_error("blender_render: Blender renders whole frames only, not frame %g", f.frame);
+      return 1;
+    }
+  }
+  std::vector<std::string> cmd = blender_command(args, frames);
 
   Rw_note("blender_render: denoising is turned off for this render");
   Rw_note("blender_render: %zu frame%s of \"%s\"", frames.size(), frames.size() == 1 ? "" : "s",
           args.scene.c_str());
 
-  size_t saved = 0;
-  int current = 0;  // Blender's frame number of the lines now coming
-  int last_total = 1;
-  bool failed = false;
-  auto image_of = [&](int blender_frame) -> const RwFrame* {
-    if (!args.animate) return &frames.front();
-    for (const RwFrame& f : frames)
-      if (static_cast<int>(f.frame) == blender_frame) return &f;
-    return nullptr;
-  };
-  int status = Rw_run(cmd, [&](const std::string& line) {
-    if (line.compare(0, 4, "Fra:") == 0) {
-      current = atoi(line.c_str() + 4);
-      int done = 0, total = 0;
-      const RwFrame* f = image_of(current);
-      if (f != nullptr && samples_of(line, &done, &total)) {
-        Rw_progress(f->image, done, total);
-        last_total = total;
-      }
-      // Blender's own failures come inside its status lines too.
-      if (line.find("| Error") != std::string::npos ||
-          line.find("OpenImageDenoiser") != std::string::npos)
-        Rw_note("%s", line.c_str());
-      return;
-    }
-    if (line.compare(0, 8, "Saved: '") == 0 && line.size() > 9) {
-      std::string path = line.substr(8, line.rfind('\'') - 8);
-      const RwFrame* f = image_of(current);
-      std::string why;
-      if (f == nullptr) {
-        Rw_error("blender_render: Blender saved frame %d, which is not one of this task's",
-                 current);
-        failed = true;
-      } else if (!Rw_move(path, f->image, &why)) {
-        Rw_error("blender_render: cannot write image \"%s\": %s", f->image.c_str(), why.c_str());
-        failed = true;
-      } else {
-        Rw_progress(f->image, last_total, last_total);
-        Rw_note("wrote %s", f->image.c_str());
-        saved++;
-      }
-      return;
-    }
-    Rw_note("%s", line.c_str());
-  });
-
-  if (status == 0 && !failed && saved == frames.size()) return 0;
+  BlenderRun run{args, frames};
+  int status = Rw_run(cmd, [&](const std::string& line) { run.line(line); });
+  if (status == 0 && !run.failed && run.saved == frames.size()) return 0;
   if (status != -1)
-    Rw_error("blender_render: Blender ended with status %d after %zu of %zu frames", status, saved,
-             frames.size());
+    Rw_error("blender_render: Blender ended with status %d after %zu of %zu frames", status,
+             run.saved, frames.size());
   return 1;
 }

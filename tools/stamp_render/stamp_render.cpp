@@ -23,9 +23,10 @@
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
-#include <sstream>
 #include <string>
 #include <vector>
+
+#include "tools/render_wrap/render_wrap.h"
 
 namespace {
 
@@ -48,116 +49,61 @@ constexpr const char* kUsage =
 constexpr int kLines = 4;
 
 struct Settings {
-  std::string pix, stamp;
-  float start = 1, end = 1, by = 1;
-  bool have_start = false, have_end = false;
-  bool have_first_ext = false;
-  int first_ext = 0, ext_step = 1, ext_size = 1;
+  RwArgs args;  // -m is accepted, no matte is made
+  std::string stamp;
   double sleep = 0;
   bool have_fail_at = false;
   float fail_at = 0;
 };
 
-bool to_float(const char* s, float* out) {
-  char* end = nullptr;
-  errno = 0;
-  float v = strtof(s, &end);
-  if (end == s || *end != '\0' || errno == ERANGE || !std::isfinite(v)) return false;
-  *out = v;
-  return true;
-}
-
-bool to_int(const char* s, int* out) {
-  char* end = nullptr;
-  errno = 0;
-  long v = strtol(s, &end, 10);
-  if (end == s || *end != '\0' || errno == ERANGE || v < -1000000000L || v > 1000000000L)
-    return false;
-  *out = static_cast<int>(v);
+// Returns false after a usage error on stderr.
+bool parse_render_options(Settings* st) {
+  for (const RwSetting& setting : Rw_settings(st->args.options)) {
+    const std::string& key = setting.key;
+    const std::string& value = setting.value;
+    float f = 0;
+    if (key == "sleep" && Rw_to_float(value.c_str(), &f) && f >= 0 && f <= 3600) {
+      st->sleep = f;
+    } else if (key == "stamp" && !value.empty()) {
+      st->stamp = value;
+    } else if (key == "fail_at" && Rw_to_float(value.c_str(), &st->fail_at)) {
+      st->have_fail_at = true;
+    } else if (key != "size" && key != "slow") {  // frame_painter's settings pass
+      fprintf(stderr, "stamp_render: bad render option \"%s\"\n", setting.word.c_str());
+      return false;
+    }
+  }
   return true;
 }
 
 // Returns 0 when parsed, 1 for a usage error (reported), 2 after -h.
 int parse_arguments(int argc, char** argv, Settings* st) {
-  std::vector<const char*> positional;
-  for (int i = 1; i < argc; i++) {
-    std::string opt = argv[i];
-    if (opt.size() < 2 || opt[0] != '-') {
-      positional.push_back(argv[i]);
-      continue;
-    }
-    if (opt == "-h") {
+  // The plainest rules of the render programs: no long options, "-t 2" is
+  // a bad option, -n0 and -b 0 pass.
+  RwScan scan = Rw_scan(argc, argv, Rw_first_rules(false), &st->args);
+  switch (scan.result) {
+    case RwScanResult::kOk:
+      break;
+    case RwScanResult::kHelp:
       fputs(kUsage, stdout);
       return 2;
-    }
-    if (opt == "-A" || opt == "-V") continue;
-    if (opt.compare(0, 2, "-n") == 0 && opt.size() > 2 &&
-        opt.find_first_not_of("0123456789", 2) == std::string::npos)
-      continue;
-    if (opt.size() != 2 || std::string("pmsebSBE").find(opt[1]) == std::string::npos ||
-        i + 1 >= argc) {
-      fprintf(stderr, "stamp_render: bad option \"%s\"\n", opt.c_str());
+    case RwScanResult::kUnknown:
+    case RwScanResult::kNoValue:
+      fprintf(stderr, "stamp_render: bad option \"%s\"\n", scan.word);
       return 1;
-    }
-    const char* v = argv[++i];
-    bool ok = true;
-    switch (opt[1]) {
-      case 'p':
-        st->pix = v;
-        break;
-      case 's':
-        ok = to_float(v, &st->start), st->have_start = true;
-        break;
-      case 'e':
-        ok = to_float(v, &st->end), st->have_end = true;
-        break;
-      case 'b':
-        ok = to_float(v, &st->by);
-        break;
-      case 'S':
-        ok = to_int(v, &st->first_ext), st->have_first_ext = true;
-        break;
-      case 'B':
-        ok = to_int(v, &st->ext_step);
-        break;
-      case 'E':
-        ok = to_int(v, &st->ext_size) && st->ext_size >= 0 && st->ext_size <= 32;
-        break;
-      default:  // -m: accepted, no matte is made
-        break;
-    }
-    if (!ok) {
-      fprintf(stderr, "stamp_render: bad value \"%s\" for %s\n", v, opt.c_str());
+    case RwScanResult::kBadValue:
+      fprintf(stderr, "stamp_render: bad value \"%s\" for %s\n", scan.value, scan.word);
       return 1;
-    }
-  }
-  if (positional.empty() || positional.size() > 2 || st->pix.empty()) {
-    fputs("stamp_render: need -p PIX and a scene (stamp_render -h for help)\n", stderr);
-    return 1;
+    case RwScanResult::kNoScene:
+    case RwScanResult::kTooMany:
+    case RwScanResult::kNoPix:
+      fputs("stamp_render: need -p PIX and a scene (stamp_render -h for help)\n", stderr);
+      return 1;
   }
   const char* env = getenv("STAMP_FILE");
   if (env != nullptr) st->stamp = env;
-  if (positional.size() == 2) {
-    std::istringstream in(positional.front());
-    std::string item;
-    while (in >> item) {
-      size_t eq = item.find('=');
-      std::string key = item.substr(0, eq);
-      std::string value = eq == std::string::npos ? "" : item.substr(eq + 1);
-      float f = 0;
-      if (key == "sleep" && to_float(value.c_str(), &f) && f >= 0 && f <= 3600) {
-        st->sleep = f;
-      } else if (key == "stamp" && !value.empty()) {
-        st->stamp = value;
-      } else if (key == "fail_at" && to_float(value.c_str(), &st->fail_at)) {
-        st->have_fail_at = true;
-      } else if (key != "size" && key != "slow") {  // frame_painter's settings pass
-        fprintf(stderr, "stamp_render: bad render option \"%s\"\n", item.c_str());
-        return 1;
-      }
-    }
-  }
-  if (!st->have_end) st->end = st->start;
+  if (!parse_render_options(st)) return 1;
+  if (!st->args.have_end) st->args.end = st->args.start;
   return 0;
 }
 
@@ -166,16 +112,7 @@ int parse_arguments(int argc, char** argv, Settings* st) {
 // thousandth of a step.
 std::vector<float> frame_list(float start, float end, float by) {
   if (end <= start || by <= 0.0f) return {start};
-  std::vector<float> frames;
-  float f = start;
-  while (f < end) {
-    frames.push_back(f);
-    float next = f + by;
-    if (next == f) break;
-    f = next;
-  }
-  if (f >= end && std::fabs(static_cast<double>(f) - end) <= 0.001 * by) frames.push_back(end);
-  return frames;
+  return Rw_frame_values(start, end, by);
 }
 
 long long now_ns() {
@@ -222,22 +159,23 @@ int main(int argc, char** argv) {
   char host[64];
   if (gethostname(host, sizeof host) != 0) snprintf(host, sizeof host, "unknown");
   host[sizeof host - 1] = '\0';
-  size_t slash = st.pix.rfind('/');
-  std::string base = slash == std::string::npos ? st.pix : st.pix.substr(slash + 1);
+  size_t slash = st.args.pix.rfind('/');
+  std::string base = slash == std::string::npos ? st.args.pix : st.args.pix.substr(slash + 1);
 
-  std::vector<float> frames = frame_list(st.start, st.end, st.by);
+  std::vector<float> frames = frame_list(st.args.start, st.args.end, st.args.by);
   for (size_t i = 0; i < frames.size(); i++) {
     float f = frames[i];
     if (st.have_fail_at && std::fabs(f - st.fail_at) <= 0.001f) {
       printf("Error: frame %g did not render (requested failure)\n", f);
       return 1;
     }
-    int ext =
-        st.have_first_ext ? st.first_ext + static_cast<int>(i) * st.ext_step : static_cast<int>(f);
+    int ext = st.args.have_first_ext ? st.args.first_ext + static_cast<int>(i) * st.args.ext_step
+                                     : static_cast<int>(f);
     long long began = now_ns();
     for (int line = 0; line < kLines; line++) {
       // The daemon subtracts 2 from the line number it reads.
-      fprintf(stderr, "%s.%0*d r %d of %d\n", base.c_str(), st.ext_size, ext, line + 1 + 2, kLines);
+      fprintf(stderr, "%s.%0*d r %d of %d\n", base.c_str(), st.args.ext_size, ext, line + 1 + 2,
+              kLines);
       fflush(stderr);
       sleep_seconds(st.sleep / kLines);
     }
