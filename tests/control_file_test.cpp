@@ -155,27 +155,6 @@ INSTANTIATE_TEST_SUITE_P(Texts, RealTextTest,
                                          "1.2.3", "1-2.5", "-.",
                                          "99999999999999999999999999999999999999999.0"));
 
-// Frames are written as "%f" of the float widened to double, whatever the
-// value.
-class FramesTextTest : public ControlFileTest, public testing::WithParamInterface<float> {};
-
-TEST_P(FramesTextTest, PrintAsPercentF) {
-  Job* job = Add_a_job(nullptr, "f.sdl", 4);
-  ASSERT_NE(job, nullptr);
-  job->animate = 1;
-  const double f = GetParam();
-  job->frames[0] = GetParam();
-  job->frames[1] = 2.0f;
-  job->frames[2] = -GetParam();
-  char expected[512];
-  snprintf(expected, sizeof expected, "\tframes\t\t= %f, %f, %f;\n", f, 2.0, -f);
-  EXPECT_THAT(written_jobs(), HasSubstr(expected));
-}
-
-INSTANTIATE_TEST_SUITE_P(Values, FramesTextTest,
-                         testing::Values(0.0f, 250.0f, 0.5f, 1e9f, 999999999.0f, 16777216.0f,
-                                         2147483648.0f, 3.4e38f, 1e-7f, 0.1f));
-
 TEST_F(ControlFileTest, ReaderStartsAfreshOnEachStream) {
   survive_errors();
   // Abandoned inside a job block, in the middle of a string.
@@ -256,42 +235,6 @@ TEST_F(ControlFileTest, LexicalErrorExitsWithMinusOne) {
       testing::ExitedWithCode(255),
       "LEX: UNKNOWN TOKEN in line 7 of \"Render_Job_Control\" file \\(@\\)");
   RJCreadfile = nullptr;
-}
-
-// What the file shows: valid names keep their bytes, the rest is quoted.
-struct Shown {
-  const char* text;
-  const char* line;
-};
-
-class WrittenFormTest : public ControlFileTest, public testing::WithParamInterface<Shown> {};
-
-TEST_P(WrittenFormTest, HostNameLine) {
-  Dev* dev = Add_a_dev(nullptr, "box", 1);
-  ASSERT_NE(dev, nullptr);
-  dev->host_name.set(GetParam().text);
-  EXPECT_THAT(written_devs(), HasSubstr(GetParam().line));
-}
-
-// clang-format off
-INSTANTIATE_TEST_SUITE_P(Names, WrittenFormTest, testing::Values(
-    Shown{"hostA", "\thost_name\t\t= hostA;\n"},
-    Shown{"12abc", "= 12abc;"}, Shown{".5", "= .5;"}, Shown{"a-b#c@d", "= a-b#c@d;"},
-    Shown{"runs", "= runs;"},  // a keyword of the other file only
-    Shown{"10.1.2.3", "= \"10.1.2.3\";"}, Shown{"42", "= \"42\";"},
-    Shown{"-x", "= \"-x\";"}, Shown{"render farm", "= \"render farm\";"},
-    Shown{"status", "= \"status\";"}, Shown{"End", "= \"End\";"}, Shown{"", "= \"\";"},
-    Shown{"a\"b", "= ab;"}, Shown{"sta\"tus", "= \"status\";"}));
-// clang-format on
-
-TEST_F(ControlFileTest, CommentsBreakTheirClosingMark) {
-  Job* job = Add_a_job(nullptr, "c.sdl", 3);
-  Dev* dev = Add_a_dev(nullptr, "box", 1);
-  ASSERT_TRUE(job && dev);
-  job->comment.set("a*/b**/");
-  dev->comment.set("*/");
-  EXPECT_THAT(written_jobs(), HasSubstr("\t/*a* /b** /*/\n"));
-  EXPECT_THAT(written_devs(), HasSubstr("/* * / */\n"));
 }
 
 // The check interval: what the loop cannot wait for is refused, reported

@@ -67,10 +67,8 @@ TEST_P(FrameCount, CountsFramesLandingOnTheEnd) {
 
 // 0.1 accumulates past 2.0 by rounding, and still counts within tolerance.
 INSTANTIATE_TEST_SUITE_P(Ranges, FrameCount,
-                         testing::Values(FrameRange{1, 10, 1, 10}, FrameRange{1, 10, 3, 4},
-                                         FrameRange{10, 1, 1, 1}, FrameRange{5, 5, 1, 1},
-                                         FrameRange{1, 10, 0, 1}, FrameRange{0, 1, 0.25f, 5},
-                                         FrameRange{1, 2, 0.1f, 11}, FrameRange{1, 10, 20, 1}));
+                         testing::Values(FrameRange{1, 10, 3, 4}, FrameRange{10, 1, 1, 1},
+                                         FrameRange{1, 10, 0, 1}, FrameRange{1, 2, 0.1f, 11}));
 
 TEST_F(JobCheckTest, FieldSettingsFromTheScene) {
   Job* job = scene_job("fields = TRUE;\nodd = TRUE;\neven = FALSE;\n");
@@ -215,10 +213,8 @@ TEST_P(JobDifference, IsReportedWithItsMessage) {
 INSTANTIATE_TEST_SUITE_P(Fields, JobDifference, testing::Values(
     JobChange{"name", [](Job* j, Dev*) { j->name.reset(); }, "\"shot\" is differnt from \"noname\"\n"},
     JobChange{"frame", [](Job* j, Dev*) { j->frames[2] = 1e-9f; }, "\"shot\" is differnt from \"shot\"\n"},
-    JobChange{"user", [](Job* j, Dev*) { j->user.set("bob"); }, "\"shot\" is differnt from \"shot\"\n"},
     JobChange{"run_slot", [](Job* j, Dev*) { j->runs[335] = 1; }, "\"shot\" is differnt from \"shot\"\n"},
     JobChange{"path", [](Job* j, Dev*) { j->searchpath->path.set("/other"); }, "\"shot\" pathlist is differnt from \"shot\"\n"},
-    JobChange{"extra_path", [](Job* j, Dev*) { RndPathList_add(j, "/more"); }, "\"shot\" pathlist is differnt from \"shot\"\n"},
     JobChange{"resource", [](Job* j, Dev* d) { RndDevList_add(j, d); }, "\"shot\" devlist is differnt from \"shot\"\n"}),
     [](const testing::TestParamInfo<JobChange>& info) { return std::string(info.param.what); });
 // clang-format on

@@ -27,11 +27,8 @@ struct BucketCase {
 
 TEST(MaBuckets, RequestsGoToTheFirstBucketThatHoldsThemRoundedToEight) {
   const BucketCase cases[] = {
-      {0, 0},          {1, 0},          {8, 0},          {9, 1},         {72, 7},
-      {73, 8},         {449, 10},       {456, 10},       {457, 11},      {1024, 13},
-      {1025, 14},      {8193, 16},      {8200, 16},      {8201, 17},     {262193, 24},
-      {262201, 25},    {16777320, 32},  {16777321, 33},  {22369624, 33}, {22369625, 34},
-      {268435456, 45}, {268435460, 45}, {268435461, -1}, {SIZE_MAX, -1},
+      {0, 0},       {8, 0},          {9, 1},          {1024, 13},     {1025, 14},
+      {262201, 25}, {268435460, 45}, {268435461, -1}, {SIZE_MAX, -1},
   };
   for (const BucketCase& c : cases) {
     EXPECT_EQ(MA_bucket_of(c.request), c.bucket) << c.request;

@@ -134,8 +134,6 @@ INSTANTIATE_TEST_SUITE_P(Ranges, RendererNaming, testing::Values(
     NamingCase{{"-V", "-n4", "-A", "-s", "1.000000", "-e", "3.000000", "-b", "1.000000", "-E", "4", "sdl/scene.sdl"}, {"ball.0001", "ball.0002", "ball.0003"}},
     NamingCase{{"-s", "1", "-e", "3", "-b", "1", "-S", "10", "-B", "5", "-E", "3", "sdl/scene.sdl"}, {"ball.010", "ball.015", "ball.020"}},
     NamingCase{{"-s", "1", "-e", "2", "-b", "0.5", "-S", "1", "-B", "1", "-E", "1", "sdl/scene.sdl"}, {"ball.1", "ball.2", "ball.3"}},
-    NamingCase{{"-s", "1", "-e", "10", "-b", "3", "-E", "2", "sdl/scene.sdl"}, {"ball.01", "ball.04", "ball.07", "ball.10"}},
-    NamingCase{{"-s", "10", "-e", "1", "-b", "1", "-E", "1", "sdl/scene.sdl"}, {"ball.10"}},
     // No range: the scene's own.
     NamingCase{{"-E", "2", " ", "sdl/scene.sdl"}, {"ball.01", "ball.02", "ball.03", "ball.04", "ball.05", "ball.06", "ball.07", "ball.08", "ball.09", "ball.10"}},
     // A still scene writes the pix path itself.
@@ -158,9 +156,7 @@ TEST_P(RendererFrameCount, AgreesWithTheQueue) {
 
 INSTANTIATE_TEST_SUITE_P(Ranges, RendererFrameCount,
                          testing::Values(std::vector<float>{1, 10, 0.1f},
-                                         std::vector<float>{0, 1, 0.3f},
-                                         std::vector<float>{1.5f, 4.5f, 0.75f},
-                                         std::vector<float>{1, 100, 7}));
+                                         std::vector<float>{1.5f, 4.5f, 0.75f}));
 
 TEST_F(RendererTest, ProgressLinesGiveTheDaemonTheLinesDone) {
   Outcome r = render(ball("3", "2", "size=8x5"));

@@ -1,6 +1,6 @@
-#include "Utility/rndctl/base/rj_text.h"
-
 #include <gtest/gtest.h>
+
+#include "Utility/rndctl/base/rj_text.h"
 
 TEST(Text, HoldsACopyOrNoneAndReplacesOnSet) {
   char source[] = "alpha";

@@ -26,10 +26,9 @@ TEST(Contention, EightHostsRenderEveryFrameOfOneJobExactlyOnce) {
   job.end = kFrames;
   job.opts = "sleep=0.05 stamp=" + stamps;
   job.hosts = names;
-  std::string text = job_file({job}, scene);
-  text.replace(text.find("= frame_painter;"), 16, "= stamp_render;");
+  job.executable = "stamp_render";
   farm.write("Render_Resource_Control", resource_file(resources));
-  farm.write("Render_Job_Control", text);
+  farm.write("Render_Job_Control", job_file({job}, scene));
 
   for (const auto& h : names) ASSERT_TRUE(hosts.start(h)) << h;
   bool finished = hosts.wait_until([&] { return job_status(farm, "race") == "finished"; }, 150);

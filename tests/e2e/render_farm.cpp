@@ -68,10 +68,10 @@ std::string make_project(Farm& farm) {
 }
 
 std::vector<std::string> render_env() {
-  std::string bin = FRAME_PAINTER_PATH;
-  bin = bin.substr(0, bin.rfind('/'));
+  std::string painter = FRAME_PAINTER_PATH, stamper = STAMP_RENDER_PATH;
   const char* path = getenv("PATH");
-  return {"PATH=" + bin + ":" + (path != nullptr ? path : "/usr/bin:/bin")};
+  return {"PATH=" + painter.substr(0, painter.rfind('/')) + ":" +
+          stamper.substr(0, stamper.rfind('/')) + ":" + (path != nullptr ? path : "/usr/bin:/bin")};
 }
 
 std::string job_block(Farm& farm, const std::string& job) {
@@ -90,10 +90,16 @@ std::string job_status(Farm& farm, const std::string& job) {
   return block.substr(at, block.find('"', at) - at);
 }
 
+bool take_lock(Farm& farm, const std::string& file, double seconds) {
+  std::string lock = farm.path(file + ".lock");
+  return wait_for([&] { return mkdir(lock.c_str(), 0777) == 0; }, seconds);
+}
+
+void drop_lock(Farm& farm, const std::string& file) { rmdir(farm.path(file + ".lock").c_str()); }
+
 bool edit_job_file(Farm& farm, const std::string& from, const std::string& to,
                    const std::string& host) {
-  std::string lock = farm.path("Render_Job_Control.lock");
-  while (mkdir(lock.c_str(), 0777) != 0) std::this_thread::sleep_for(std::chrono::milliseconds(5));
+  if (!take_lock(farm, "Render_Job_Control")) return false;
   std::string text = farm.read("Render_Job_Control");
   size_t at = text.find(from);
   bool found = at != std::string::npos;
@@ -101,7 +107,7 @@ bool edit_job_file(Farm& farm, const std::string& from, const std::string& to,
     text.replace(at, from.size(), to);
     farm.write("Render_Job_Control", text);
   }
-  rmdir(lock.c_str());
+  drop_lock(farm, "Render_Job_Control");
   std::string pid_file = farm.path(host + ".pid");
   utimensat(AT_FDCWD, pid_file.c_str(), nullptr, 0);
   return found;

@@ -37,7 +37,7 @@ std::string job_file(const std::vector<JobSpec>& jobs, const std::string& scene)
 /// inside the farm; returns the scene's path.
 std::string make_project(Farm& farm);
 
-/// Environment for daemons that run the demo render program.
+/// Environment for daemons that run the demo or the stamping render program.
 std::vector<std::string> render_env();
 
 /// The state text of a job in the job file ("" when absent).
@@ -45,8 +45,15 @@ std::string job_status(Farm& farm, const std::string& job);
 /// The job block of a job in the job file ("" when absent).
 std::string job_block(Farm& farm, const std::string& job);
 
+/// Takes the lock directory of `file` as an editor does; false when it was
+/// not free within `seconds` (a lock nobody releases is a finding, not a
+/// reason to hang).
+[[nodiscard]] bool take_lock(Farm& farm, const std::string& file, double seconds = 60);
+void drop_lock(Farm& farm, const std::string& file);
+
 /// Rewrites the job file as an editor does: under its lock, replacing `from`
-/// by `to` in the text, then touches the pid file of `host`.
+/// by `to` in the text, then touches the pid file of `host`; false when
+/// `from` is not there or the lock never came free.
 bool edit_job_file(Farm& farm, const std::string& from, const std::string& to,
                    const std::string& host);
 

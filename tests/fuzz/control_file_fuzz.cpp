@@ -34,35 +34,18 @@ bool failed = false;
 
 void note_failure(int) { failed = true; }
 
-void clear_lists() {
-  while (rndctl.jobs != nullptr) Job_del(rndctl.jobs);
-  while (rndctl.devs != nullptr) Dev_del(rndctl.devs);
-}
-
 bool parse(const std::string& text, const char* file) {
   failed = false;
   int result = RJC_parse_string(text.data(), text.size(), file);
   return result == 0 && !failed;
 }
 
-std::string written(void (*writer)(FILE*)) {
-  char* buf = nullptr;
-  size_t size = 0;
-  FILE* fp = open_memstream(&buf, &size);
-  if (fp == nullptr) abort();
-  writer(fp);
-  fclose(fp);
-  std::string text(buf, size);
-  free(buf);
-  return text;
-}
-
 // Reads both texts into empty lists and writes them again.
 bool reread(std::string& devs, std::string& jobs) {
-  clear_lists();
+  text_records::delete_lists();
   if (!parse(devs, "Render_Resource_Control") || !parse(jobs, "Render_Job_Control")) return false;
-  devs = written(Resource_control_write_dev);
-  jobs = written(Job_control_write_dev);
+  devs = text_records::written(Resource_control_write_dev);
+  jobs = text_records::written(Job_control_write_dev);
   return true;
 }
 
@@ -84,7 +67,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   static bool ready = (setup(), true);
   (void)ready;
 
-  clear_lists();
+  text_records::delete_lists();
   std::vector<std::string> texts(1);
   for (size_t i = 0; i < size; ++i) {
     if (data[i] == '\0')
@@ -101,17 +84,17 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
 
   if (!parse(kResources, "Render_Resource_Control")) abort();
   if (!parse(std::string(reinterpret_cast<const char*>(data), size), "Render_Job_Control")) {
-    clear_lists();
+    text_records::delete_lists();
     return 0;
   }
 
-  std::string devs = written(Resource_control_write_dev);
-  std::string jobs = written(Job_control_write_dev);
+  std::string devs = text_records::written(Resource_control_write_dev);
+  std::string jobs = text_records::written(Job_control_write_dev);
   if (!reread(devs, jobs)) abort();  // the writer wrote what the reader refuses
   std::string devs_once = devs;
   std::string jobs_once = jobs;
   if (!reread(devs, jobs)) abort();
   if (devs != devs_once || jobs != jobs_once) abort();  // the rewrite did not settle
-  clear_lists();
+  text_records::delete_lists();
   return 0;
 }

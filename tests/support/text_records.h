@@ -15,12 +15,14 @@
 
 namespace text_records {
 
-inline std::string written(void (*writer)(FILE*)) {
+/// What `write(fp)` writes.
+template <class Write>
+std::string written(Write write) {
   char* buf = nullptr;
   size_t size = 0;
   FILE* fp = open_memstream(&buf, &size);
   if (fp == nullptr) return "<open_memstream failed>";
-  writer(fp);
+  write(fp);
   fclose(fp);
   std::string text(buf, size);
   free(buf);
@@ -28,15 +30,7 @@ inline std::string written(void (*writer)(FILE*)) {
 }
 
 inline std::string written_tasks(TaskGroup* groups) {
-  char* buf = nullptr;
-  size_t size = 0;
-  FILE* fp = open_memstream(&buf, &size);
-  if (fp == nullptr) return "<open_memstream failed>";
-  Task_write(fp, groups);
-  fclose(fp);
-  std::string text(buf, size);
-  free(buf);
-  return text;
+  return written([groups](FILE* fp) { Task_write(fp, groups); });
 }
 
 inline void delete_lists() {
@@ -78,27 +72,20 @@ inline std::string check(const std::vector<std::string>& texts) {
   Job* nameless = Job_new(nullptr, nullptr, nullptr, 2);
   if (odd == nullptr || plain == nullptr || job == nullptr || nameless == nullptr)
     return "out of memory";
-  const std::string host = t(), location = t(), dev_comment = t();
-  odd->host_name.set(host.c_str());
-  odd->remote_location.set(location.c_str());
-  odd->comment.set(dev_comment.c_str());
-  const std::string name = t(), comment = t(), user = t(), status = t(), exe = t();
-  const std::string sdl = t(), pix = t(), matte = t(), opts = t(), path1 = t(), path2 = t();
-  job->name.set(name.c_str());
-  job->comment.set(comment.c_str());
-  job->user.set(user.c_str());
-  job->status.set(status.c_str());
-  job->executable.set(exe.c_str());
-  job->sdl.set(sdl.c_str());
-  job->pix.set(pix.c_str());
-  job->matte.set(matte.c_str());
-  job->rnd_opts.set(opts.c_str());
+  // Each text is kept for the forms below: the records may not give it back.
+  std::vector<std::string> held;
+  auto fill = [&](Text& field) { field.set((held.emplace_back(t())).c_str()); };
+  for (Text* f : {&odd->host_name, &odd->remote_location, &odd->comment, &job->name, &job->comment,
+                  &job->user, &job->status, &job->executable, &job->sdl, &job->pix, &job->matte,
+                  &job->rnd_opts})
+    fill(*f);
+  const std::string host = held[0], location = held[1], name = held[3], comment = held[4],
+                    user = held[5], exe = held[7];
   job->animate = 1;
-  job->frames[0] = 1.0f;
   job->frames[1] = 10.0f;
-  job->frames[2] = 1.0f;
-  RndPathList_add(job, path1.c_str());
-  RndPathList_add(job, path2.c_str());
+  job->frames[0] = job->frames[2] = 1.0f;
+  RndPathList_add(job, t().c_str());
+  RndPathList_add(job, t().c_str());
   RndDevList_add(job, odd);
   RndDevList_add(job, plain);
   RndDevList_add(nameless, plain);
@@ -158,19 +145,15 @@ inline std::string check(const std::vector<std::string>& texts) {
   FILE* fp = fmemopen(const_cast<char*>(tasks_text.data()), tasks_text.size(), "r");
   TaskGroup* read = fp != nullptr ? Task_read(fp) : nullptr;
   if (fp != nullptr) fclose(fp);
+  // The reader gives the groups in an order of its own: compared by index.
   int seen[2] = {0, 0};
+  TaskGroup* by_index[2] = {nullptr, nullptr};
   for (TaskGroup* g = read; g != nullptr; g = g->next) {
-    int count = 0;
-    for (TaskRec* r = g->tasks; r != nullptr; r = r->next) ++count;
-    if (g->job != nullptr && g->job->index >= 1 && g->job->index <= 2)
-      seen[g->job->index - 1] = count;
+    if (g->job == nullptr || g->job->index < 1 || g->job->index > 2) continue;
+    by_index[g->job->index - 1] = g;
+    for (TaskRec* r = g->tasks; r != nullptr; r = r->next) ++seen[g->job->index - 1];
   }
   if (seen[0] != 2 || seen[1] != 1) fail("task file groups misread:\n" + tasks_text);
-  // The reader gives the groups in an order of its own: written by index.
-  TaskGroup* by_index[2] = {nullptr, nullptr};
-  for (TaskGroup* g = read; g != nullptr; g = g->next)
-    if (g->job != nullptr && g->job->index >= 1 && g->job->index <= 2)
-      by_index[g->job->index - 1] = g;
   std::string again;
   for (TaskGroup* g : by_index) {
     if (g == nullptr) continue;
