@@ -2,10 +2,17 @@
 // anything is written, and how it draws.
 #if defined(RNDCTL_TOOL)
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
+#include <cstdio>
+#include <cstdlib>
+#include <functional>
+#include <nlohmann/json.hpp>
+#include <sstream>
 #include <string>
 #include <vector>
 
+#include "tests/support/test_support.h"
 #include "tools/rndctl/editor_side.h"
 #include "tools/rndctl/tables.h"
 
@@ -109,6 +116,77 @@ TEST(RndctlOutput, BarsAndCutsKeepTheirWidth) {
   EXPECT_EQ(Out_bar(2.0, 7), "[#####]");
   EXPECT_EQ(Out_fit("abcdef", 4), "abc~");
   EXPECT_EQ(Out_fit("abc", 4), "abc");
+}
+
+// The tables a user reads, on a farm of three hosts and three jobs: one part
+// rendered on a live host, one paused with names too long for their columns,
+// one finished on every host.  Regenerate with RNDCTL_GOLDEN_UPDATE=1.
+class RndctlTables : public ControlDirTest {
+ protected:
+  void SetUp() override {
+    ControlDirTest::SetUp();
+    golden_ = std::string(TESTS_DIR) + "/golden/rndctl/";
+    for (const char* f : {"Render_Resource_Control", "Render_Job_Control", "Render_Tasks"})
+      write_file(f, read_text_file(golden_ + f));
+    // render01's heartbeat is fresh: its daemon counts as up.
+    mkdir(path("TSKSTAT").c_str(), 0777);
+    write_file("TSKSTAT/render01", "");
+    std::string why;
+    ASSERT_TRUE(Ctl_load(&why)) << why;
+    ASSERT_TRUE(Ctl_read_tasks(&tasks_));
+  }
+  void expect_golden(const std::string& name, const std::string& got) {
+    if (getenv("RNDCTL_GOLDEN_UPDATE") != nullptr) write_text_file(golden_ + name, got);
+    EXPECT_EQ(got, read_text_file(golden_ + name)) << got;
+    std::istringstream lines(got);
+    for (std::string line; std::getline(lines, line);) EXPECT_LE(line.size(), 80u) << line;
+  }
+  static std::string printed(const std::function<void(FILE*)>& print) {
+    char* buf = nullptr;
+    size_t size = 0;
+    FILE* fp = open_memstream(&buf, &size);
+    print(fp);
+    fclose(fp);
+    std::string text(buf, size);
+    free(buf);
+    return text;
+  }
+  std::string golden_;
+  CtlTasks tasks_;
+};
+
+TEST_F(RndctlTables, JobAndHostTablesMatchTheirGoldenText) {
+  expect_golden("jobs.txt", printed([](FILE* fp) { Out_jobs_table(fp, false); }));
+  expect_golden("hosts.txt", printed([&](FILE* fp) { Out_hosts_table(fp, tasks_, false); }));
+  // Colour only when asked for, and then without shifting the columns.
+  std::string coloured = printed([](FILE* fp) { Out_jobs_table(fp, true); });
+  EXPECT_NE(coloured.find("\033[32mfinished  \033[0m"), std::string::npos) << coloured;
+}
+
+TEST_F(RndctlTables, JsonReadsBackWithEveryField) {
+  nlohmann::json jobs = nlohmann::json::parse(Out_jobs_json(&tasks_).dump(2));
+  ASSERT_EQ(jobs.size(), 3u);
+  EXPECT_EQ(jobs[0]["name"], "shot_010");
+  EXPECT_EQ(jobs[0]["state"], "45.00%");
+  EXPECT_EQ(jobs[0]["hosts"], nlohmann::json({"render02", "render01"}));
+  EXPECT_EQ(jobs[0]["frames"], nlohmann::json({1.0, 120.0, 1.0}));
+  EXPECT_EQ(jobs[0]["doneframes"], 54);
+  ASSERT_EQ(jobs[0]["tasks"].size(), 2u);
+  EXPECT_EQ(jobs[0]["tasks"][0]["status"], "RUNNING");
+  EXPECT_EQ(jobs[0]["tasks"][0]["host"], "render01");
+  EXPECT_EQ(jobs[1]["name"], "a_very_long_job_name_indeed");  // never cut
+  EXPECT_EQ(jobs[1]["run"], "PAUSED");
+  EXPECT_EQ(jobs[2]["hosts"].size(), 3u);
+
+  nlohmann::json hosts = nlohmann::json::parse(Out_hosts_json(tasks_).dump(2));
+  ASSERT_EQ(hosts.size(), 3u);
+  EXPECT_EQ(hosts[0]["alive"], true);
+  EXPECT_EQ(hosts[0]["renders"], "shot_010:1-4");
+  EXPECT_EQ(hosts[1]["host"], "render02.farm");
+  EXPECT_EQ(hosts[1]["lock"], "LOCKED");
+  EXPECT_EQ(hosts[1]["alive"], false);
+  EXPECT_EQ(hosts[2]["lock"], "SCHEDULE");
+  EXPECT_EQ(hosts[2]["locked_now"], true);  // its schedule covers the whole week
 }
 
 }  // namespace

@@ -1,9 +1,13 @@
 // The command-line tool against a real control directory and a real daemon.
 #if defined(RNDCTL_TOOL)
+#include <dirent.h>
+#include <signal.h>
 #include <sys/wait.h>
 
+#include <map>
 #include <nlohmann/json.hpp>
 
+#include "tests/e2e/farm_hosts.h"
 #include "tests/e2e/render_farm.h"
 
 namespace {
@@ -13,9 +17,12 @@ struct ToolRun {
   std::string out;
 };
 
-// Runs the tool with `args` on the farm; stderr joins stdout.
+// Runs the tool with `args` on the farm; stderr joins stdout.  Probes of
+// another host's daemon go through the farm's remote-shell shim.
 ToolRun rndctl(Farm& farm, const std::vector<std::string>& args) {
-  std::string cmd = std::string(RNDCTL_PATH) + " -l '" + farm.dir() + "'";
+  std::string rsh = farm.dir().substr(0, farm.dir().rfind('/')) + "/rsh_here";
+  std::string cmd =
+      "ZARNO_RSH='" + rsh + "' " + std::string(RNDCTL_PATH) + " -l '" + farm.dir() + "'";
   for (const auto& a : args) cmd += " '" + a + "'";
   cmd += " 2>&1";
   ToolRun r;
@@ -98,7 +105,9 @@ TEST_F(RndctlTest, RefusedInputLeavesBothFilesByteIdentical) {
 
 TEST_F(RndctlTest, PauseHoldsNewTasksAndResumeLetsThemRun) {
   Daemon& d = farm_.start_on_farm({}, "", render_env());
-  ASSERT_EQ(rndctl(farm_, submit("spin", "1-3")).status, 0);
+  // Four tasks of three frames for two processors: what was taken before
+  // the pause may finish, but not the whole job.
+  ASSERT_EQ(rndctl(farm_, submit("spin", "1-12")).status, 0);
   ASSERT_EQ(rndctl(farm_, {"pause", "spin"}).status, 0);
   EXPECT_NE(job_block(farm_, "spin").find("ctrl\t\t= PAUSED;"), std::string::npos);
   for (int i = 0; i < 5; i++) {
@@ -154,6 +163,163 @@ TEST_F(RndctlTest, TheWatchViewDrawsAndQuitsCleanlyInTmux) {
   ASSERT_TRUE(ended) << after;
   // The view's own screen is gone: only the shell's line is left.
   EXPECT_EQ(after.find("rndctl watch"), std::string::npos) << after;
+}
+
+// Several daemons under host names of their own, one processor each, and
+// one job of `frames` one-frame tasks for all of them rendered by the
+// stamping render program, `sleep` seconds a frame.
+class RndctlFarmTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    if (!can_name_hosts())
+      GTEST_SKIP() << "needs root or user namespaces: daemons run under other host names";
+    scene_ = make_project(farm_);
+    stamps_ = farm_.path("../stamps");
+  }
+  void make_farm(const std::vector<std::string>& names, int frames, double sleep) {
+    std::vector<ResourceSpec> resources;
+    for (size_t i = 0; i < names.size(); ++i)
+      resources.push_back({names[i], static_cast<int>(i) + 1, 1, 1, "AVAILABLE", ""});
+    JobSpec job;
+    job.end = static_cast<float>(frames);
+    job.opts = "sleep=" + std::to_string(sleep) + " stamp=" + stamps_;
+    job.hosts = names;
+    job.executable = "stamp_render";
+    farm_.write("Render_Resource_Control", resource_file(resources));
+    farm_.write("Render_Job_Control", job_file({job}, scene_));
+    for (const auto& h : names) ASSERT_TRUE(hosts_.start(h)) << h;
+  }
+  std::vector<Stamp> stamps() const { return read_stamps(stamps_); }
+  // Cuts `host`'s power at a moment its daemon holds no lock of the control
+  // directory: a dead host's lock holds everyone else up for minutes.
+  bool power_cut_between_locks(const std::string& host) {
+    for (int tries = 0; tries < 500; ++tries) {
+      hosts_.freeze(host);
+      bool holds = false;
+      DIR* d = opendir(farm_.dir().c_str());
+      while (const struct dirent* e = d != nullptr ? readdir(d) : nullptr) {
+        std::string n = e->d_name;
+        if (n.size() > 5 && n.compare(n.size() - 5, 5, ".lock") == 0 &&
+            access(farm_.path(n + "/" + host).c_str(), F_OK) == 0)
+          holds = true;
+      }
+      if (d != nullptr) closedir(d);
+      if (!holds) {
+        hosts_.power_cut(host);
+        return true;
+      }
+      hosts_.thaw(host);
+      usleep(20000);
+    }
+    return false;
+  }
+  bool finished(double seconds) {
+    return hosts_.wait_until([&] { return job_status(farm_, "spin") == "finished"; }, seconds);
+  }
+  // Task records of `host` still taken or running.
+  int active_on(const std::string& host) {
+    ToolRun r = rndctl(farm_, {"show", "spin", "--json"});
+    if (r.status != 0) return -1;
+    int n = 0;
+    nlohmann::json job = nlohmann::json::parse(r.out);
+    for (const auto& t : job["tasks"])
+      if (t["host"] == host && (t["status"] == "RUNNING" || t["status"] == "STARTED")) n++;
+    return n;
+  }
+
+  Farm farm_;
+  FarmHosts hosts_{farm_, nullptr};
+  std::string scene_, stamps_;
+};
+
+TEST_F(RndctlFarmTest, AHostLockStopsNewWorkOnThatHostAtOnce) {
+  make_farm({"lockA", "lockB"}, 30, 0.3);
+  ASSERT_TRUE(hosts_.wait_until(
+      [&] {
+        std::map<std::string, int> by_host;
+        for (const Stamp& s : stamps()) by_host[s.host]++;
+        return by_host["lockA"] > 0 && by_host["lockB"] > 0;
+      },
+      60));
+  ToolRun r = rndctl(farm_, {"host", "lock", "lockB"});
+  ASSERT_EQ(r.status, 0) << r.out;
+  long long locked_ns = wall_ns();
+  ASSERT_TRUE(finished(120)) << farm_.read("Render_Tasks");
+  // The render running at the lock may end, and a pass already past its
+  // reload may take one more; nothing after that.
+  int late = 0;
+  for (const Stamp& s : stamps())
+    if (s.host == "lockB" && s.start_ns > locked_ns) late++;
+  EXPECT_LE(late, 1);
+  ToolRun h = rndctl(farm_, {"hosts", "--json"});
+  ASSERT_EQ(h.status, 0) << h.out;
+  nlohmann::json hosts = nlohmann::json::parse(h.out);
+  EXPECT_EQ(hosts[1]["lock"], "LOCKED");
+  EXPECT_EQ(hosts[1]["locked_now"], true);
+}
+
+TEST_F(RndctlFarmTest, CheckPutsADeadHostsTasksBackForTheOthers) {
+  make_farm({"liveA", "deadB"}, 6, 2);
+  ASSERT_TRUE(hosts_.wait_until([&] { return active_on("deadB") > 0; }, 60));
+  ASSERT_TRUE(power_cut_between_locks("deadB"));
+  ToolRun h = rndctl(farm_, {"hosts", "--json"});
+  ASSERT_EQ(h.status, 0) << h.out;
+  nlohmann::json hosts = nlohmann::json::parse(h.out);
+  EXPECT_EQ(hosts[0]["alive"], true) << h.out;
+  ToolRun r = rndctl(farm_, {"check", "--json"});
+  ASSERT_EQ(r.status, 0) << r.out;
+  EXPECT_EQ(nlohmann::json::parse(r.out)["jobs_put_back"], 1) << r.out;
+  EXPECT_EQ(active_on("deadB"), 0) << farm_.read("Render_Tasks");
+  ASSERT_TRUE(finished(120)) << farm_.read("Render_Tasks");
+  std::map<int, int> rendered;
+  for (const Stamp& s : stamps()) rendered[static_cast<int>(s.frame)]++;
+  for (int f = 1; f <= 6; ++f) EXPECT_GE(rendered[f], 1) << "frame " << f;
+}
+
+TEST_F(RndctlFarmTest, AbortKillsTheRunningRender) {
+  make_farm({"abortA"}, 3, 120);
+  ASSERT_TRUE(hosts_.wait_until([&] { return !hosts_.renders_left().empty(); }, 60));
+  // The render's output stream stays on its host: the tool says where.
+  int id = -1;
+  ToolRun show = rndctl(farm_, {"show", "spin", "--json"});
+  ASSERT_EQ(show.status, 0) << show.out;
+  nlohmann::json job = nlohmann::json::parse(show.out);
+  for (const auto& t : job["tasks"])
+    if (t["status"] == "RUNNING" || t["status"] == "STARTED") id = t["id"];
+  ToolRun log = rndctl(farm_, {"log", "spin", "--task", std::to_string(id)});
+  EXPECT_EQ(log.status, 0) << log.out;
+  EXPECT_NE(log.out.find("runs on abortA: its output stream is there, in abortA:"),
+            std::string::npos)
+      << log.out;
+  ToolRun r = rndctl(farm_, {"abort", "spin"});
+  ASSERT_EQ(r.status, 0) << r.out;
+  EXPECT_TRUE(hosts_.wait_until([&] { return hosts_.renders_left().empty(); }, 60))
+      << hosts_.daemon("abortA")->log();
+  EXPECT_EQ(job_status(farm_, "spin"), "aborted");
+  EXPECT_TRUE(stamps().empty());
+}
+
+// A restart in mid-render stops the running tasks first; afterwards each
+// frame is rendered once more, by either host, and only once.
+TEST_F(RndctlFarmTest, RestartRendersEveryFrameExactlyOnceOnTwoHosts) {
+  constexpr int kFrames = 12;
+  make_farm({"againA", "againB"}, kFrames, 0.5);
+  ASSERT_TRUE(hosts_.wait_until([&] { return stamps().size() >= 2; }, 60));
+  ToolRun r = rndctl(farm_, {"restart", "spin", "--timeout", "60"});
+  ASSERT_EQ(r.status, 0) << r.out;
+  long long restarted_ns = wall_ns();
+  ASSERT_TRUE(finished(120)) << farm_.read("Render_Tasks");
+  std::map<int, int> again;
+  std::map<std::string, int> by_host;
+  for (const Stamp& s : stamps()) {
+    if (s.start_ns < restarted_ns) continue;
+    again[static_cast<int>(s.frame)]++;
+    by_host[s.host]++;
+  }
+  for (int f = 1; f <= kFrames; ++f) EXPECT_EQ(again[f], 1) << "frame " << f;
+  EXPECT_EQ(again.size(), static_cast<size_t>(kFrames));
+  EXPECT_GT(by_host["againA"], 0);
+  EXPECT_GT(by_host["againB"], 0);
 }
 
 }  // namespace

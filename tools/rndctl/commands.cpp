@@ -1,8 +1,10 @@
 #include "tools/rndctl/commands.h"
 
+#include <dirent.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cstdio>
 #include <cstring>
@@ -70,104 +72,145 @@ std::string read_whole(const std::string& path) {
 
 }  // namespace
 
-int Cmd_submit(const SubmitOptions& o) {
-  std::string why;
-  // Everything the user typed is judged before anything is written.
+namespace {
+
+// What a submission asks for, judged before anything is written.
+struct SubmitPlan {
   CtlFrames frames;
-  bool have_frames = !o.frames.empty();
-  if (have_frames && !Ctl_parse_frames(o.frames, &frames, &why)) return fail(why);
+  bool have_frames = false;
   std::vector<CtlBlock> blocks;
+  std::string name;
+  std::vector<std::string> host_names;  // empty: every host
+};
+
+bool plan_submit(const SubmitOptions& o, SubmitPlan* plan, std::string* why) {
+  plan->have_frames = !o.frames.empty();
+  if (plan->have_frames && !Ctl_parse_frames(o.frames, &plan->frames, why)) return false;
   for (const auto& s : o.schedules) {
     CtlBlock b;
-    if (!Ctl_parse_block(s, &b, &why)) return fail(why);
-    blocks.push_back(b);
+    if (!Ctl_parse_block(s, &b, why)) return false;
+    plan->blocks.push_back(b);
   }
-  std::string name = o.name;
-  if (name.empty()) {
+  plan->name = o.name;
+  if (plan->name.empty()) {
     size_t slash = o.scene.rfind('/');
-    name = slash == std::string::npos ? o.scene : o.scene.substr(slash + 1);
+    plan->name = slash == std::string::npos ? o.scene : o.scene.substr(slash + 1);
   }
-  if (!Ctl_word_ok(name, &why)) return fail(why + "; give one with --name");
+  if (!Ctl_word_ok(plan->name, why)) {
+    *why += "; give one with --name";
+    return false;
+  }
   for (const std::string* s : {&o.scene, &o.pix, &o.matte, &o.opts})
-    if (!Ctl_string_ok(*s, &why)) return fail(why);
+    if (!Ctl_string_ok(*s, why)) return false;
   for (const auto& s : o.searchpaths)
-    if (!Ctl_string_ok(s, &why)) return fail(why);
-  if (!o.executable.empty() && !Ctl_word_ok(o.executable, &why)) return fail(why);
-  if (rndctl.user && !Ctl_word_ok(rndctl.user.c_str(), &why)) return fail("your user name: " + why);
+    if (!Ctl_string_ok(s, why)) return false;
+  if (!o.executable.empty() && !Ctl_word_ok(o.executable, why)) return false;
+  if (rndctl.user && !Ctl_word_ok(rndctl.user.c_str(), why)) {
+    *why = "your user name: " + *why;
+    return false;
+  }
   struct stat st;
-  if (stat(o.scene.c_str(), &st) != 0 || !S_ISREG(st.st_mode))
-    return fail("cannot read scene \"" + o.scene + "\"");
-  std::vector<std::string> host_names =
-      o.hosts == "all" ? std::vector<std::string>{} : Ctl_split(o.hosts, ',');
-  if (o.hosts != "all" && host_names.empty()) return fail("no hosts given");
+  if (stat(o.scene.c_str(), &st) != 0 || !S_ISREG(st.st_mode)) {
+    *why = "cannot read scene \"" + o.scene + "\"";
+    return false;
+  }
+  if (o.hosts != "all") {
+    plan->host_names = Ctl_split(o.hosts, ',');
+    if (plan->host_names.empty()) {
+      *why = "no hosts given";
+      return false;
+    }
+  }
+  return true;
+}
 
+// The resources the job may use, from the freshly loaded lists.
+bool submit_devs(const SubmitPlan& plan, std::vector<Dev*>* devs, std::string* why) {
+  for (const auto& h : plan.host_names) {
+    Dev* d = Dev_by_name(h.c_str());
+    if (d == nullptr) {
+      *why = "unknown host \"" + h + "\"";
+      return false;
+    }
+    devs->push_back(d);
+  }
+  if (devs->empty())
+    for (Dev* d = rndctl.devs; d != nullptr; d = d->next) devs->push_back(d);
+  if (devs->empty()) {
+    *why = "no hosts in the resource file";
+    return false;
+  }
+  return true;
+}
+
+void fill_job_fields(Job* job, const SubmitOptions& o, const SubmitPlan& plan) {
+  job->name.set(plan.name.c_str());
+  job->user.set(rndctl.user.c_str());
+  job->status.set("pending");
+  job->priority = o.priority;
+  if (!o.executable.empty()) job->executable.set(o.executable.c_str());
+  if (!o.pix.empty()) {
+    job->pix.set(o.pix.c_str());
+    job->use_sdl_paths = 0;
+  }
+  if (!o.matte.empty()) job->matte.set(o.matte.c_str());
+  if (!o.opts.empty()) job->rnd_opts.set(o.opts.c_str());
+  for (const auto& p : o.searchpaths) RndPathList_add(job, p.c_str());
+  job->del_when_done = o.delete_when_done ? 1 : 0;
+  job->save_out = o.keep_output ? 1 : 0;
+}
+
+// The frame range: the scene's unless given, never running backwards.
+bool fill_job_frames(Job* job, const SubmitPlan& plan, std::string* why) {
+  (void)Job_set_frame_range(job);
+  (void)Job_check_sdlfields(job);
+  if (plan.have_frames) {
+    job->animate = 1;
+    job->frames[0] = plan.frames.start;
+    job->frames[1] = plan.frames.end;
+    job->frames[2] = plan.frames.by;
+    job->totalframes = Calc_frame_range(plan.frames.start, plan.frames.end, plan.frames.by);
+  }
+  if (job->animate && job->frames[2] <= 0) job->frames[2] = 1;
+  if (job->animate && job->frames[1] < job->frames[0]) {
+    *why = "the scene's frame range runs backwards; give one with --frames";
+    return false;
+  }
+  job->doneframes = 0;
+  return true;
+}
+
+}  // namespace
+
+int Cmd_submit(const SubmitOptions& o) {
+  std::string why;
+  SubmitPlan plan;
+  if (!plan_submit(o, &plan, &why)) return fail(why);
   int index = 0;
-  std::string made;
   CtlEdit r = Ctl_edit_jobs(
       [&](std::string* why, std::vector<std::string>* wake) {
-        if (Job_by_name(name.c_str()) != nullptr) {
-          *why = "a job named \"" + name + "\" is already queued";
+        if (Job_by_name(plan.name.c_str()) != nullptr) {
+          *why = "a job named \"" + plan.name + "\" is already queued";
           return false;
         }
         std::vector<Dev*> devs;
-        for (const auto& h : host_names) {
-          Dev* d = Dev_by_name(h.c_str());
-          if (d == nullptr) {
-            *why = "unknown host \"" + h + "\"";
-            return false;
-          }
-          devs.push_back(d);
-        }
-        if (devs.empty())
-          for (Dev* d = rndctl.devs; d != nullptr; d = d->next) devs.push_back(d);
-        if (devs.empty()) {
-          *why = "no hosts in the resource file";
-          return false;
-        }
+        if (!submit_devs(plan, &devs, why)) return false;
         index = RJCget_next_index(FILE_JOB_INDEX);
         Job* job = Add_a_job(nullptr, o.scene.c_str(), index);
-        job->name.set(name.c_str());
-        job->user.set(rndctl.user.c_str());
-        job->status.set("pending");
-        job->priority = o.priority;
-        if (!o.executable.empty()) job->executable.set(o.executable.c_str());
-        if (!o.pix.empty()) {
-          job->pix.set(o.pix.c_str());
-          job->use_sdl_paths = 0;
-        }
-        if (!o.matte.empty()) job->matte.set(o.matte.c_str());
-        if (!o.opts.empty()) job->rnd_opts.set(o.opts.c_str());
-        for (const auto& p : o.searchpaths) RndPathList_add(job, p.c_str());
-        job->del_when_done = o.delete_when_done ? 1 : 0;
-        job->save_out = o.keep_output ? 1 : 0;
-        (void)Job_set_frame_range(job);
-        (void)Job_check_sdlfields(job);
-        if (have_frames) {
-          job->animate = 1;
-          job->frames[0] = frames.start;
-          job->frames[1] = frames.end;
-          job->frames[2] = frames.by;
-          job->totalframes = Calc_frame_range(frames.start, frames.end, frames.by);
-        }
-        if (job->animate && job->frames[2] <= 0) job->frames[2] = 1;
-        if (job->animate && job->frames[1] < job->frames[0]) {
-          *why = "the scene's frame range runs backwards; give one with --frames";
-          return false;
-        }
-        job->doneframes = 0;
-        job->ctrl = o.paused ? RUN_PAUSED : blocks.empty() ? RUN_AVAILABLE : RUN_SCHEDULE;
-        for (const auto& b : blocks)
+        fill_job_fields(job, o, plan);
+        if (!fill_job_frames(job, plan, why)) return false;
+        job->ctrl = o.paused ? RUN_PAUSED : plan.blocks.empty() ? RUN_AVAILABLE : RUN_SCHEDULE;
+        for (const auto& b : plan.blocks)
           Ctl_apply_block(b, [&](int s, int e, const char* f, const char* l) {
             Schedule_job_runs(job, s, e, f, l);
           });
         for (Dev* d : devs) RndDevList_add(job, d);
-        made = job->name.c_str();
         *wake = Ctl_job_hosts(job);
         return true;
       },
       &why);
   if (r != CTL_WRITTEN) return fail(why);
-  printf("%d %s\n", index, made.c_str());
+  printf("%d %s\n", index, plan.name.c_str());
   return 0;
 }
 
@@ -405,6 +448,66 @@ int Cmd_check(bool json) {
   return 0;
 }
 
+namespace {
+
+// The output streams of `job`'s tasks on `dev` that this machine holds,
+// newest first.  The daemon writes a render's messages to
+// "TMPDIR/JOB.RESOURCE.N" (N counts that daemon's tasks) and removes the file
+// when the task ends, so a name alone cannot tell two tasks of one job on
+// one host apart.
+std::vector<std::string> local_streams(const Job* job, const Dev* dev) {
+  std::vector<std::pair<struct timespec, std::string>> found;
+  std::string prefix = std::string(job->name.or_else("")) + "." + dev->name.or_else("") + ".";
+  const char* dir = rj_tmpdir();
+  DIR* d = opendir(dir);
+  if (d == nullptr) return {};
+  while (const struct dirent* e = readdir(d)) {
+    const char* n = e->d_name;
+    if (strncmp(n, prefix.c_str(), prefix.size()) != 0) continue;
+    const char* counter = n + prefix.size();
+    if (*counter == '\0' || strspn(counter, "0123456789") != strlen(counter)) continue;
+    std::string path = std::string(dir) + "/" + n;
+    struct stat st;
+    if (stat(path.c_str(), &st) == 0 && S_ISREG(st.st_mode)) found.push_back({st.st_mtim, path});
+  }
+  closedir(d);
+  std::sort(found.begin(), found.end(), [](const auto& a, const auto& b) {
+    if (a.first.tv_sec != b.first.tv_sec) return a.first.tv_sec > b.first.tv_sec;
+    return a.first.tv_nsec > b.first.tv_nsec;
+  });
+  std::vector<std::string> paths;
+  for (auto& f : found) paths.push_back(std::move(f.second));
+  return paths;
+}
+
+int show_stream(const Job* job, const TaskRec* r) {
+  const Dev* dev = r->dev;
+  if (dev == nullptr || (r->status != TASK_STARTED && r->status != TASK_RUNNING)) {
+    printf("task %d is not running: a task's output stream lasts only while it runs\n", r->id);
+    return 0;
+  }
+  if (!rj_dev_is_this_host(dev)) {
+    printf(
+        "task %d runs on %s: its output stream is there, in %s:TMPDIR/%s.%s.N "
+        "(TMPDIR: that daemon's DRCTMPDIR, else /usr/tmp or /var/tmp)\n",
+        r->id, dev->host_name.or_else(dev->name.or_else("?")), dev->host_name.or_else("?"),
+        job->name.or_else("?"), dev->name.or_else("?"));
+    return 0;
+  }
+  std::vector<std::string> paths = local_streams(job, dev);
+  if (paths.empty())
+    return fail("task " + std::to_string(r->id) + " has no output stream in " + rj_tmpdir() +
+                " yet");
+  for (const auto& path : paths) {
+    // Several tasks of the job may run here at once: then each is named.
+    if (paths.size() > 1) printf("== %s\n", path.c_str());
+    fputs(read_whole(path).c_str(), stdout);
+  }
+  return 0;
+}
+
+}  // namespace
+
 int Cmd_log(const std::string& key, int task) {
   std::string why;
   if (!load(&why)) return fail(why);
@@ -428,7 +531,8 @@ int Cmd_log(const std::string& key, int task) {
              static_cast<double>(r->end), GetTaskStatusStr(r->status),
              static_cast<double>(r->current), r->dev != nullptr ? r->dev->name.or_else("-") : "-");
       if (r->output) printf("%s\n", r->output.c_str());
-      return 0;
+      fflush(stdout);
+      return show_stream(job, r);
     }
   }
   return fail("job \"" + key + "\" has no task " + std::to_string(task));

@@ -12,6 +12,8 @@
 #include <ctime>
 #include <optional>
 
+#include "General/pst/pst.h"
+
 namespace {
 
 // The reader's fatal path ends the process; in the tool a file that does not
@@ -47,6 +49,11 @@ void free_lists() {
 // The whole of an open control-file stream.
 std::string slurp(FILE* fp) {
   std::string bytes;
+  // One allocation for the whole file: growing by doubling touches every
+  // page of a large job file several times.
+  struct stat st;
+  if (fileno(fp) >= 0 && fstat(fileno(fp), &st) == 0 && st.st_size > 0)
+    bytes.reserve(static_cast<size_t>(st.st_size));
   char buf[1 << 16];
   size_t n;
   while ((n = fread(buf, 1, sizeof buf, fp)) > 0) bytes.append(buf, n);
@@ -314,10 +321,22 @@ std::vector<std::string> Ctl_split(const std::string& text, char separator) {
   return parts;
 }
 
-void Ctl_open(const char* location) {
+bool Ctl_open(const char* location, std::string* why) {
+  if (location == nullptr) {
+    // Asked here first: the library ends the process when neither is set,
+    // and its lookup complains about a missing preferences file.
+    const char* prefs = find_variable_file(0, nullptr, nullptr);
+    if (prefs != nullptr && *prefs != '\0' && access(prefs, R_OK) == 0)
+      location = get_zarno_variable("ZARNO_RNDCTL_LOCATION");
+    if (location == nullptr) {
+      *why = "no control directory: give -l DIR or set ZARNO_RNDCTL_LOCATION in the preferences";
+      return false;
+    }
+  }
   RJC_fatal_exit = parse_fails;
   RJC_init_rndctl(location);
   fileop_poll_seconds = 1;
+  return true;
 }
 
 bool Ctl_load(std::string* why) {

@@ -51,8 +51,9 @@ void Ctl_apply_block(const CtlBlock& block,
 std::vector<std::string> Ctl_split(const std::string& text, char separator);
 
 /// Sets up the control block on `location` (null: the preference).  The
-/// parser's fatal path is turned into a plain failure.
-void Ctl_open(const char* location);
+/// parser's fatal path is turned into a plain failure.  False with `why`
+/// when there is no location and the preferences name none.
+[[nodiscard]] bool Ctl_open(const char* location, std::string* why);
 
 /// Reads both control files into the control block (resources first, each
 /// under its lock).  False with `why` when one could not be read.

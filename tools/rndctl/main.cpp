@@ -3,114 +3,149 @@
 #include <CLI/CLI.hpp>
 #include <cstdio>
 #include <string>
+#include <vector>
 
 #include "tools/rndctl/commands.h"
 #include "tools/rndctl/editor_side.h"
+
+namespace {
+
+// What the options fill; one set per run, since one subcommand runs.
+struct Parsed {
+  std::string location, job;
+  bool json = false, force = false;
+  int result = 0;
+  SubmitOptions submit;
+  HostOptions host;
+  std::vector<std::string> blocks;
+  double timeout = 120;
+  int task = -1;
+  int interval = 500;
+};
+
+void add_json(CLI::App* c, Parsed& p) { c->add_flag("--json", p.json, "print JSON"); }
+void add_force(CLI::App* c, Parsed& p) {
+  c->add_flag("--force", p.force, "change it even when an editor holds it");
+}
+void add_job_arg(CLI::App* c, Parsed& p) {
+  c->add_option("job", p.job, "job name or index")->required();
+}
+
+void add_submit(CLI::App& app, Parsed& p) {
+  SubmitOptions& so = p.submit;
+  auto* c = app.add_subcommand("submit", "queue a scene for rendering");
+  c->add_option("scene", so.scene, "scene file")->required();
+  c->add_option("--name", so.name, "job name (default: the scene's file name)");
+  c->add_option("--frames", so.frames, "frame range START-END[:BY] (default: the scene's)");
+  c->add_option("--hosts", so.hosts, "hosts H,H or all")->capture_default_str();
+  c->add_option("--priority", so.priority, "priority (0 runs beside others)");
+  c->add_option("--executable", so.executable, "render program");
+  c->add_option("--pix", so.pix, "image output path");
+  c->add_option("--matte", so.matte, "matte output path");
+  c->add_option("--opts", so.opts, "options for the render program");
+  c->add_option("--searchpath", so.searchpaths, "image search path (repeatable)");
+  c->add_flag("--paused", so.paused, "queue it paused");
+  c->add_flag("--delete-when-done", so.delete_when_done, "drop the job once finished");
+  c->add_flag("--keep-output", so.keep_output, "keep the render program's output");
+  c->add_option("--schedule", so.schedules, "run hours \"800-1700 Monday-Friday\" (repeatable)");
+  c->callback([&p] { p.result = Cmd_submit(p.submit); });
+}
+
+void add_job_commands(CLI::App& app, Parsed& p) {
+  auto* jobs = app.add_subcommand("jobs", "list the jobs");
+  add_json(jobs, p);
+  jobs->callback([&p] { p.result = Cmd_jobs(p.json); });
+
+  auto* show = app.add_subcommand("show", "one job in full, with its tasks and log");
+  add_job_arg(show, p);
+  add_json(show, p);
+  show->callback([&p] { p.result = Cmd_show(p.job, p.json); });
+
+  for (const char* what : {"pause", "resume", "abort", "delete"}) {
+    auto* c = app.add_subcommand(what, std::string(what) + " a job");
+    add_job_arg(c, p);
+    add_force(c, p);
+    c->callback([&p, what] { p.result = Cmd_job_change(what, p.job, p.force); });
+  }
+
+  auto* restart = app.add_subcommand("restart", "render a job again from its first frame");
+  add_job_arg(restart, p);
+  add_force(restart, p);
+  restart->add_option("--timeout", p.timeout, "seconds to wait for its running tasks to stop")
+      ->capture_default_str();
+  restart->callback([&p] { p.result = Cmd_restart(p.job, p.force, p.timeout); });
+
+  auto* log = app.add_subcommand("log", "a job's log, or one task's record and output");
+  add_job_arg(log, p);
+  log->add_option("--task", p.task, "task id");
+  log->callback([&p] { p.result = Cmd_log(p.job, p.task); });
+}
+
+void add_host_commands(CLI::App& app, Parsed& p) {
+  auto* hosts = app.add_subcommand("hosts", "list the render hosts");
+  add_json(hosts, p);
+  hosts->callback([&p] { p.result = Cmd_hosts(p.json); });
+
+  auto* host = app.add_subcommand("host", "change a render host");
+  host->require_subcommand(1);
+  for (const char* what : {"add", "set", "remove", "lock", "unlock"}) {
+    auto* c = host->add_subcommand(what, std::string(what) + " a host");
+    c->add_option("name", p.host.name, "resource name")->required();
+    if (std::string(what) == "add" || std::string(what) == "set") {
+      c->add_option("--host", p.host.host, "host name (default: the resource name)");
+      c->add_option("--processors", p.host.processors, "render processes at a time");
+      c->add_option("--frames", p.host.frames, "frames per task");
+    }
+    add_force(c, p);
+    c->callback([&p, what] { p.result = Cmd_host_change(what, p.host, p.force); });
+  }
+  auto* sched = host->add_subcommand("schedule", "set the hours a host is locked");
+  sched->add_option("name", p.host.name, "resource name")->required();
+  sched->add_option("blocks", p.blocks, "\"2200-600 Monday-Friday\" ... (none: never locked)");
+  add_force(sched, p);
+  sched->callback([&p] { p.result = Cmd_host_schedule(p.host.name, p.blocks, p.force); });
+}
+
+void add_farm_commands(CLI::App& app, Parsed& p) {
+  auto* check = app.add_subcommand("check", "put back dead hosts' tasks, drop dead editors' holds");
+  add_json(check, p);
+  check->callback([&p] { p.result = Cmd_check(p.json); });
+
+  auto* watch = app.add_subcommand("watch", "a live view of the queue (q quits)");
+  watch->add_option("--interval", p.interval, "milliseconds between looks at the files")
+      ->check(CLI::Range(50, 10000));
+  watch->callback([&p] { p.result = Cmd_watch(p.interval); });
+}
+
+}  // namespace
 
 int main(int argc, char** argv) {
   PrgName = "rndctl";
   CLI::App app{"rndctl: the render queue from a shell"};
   app.require_subcommand(1);
-  std::string location;
-  app.add_option("-l,--location", location,
+  Parsed p;
+  app.add_option("-l,--location", p.location,
                  "control directory (default: ZARNO_RNDCTL_LOCATION from the preferences)");
+  add_submit(app, p);
+  add_job_commands(app, p);
+  add_host_commands(app, p);
+  add_farm_commands(app, p);
 
-  bool json = false, force = false;
-  std::string job;
-  int result = 0;
-  auto add_json = [&](CLI::App* c) { c->add_flag("--json", json, "print JSON"); };
-
-  SubmitOptions so;
-  auto* submit = app.add_subcommand("submit", "queue a scene for rendering");
-  submit->add_option("scene", so.scene, "scene file")->required();
-  submit->add_option("--name", so.name, "job name (default: the scene's file name)");
-  submit->add_option("--frames", so.frames, "frame range START-END[:BY] (default: the scene's)");
-  submit->add_option("--hosts", so.hosts, "hosts H,H or all")->capture_default_str();
-  submit->add_option("--priority", so.priority, "priority (0 runs beside others)");
-  submit->add_option("--executable", so.executable, "render program");
-  submit->add_option("--pix", so.pix, "image output path");
-  submit->add_option("--matte", so.matte, "matte output path");
-  submit->add_option("--opts", so.opts, "options for the render program");
-  submit->add_option("--searchpath", so.searchpaths, "image search path (repeatable)");
-  submit->add_flag("--paused", so.paused, "queue it paused");
-  submit->add_flag("--delete-when-done", so.delete_when_done, "drop the job once finished");
-  submit->add_flag("--keep-output", so.keep_output, "keep the render program's output");
-  submit->add_option("--schedule", so.schedules,
-                     "run hours \"800-1700 Monday-Friday\" (repeatable)");
-  submit->callback([&] { result = Cmd_submit(so); });
-
-  auto* jobs = app.add_subcommand("jobs", "list the jobs");
-  add_json(jobs);
-  jobs->callback([&] { result = Cmd_jobs(json); });
-
-  auto* show = app.add_subcommand("show", "one job in full, with its tasks and log");
-  show->add_option("job", job, "job name or index")->required();
-  add_json(show);
-  show->callback([&] { result = Cmd_show(job, json); });
-
-  for (const char* what : {"pause", "resume", "abort", "delete"}) {
-    auto* c = app.add_subcommand(what, std::string(what) + " a job");
-    c->add_option("job", job, "job name or index")->required();
-    c->add_flag("--force", force, "change it even when an editor holds it");
-    c->callback([&, what] { result = Cmd_job_change(what, job, force); });
-  }
-
-  double timeout = 120;
-  auto* restart = app.add_subcommand("restart", "render a job again from its first frame");
-  restart->add_option("job", job, "job name or index")->required();
-  restart->add_flag("--force", force, "change it even when an editor holds it");
-  restart->add_option("--timeout", timeout, "seconds to wait for its running tasks to stop")
-      ->capture_default_str();
-  restart->callback([&] { result = Cmd_restart(job, force, timeout); });
-
-  auto* hosts = app.add_subcommand("hosts", "list the render hosts");
-  add_json(hosts);
-  hosts->callback([&] { result = Cmd_hosts(json); });
-
-  HostOptions ho;
-  auto* host = app.add_subcommand("host", "change a render host");
-  host->require_subcommand(1);
-  for (const char* what : {"add", "set", "remove", "lock", "unlock"}) {
-    auto* c = host->add_subcommand(what, std::string(what) + " a host");
-    c->add_option("name", ho.name, "resource name")->required();
-    if (std::string(what) == "add" || std::string(what) == "set") {
-      c->add_option("--host", ho.host, "host name (default: the resource name)");
-      c->add_option("--processors", ho.processors, "render processes at a time");
-      c->add_option("--frames", ho.frames, "frames per task");
-    }
-    c->add_flag("--force", force, "change it even when an editor holds it");
-    c->callback([&, what] { result = Cmd_host_change(what, ho, force); });
-  }
-  std::vector<std::string> blocks;
-  auto* sched = host->add_subcommand("schedule", "set the hours a host is locked");
-  sched->add_option("name", ho.name, "resource name")->required();
-  sched->add_option("blocks", blocks, "\"2200-600 Monday-Friday\" ... (none: never locked)");
-  sched->add_flag("--force", force, "change it even when an editor holds it");
-  sched->callback([&] { result = Cmd_host_schedule(ho.name, blocks, force); });
-
-  auto* check = app.add_subcommand("check", "put back dead hosts' tasks, drop dead editors' holds");
-  add_json(check);
-  check->callback([&] { result = Cmd_check(json); });
-
-  int task = -1;
-  auto* log = app.add_subcommand("log", "a job's log, or one task's record and output");
-  log->add_option("job", job, "job name or index")->required();
-  log->add_option("--task", task, "task id");
-  log->callback([&] { result = Cmd_log(job, task); });
-
-  int interval = 500;
-  auto* watch = app.add_subcommand("watch", "a live view of the queue (q quits)");
-  watch->add_option("--interval", interval, "milliseconds between looks at the files")
-      ->check(CLI::Range(50, 10000));
-  watch->callback([&] { result = Cmd_watch(interval); });
-
-  // The control block must be set up before any callback runs.
-  app.parse_complete_callback([&] { Ctl_open(location.empty() ? nullptr : location.c_str()); });
+  // The control block must be set up before any callback runs; without a
+  // directory the run ends here as a user error.
+  app.parse_complete_callback([&p] {
+    std::string why;
+    if (!Ctl_open(p.location.empty() ? nullptr : p.location.c_str(), &why))
+      throw CLI::RuntimeError("rndctl: " + why, 1);
+  });
   try {
     app.parse(argc, argv);
+  } catch (const CLI::RuntimeError& e) {
+    fprintf(stderr, "%s\n", e.what());
+    return e.get_exit_code();
   } catch (const CLI::ParseError& e) {
     int code = app.exit(e);
     return code == 0 ? 0 : 2;
   }
-  return result;
+  return p.result;
 }

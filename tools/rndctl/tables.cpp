@@ -168,7 +168,8 @@ nlohmann::json Out_hosts_json(const CtlTasks& tasks) {
 }
 
 void Out_jobs_table(FILE* fp, bool colour) {
-  fprintf(fp, "%5s %-14s %-8s %-10s %3s %11s %-14s %-9s\n", "INDEX", "NAME", "USER", "STATE", "PRI",
+  // 80 columns at most, and no blanks after the last one.
+  fprintf(fp, "%5s %-14s %-8s %-10s %3s %11s %-13s %s\n", "INDEX", "NAME", "USER", "STATE", "PRI",
           "FRAMES", "HOSTS", "RUN");
   for (const Job* j = rndctl.jobs; j != nullptr; j = j->next) {
     char frames[32];
@@ -177,22 +178,22 @@ void Out_jobs_table(FILE* fp, bool colour) {
     // Pad before colouring: escapes would count as columns.
     char padded[16];
     snprintf(padded, sizeof padded, "%-10s", state.c_str());
-    fprintf(fp, "%5d %-14s %-8s %s%s%s %3d %11s %-14s %-9s\n", j->index,
+    fprintf(fp, "%5d %-14s %-8s %s%s%s %3d %11s %-13s %s\n", j->index,
             Out_fit(j->name.or_else("-"), 14).c_str(), Out_fit(j->user.or_else("-"), 8).c_str(),
             colour ? state_colour(j) : "", padded, colour && *state_colour(j) ? "\033[0m" : "",
-            j->priority, frames, Out_fit(hosts_of(j), 14).c_str(), run_name(j->ctrl));
+            j->priority, frames, Out_fit(hosts_of(j), 13).c_str(), run_name(j->ctrl));
   }
 }
 
 void Out_hosts_table(FILE* fp, const CtlTasks& tasks, bool colour) {
-  fprintf(fp, "%-12s %-12s %-9s %-6s %-5s %4s %4s %-19s\n", "NAME", "HOST", "LOCK", "NOW", "DEMON",
+  fprintf(fp, "%-12s %-12s %-9s %-6s %-5s %4s %4s %s\n", "NAME", "HOST", "LOCK", "NOW", "DEMON",
           "PROC", "FRM", "RENDERS");
   for (const Dev* d = rndctl.devs; d != nullptr; d = d->next) {
     const char* host = d->host_name.or_else(d->name.or_else(""));
     bool alive = Ctl_daemon_alive(host);
     bool now = locked_now(d);
     std::string r = renders_on(tasks, d);
-    fprintf(fp, "%-12s %-12s %-9s %s%-6s%s %s%-5s%s %4d %4d %-19s\n",
+    fprintf(fp, "%-12s %-12s %-9s %s%-6s%s %s%-5s%s %4d %4d %s\n",
             Out_fit(d->name.or_else("-"), 12).c_str(), Out_fit(host, 12).c_str(),
             lock_name(d->status), colour && now ? "\033[31m" : "", now ? "locked" : "free",
             colour && now ? "\033[0m" : "", colour && !alive ? "\033[31m" : "",

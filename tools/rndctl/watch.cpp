@@ -12,8 +12,10 @@
 #include <termios.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdio>
 #include <cstring>
+#include <functional>
 #include <string>
 
 #include "tools/rndctl/commands.h"
@@ -78,47 +80,77 @@ Stamp stamp() {
   return s;
 }
 
-int columns() {
-  struct winsize ws;
-  if (ioctl(STDOUT_FILENO, TIOCGWINSZ, &ws) == 0 && ws.ws_col >= 40) return ws.ws_col;
-  return 80;
+struct winsize terminal_size() {
+  struct winsize ws {};
+  if (ioctl(STDOUT_FILENO, TIOCGWINSZ, &ws) != 0 || ws.ws_col < 40) ws.ws_col = 80;
+  if (ws.ws_row < 5) ws.ws_row = 24;
+  return ws;
 }
 
-void draw() {
-  std::string why;
-  int width = columns();
+// What the view shows: the lists of the last load and the task groups read
+// with them (which point into those lists, so they go first).
+struct View {
+  CtlTasks tasks;
+  std::string why;  // the load failed: this is shown instead
+  void load() {
+    TaskGroup_free_all(&tasks.groups);
+    why.clear();
+    if (!Ctl_load(&why)) return;
+    why.clear();
+    (void)Ctl_read_tasks(&tasks);
+  }
+};
+
+// The lines of one job: its bar, then one bar per task it renders.
+void job_lines(const Job* j, const CtlTasks& tasks, int bar,
+               const std::function<void(const std::string&)>& line) {
+  char head[128];
+  snprintf(head, sizeof head, "%5d %-14s %-10s %5d/%-5d ", j->index,
+           Out_fit(j->name.or_else("-"), 14).c_str(), Out_fit(j->status.or_else("-"), 10).c_str(),
+           j->doneframes, j->totalframes);
+  line(head + Out_bar(Out_job_fraction(j), bar));
+  for (const TaskGroup* g = tasks.groups; g != nullptr; g = g->next) {
+    if (g->job == nullptr || g->job->index != j->index) continue;
+    for (const TaskRec* r = g->tasks; r != nullptr; r = r->next) {
+      if (r->status != TASK_RUNNING && r->status != TASK_STARTED) continue;
+      double span = static_cast<double>(r->end - r->start) + 1;
+      double done = r->status == TASK_RUNNING ? static_cast<double>(r->current - r->start) : 0;
+      char task[128];
+      snprintf(task, sizeof task, "      task %-3d %6g-%-6g %-10s ", r->id,
+               static_cast<double>(r->start), static_cast<double>(r->end),
+               r->dev != nullptr ? Out_fit(r->dev->name.or_else("-"), 10).c_str() : "-");
+      line(task + Out_bar(span > 0 ? done / span : 0, bar));
+    }
+  }
+}
+
+// Draws the screen from what `view` holds; only as many lines as the
+// terminal has rows are built, however long the queue.
+void draw(const View& view) {
+  struct winsize ws = terminal_size();
+  int width = ws.ws_col;
+  int rows = ws.ws_row - 1;  // the last row stays free: a full one would scroll
   std::string out = "\033[H";
+  int used = 0;
   auto line = [&](const std::string& text) {
+    if (used++ >= rows) return;
     out += Out_fit(text, static_cast<size_t>(width)) + "\033[K\n";
   };
   line("rndctl watch  " + std::string(rndctl.location.or_else("")) + "   q: quit");
   line("");
-  if (!Ctl_load(&why)) {
-    line(why);
+  if (!view.why.empty()) {
+    line(view.why);
   } else {
-    CtlTasks tasks;
-    (void)Ctl_read_tasks(&tasks);
     int bar = std::max(10, width - 44);
+    int left = 0;
     for (const Job* j = rndctl.jobs; j != nullptr; j = j->next) {
-      char head[128];
-      snprintf(head, sizeof head, "%5d %-14s %-10s %5d/%-5d ", j->index,
-               Out_fit(j->name.or_else("-"), 14).c_str(),
-               Out_fit(j->status.or_else("-"), 10).c_str(), j->doneframes, j->totalframes);
-      line(head + Out_bar(Out_job_fraction(j), bar));
-      for (const TaskGroup* g = tasks.groups; g != nullptr; g = g->next) {
-        if (g->job == nullptr || g->job->index != j->index) continue;
-        for (const TaskRec* r = g->tasks; r != nullptr; r = r->next) {
-          if (r->status != TASK_RUNNING && r->status != TASK_STARTED) continue;
-          double span = static_cast<double>(r->end - r->start) + 1;
-          double done = r->status == TASK_RUNNING ? static_cast<double>(r->current - r->start) : 0;
-          char task[128];
-          snprintf(task, sizeof task, "      task %-3d %6g-%-6g %-10s ", r->id,
-                   static_cast<double>(r->start), static_cast<double>(r->end),
-                   r->dev != nullptr ? Out_fit(r->dev->name.or_else("-"), 10).c_str() : "-");
-          line(task + Out_bar(span > 0 ? done / span : 0, bar));
-        }
+      if (used >= rows - 1) {
+        left++;
+        continue;
       }
+      job_lines(j, view.tasks, bar, line);
     }
+    if (left > 0) line("  ... " + std::to_string(left) + " more job(s)");
     if (rndctl.jobs == nullptr) line("no jobs");
   }
   out += "\033[J";
@@ -143,14 +175,18 @@ int Cmd_watch(int interval_ms) {
   for (int i = 0; i < 3; i++) sigaction(sigs[i], &sa, &saved[i]);
   {
     TerminalGuard guard;
+    View view;
     Stamp seen;
     bool first = true;
     int idle_ms = 0;
     while (stop_signal == 0) {
+      // The files are read again only when they changed; the screen is also
+      // drawn again every few seconds from what was read (a resized window).
       Stamp now = stamp();
-      // A redraw also every few seconds, for "locked now" and the clock.
-      if (first || !(now == seen) || idle_ms >= 5000) {
-        draw();
+      bool changed = first || !(now == seen);
+      if (changed) view.load();
+      if (changed || idle_ms >= 5000) {
+        draw(view);
         seen = now;
         first = false;
         idle_ms = 0;
