@@ -30,6 +30,7 @@
 
 #include "Utility/rndctl/base/rj_control.h"
 #include "Utility/rndctl/base/rj_log.h"
+#include "Utility/rndctl/base/rj_scoped.h"
 #include "Utility/rndctl/base/rj_text.h"
 #include "Utility/rndctl/ctldir/rj_editreg.h"
 #include "Utility/rndctl/ctldir/rj_fileio.h"
@@ -38,6 +39,7 @@
 #include "Utility/rndctl/ctldir/rj_updatetime.h"
 #include "Utility/rndctl/ctlfile/rj_ctlfile.h"
 #include "Utility/rndctl/ctlfile/rj_reload.h"
+#include "Utility/rndctl/proc/rj_registry.h"
 #include "Utility/rndctl/proc/rj_signal.h"
 #include "Utility/rndctl/proc/rj_spawn.h"
 #include "Utility/rndctl/records/rj_dev.h"
@@ -48,6 +50,7 @@
 #include "Utility/rndctl/records/rj_records.h"
 #include "Utility/rndctl/records/rj_schedule.h"
 #include "Utility/rndctl/tasks/rj_joberr.h"
+#include "Utility/rndctl/tasks/rj_joblog.h"
 #include "Utility/rndctl/tasks/rj_perform.h"
 #include "Utility/rndctl/tasks/rj_reclaim.h"
 #include "Utility/rndctl/tasks/rj_select.h"

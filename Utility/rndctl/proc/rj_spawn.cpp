@@ -9,7 +9,9 @@
 #include <cstdlib>
 #include <cstring>
 
+#include "Utility/rndctl/base/rj_control.h"
 #include "Utility/rndctl/base/rj_log.h"
+#include "Utility/rndctl/proc/rj_signal.h"
 
 extern char** environ;
 
@@ -213,4 +215,16 @@ int RJ_spawn(const RjSpawn& spawn) {
   // well closes the window in which a kill of the group would find no group.
   setpgid(pid, pid);
   return pid;
+}
+
+int rj_kill_render(const char* host, int pid, int sig) {
+  if (pid < 2) return 0;
+  // Another host's render: RJ_signal says so in the trace and sends nothing.
+  if (host != nullptr && !rndctl.host.is(host)) return RJ_signal(host, pid, sig);
+  // The render program leads its own process group: whatever it started
+  // (a renderer behind a wrapper script, helpers) must go with it.
+  int result = kill(-pid, sig);
+  if (result != 0 && errno == ESRCH) result = kill(pid, sig);
+  dbgpnt("kill( %d, %d ) = %d(%d);\n", pid, sig, result, result != 0 ? errno : 0);
+  return result;
 }

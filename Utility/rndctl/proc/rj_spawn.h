@@ -56,3 +56,11 @@ struct RjSpawn {
 /// name is replaced where it stands, else the entry is added at the end.
 /// The process's own environment is left alone.
 std::vector<std::string> RJ_env_with(const char* name, const char* value);
+
+/// The one kill of a render: sends `sig` to the process group that the
+/// render program `pid` leads on this host (so its own children go too).
+/// For another host nothing is sent (RJ_signal traces it) and 0 is returned;
+/// a pid below 2 is no render and returns 0.  Otherwise kill's result: 0
+/// when sent, -1 with errno set.  Not [[nodiscard]]: the killers only ask
+/// for the signal; the reaping side sees whether the render ended.
+int rj_kill_render(const char* host, int pid, int sig);

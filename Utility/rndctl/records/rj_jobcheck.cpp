@@ -13,6 +13,7 @@
 
 #include "Utility/rndctl/base/rj_control.h"
 #include "Utility/rndctl/base/rj_log.h"
+#include "Utility/rndctl/base/rj_scoped.h"
 #include "Utility/rndctl/base/rj_text.h"
 #include "Utility/rndctl/ctldir/rj_editreg.h"
 #include "Utility/rndctl/ctldir/rj_fileio.h"
@@ -20,11 +21,6 @@
 #include "Utility/rndctl/records/rj_records.h"
 
 namespace {
-
-struct FileCloser {
-  void operator()(FILE* fp) const { fclose(fp); }
-};
-using ScopedFILE = std::unique_ptr<FILE, FileCloser>;
 
 // Scene lines are read in pieces of at most 79 characters.
 constexpr int kSceneLine = 80;

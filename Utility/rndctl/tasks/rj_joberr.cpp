@@ -10,6 +10,7 @@
 #include "Shared/memory/MA_rtns.h"
 #include "Utility/rndctl/base/rj_control.h"
 #include "Utility/rndctl/base/rj_log.h"
+#include "Utility/rndctl/base/rj_scoped.h"
 #include "Utility/rndctl/base/rj_text.h"
 #include "Utility/rndctl/proc/rj_signal.h"
 #include "Utility/rndctl/records/rj_recindex.h"
@@ -17,13 +18,6 @@
 #include "Utility/rndctl/tasks/rj_taskrec.h"
 
 namespace {
-
-struct FileCloser {
-  void operator()(FILE* fp) const {
-    if (fp != nullptr) fclose(fp);
-  }
-};
-using ScopedFILE = std::unique_ptr<FILE, FileCloser>;
 
 constexpr const char* kUnknownReason = "Quit for Unknown reasons";
 

@@ -19,13 +19,14 @@
 #include "Shared/memory/MA_rtns.h"
 #include "Utility/rndctl/base/rj_control.h"
 #include "Utility/rndctl/base/rj_log.h"
+#include "Utility/rndctl/base/rj_scoped.h"
 #include "Utility/rndctl/base/rj_text.h"
+#include "Utility/rndctl/proc/rj_registry.h"
 #include "Utility/rndctl/proc/rj_signal.h"
 #include "Utility/rndctl/proc/rj_spawn.h"
 #include "Utility/rndctl/records/rj_dev.h"
 #include "Utility/rndctl/records/rj_frames.h"
 #include "Utility/rndctl/records/rj_records.h"
-#include "Utility/rndctl/tasks/rj_reclaim.h"
 #include "Utility/rndctl/tasks/rj_status.h"
 #include "Utility/rndctl/tasks/rj_taskrec.h"
 #include "Utility/rndctl/tasks/rj_tskio.h"
@@ -33,18 +34,6 @@
 namespace {
 
 constexpr const char* kUnit = "Utility/rndctl/rj_perform";
-
-const char* status_name(int code) {
-  if (code < TASK_PENDING || code > TASK_STOPPED) return "UNKNOWN";
-  return task_status_table[code];
-}
-
-struct FileCloser {
-  void operator()(FILE* fp) const {
-    if (fp != nullptr) fclose(fp);
-  }
-};
-using ScopedFILE = std::unique_ptr<FILE, FileCloser>;
 
 struct MaFree {
   void operator()(char* p) const { MA_free(p, __LINE__, kUnit); }
@@ -182,28 +171,6 @@ void rj_set_paths(Job* job, char** path, char** root) {
   if (root != nullptr) rj_splitpath(job->sdl.c_str(), nullptr, root, "sdl");
 }
 
-int get_task_frame_range(TASK* entry, int* first_extension) {
-  if (entry == nullptr || entry->job == nullptr || entry->rec == nullptr) {
-    if (first_extension != nullptr) *first_extension = 0;
-    return 0;
-  }
-  const Job* job = entry->job;
-  const TaskRec* rec = entry->rec;
-  if (first_extension != nullptr) *first_extension = rj_frame_extension(job, rec->start);
-  return rj_frames_span(job, rec->start, rec->end);
-}
-
-int get_current_frame_extension(Job* job, Dev* dev, int* extension) {
-  for (TASK* entry = rndctl.tasks; entry != nullptr; entry = entry->next) {
-    if (entry->job != job || entry->rec == nullptr) continue;
-    if (entry->rec->dev != dev || entry->rec->status != TASK_RUNNING) continue;
-    set_image_percentage_done(entry);
-    if (extension != nullptr) *extension = rj_frame_extension(job, entry->rec->current);
-    return 1;
-  }
-  return 0;
-}
-
 int rj_system(char* const argv[], const char* stream_path, const char* out_path, Job* job) {
   if (argv == nullptr || argv[0] == nullptr) return -1;
 
@@ -308,83 +275,6 @@ int Perform_a_Task(TASK* entry) {
   // A failed fork started nothing: the caller marks the task FAILED and it
   // is put back for another try.
   return pid > 0 ? 1 : 0;
-}
-
-FILE* Logfile_open_nr(Job* job) {
-  if (job == nullptr || job->name.none()) return nullptr;
-  char path[4096];
-  snprintf(path, sizeof path, "%s/JOBLOG/%s", rndctl.location.or_else("."), job->name.c_str());
-  return fopen(path, "re");
-}
-
-FILE* Logfile_open(Job* job) {
-  FILE* fp = Logfile_open_nr(job);
-  if (fp == nullptr) return nullptr;
-  // The header is four lines; the task lines follow.
-  char line[120];
-  for (int i = 0; i < 4; ++i) {
-    if (fgets(line, sizeof line, fp) == nullptr) break;
-  }
-  return fp;
-}
-
-void Job_Log_out(Job* job) {
-  if (job == nullptr || job->name.none()) return;
-  bool any = false;
-  for (TASK* entry = rndctl.tasks; entry != nullptr && !any; entry = entry->next) {
-    any = entry->job == job;
-  }
-  if (!any) return;
-
-  char path[4096];
-  snprintf(path, sizeof path, "%s/JOBLOG", rndctl.location.or_else("."));
-  mkdir(path, 0775);
-  snprintf(path, sizeof path, "%s/JOBLOG/%s", rndctl.location.or_else("."), job->name.c_str());
-  dbgpnt("%s (job index %d) using the %s\n", job->name.c_str(), job->index,
-         job->executable.or_else(""));
-  int fd;
-  do {
-    fd = open(path, O_RDWR | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0666);
-  } while (fd < 0 && errno == EINTR);
-  if (fd < 0) return;
-  ScopedFILE fp(fdopen(fd, "w+"));
-  if (!fp) {
-    close(fd);
-    return;
-  }
-
-  fprintf(fp.get(), "%s %d using the %s\n", job->name.c_str(), job->index,
-          job->executable.or_else(""));
-  fprintf(fp.get(), "\tsdl = \"%s\"\n", job->sdl.or_else(""));
-  fprintf(fp.get(), "\tframes = %f to %f by %f\n", static_cast<double>(job->frames[0]),
-          static_cast<double>(job->frames[1]), static_cast<double>(job->frames[2]));
-  if (job->extension != 0) {
-    fprintf(fp.get(), "\textension = %d by %d  size(%d)\n", job->ext_start, job->ext_by,
-            job->ext_size);
-  } else {
-    fprintf(fp.get(), "  no extension set\n");
-  }
-  for (TASK* entry = rndctl.tasks; entry != nullptr; entry = entry->next) {
-    if (entry->job != job || entry->rec == nullptr) continue;
-    const TaskRec* rec = entry->rec;
-    fprintf(fp.get(), "\t%d\t %f - %f\t%d - %d\t %s\t %s  %d\n", rec->id,
-            static_cast<double>(rec->start), static_cast<double>(rec->end),
-            rj_frame_extension(job, rec->start), rj_frame_extension(job, rec->end),
-            rec->dev != nullptr ? rec->dev->name.or_else("nodev") : "nodev",
-            status_name(rec->status), rec->retries);
-  }
-}
-
-int rj_kill_render(const char* host, int pid, int sig) {
-  if (pid < 2) return 0;
-  // Another host's render: RJ_signal says so in the trace and sends nothing.
-  if (host != nullptr && !rndctl.host.is(host)) return RJ_signal(host, pid, sig);
-  // The render program leads its own process group: whatever it started
-  // (a renderer behind a wrapper script, helpers) must go with it.
-  int result = kill(-pid, sig);
-  if (result != 0 && errno == ESRCH) result = kill(pid, sig);
-  dbgpnt("kill( %d, %d ) = %d(%d);\n", pid, sig, result, result != 0 ? errno : 0);
-  return result;
 }
 
 void daemon_kill_running_tasks(const char* host) {

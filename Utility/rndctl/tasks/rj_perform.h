@@ -60,32 +60,5 @@ int rj_splitpath(const char* path, char** base, char** dir, const char* last);
 /// Only traced.
 void rj_set_paths(Job* job, char** path, char** root);
 
-/// The number of frames of the entry's task; stores the extension number of
-/// its first frame in `*first_extension` (may be null).  An entry without
-/// job or record gives 0 (and 0 as the extension).
-int get_task_frame_range(TASK* entry, int* first_extension);
-
-/// Finds the first RUNNING entry of `job` on `dev`, refreshes its progress
-/// and stores the extension number of its frame under way.  Returns 1, or 0
-/// when there is no such entry (`*extension` untouched).
-int get_current_frame_extension(Job* job, Dev* dev, int* extension);
-
-/// Rewrites JOBLOG/JOB: a four-line header and one line per entry of the
-/// job.  Does nothing when the job has no entry or the file cannot be made.
-void Job_Log_out(Job* job);
-/// The job log opened for reading past its header (Logfile_open) or from
-/// its start (Logfile_open_nr); null when it cannot be opened.  The caller
-/// closes it.
-FILE* Logfile_open(Job* job);
-FILE* Logfile_open_nr(Job* job);
-
 /// Kills (signal 9) the render of every entry whose resource is on `host`.
 void daemon_kill_running_tasks(const char* host);
-
-/// The one kill of a render: sends `sig` to the process group that the
-/// render program `pid` leads on this host (so its own children go too).
-/// For another host nothing is sent (RJ_signal traces it) and 0 is returned;
-/// a pid below 2 is no render and returns 0.  Otherwise kill's result: 0
-/// when sent, -1 with errno set.  Not [[nodiscard]]: the killers only ask
-/// for the signal; the reaping side sees whether the render ended.
-int rj_kill_render(const char* host, int pid, int sig);

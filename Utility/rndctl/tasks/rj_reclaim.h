@@ -20,7 +20,7 @@
 // and every wake-up; Task_reclaim_dead_hosts from the service loop, about once
 // a minute and never while holding another lock; Task_release_own_renders
 // before a clean exit.  rj_system and the SIGCHLD handler keep the render
-// registry up to date with rj_render_started / rj_render_ended.
+// registry (proc/rj_registry) up to date.
 
 /// Puts a held record of `group` (a group read from the task file) back.
 /// With progress (start < current <= end) `rec` becomes FINISHED
@@ -63,17 +63,3 @@ long rj_host_timeout();
 /// stamp (no nanoseconds) and the clock are still in the same second, since
 /// a second touch in that second would leave the same stamp.
 bool rj_update_time_settled(int64_t seen_ns, time_t server_now);
-
-/// The render registry: pid and start time of every render program this
-/// daemon runs, in "%s/zarno_render_demon.%s.renders" (rj_tmpdir(), host),
-/// rewritten whole through a fresh name and a rename at every change.
-/// rj_render_ended is safe in the SIGCHLD handler (no allocation, no stdio).
-void rj_render_started(int pid);
-void rj_render_ended(int pid);
-/// Kills (SIGKILL to the process group) every render of the registry file
-/// that still runs with the recorded start time, then starts an empty
-/// registry.  A file that is not a regular file of this user, or that others
-/// may write, is not believed.  Returns the number of renders killed.
-int rj_render_kill_leftovers();
-/// The registry's path (a static buffer).
-const char* rj_render_registry_path();

@@ -13,11 +13,13 @@
 #include "Utility/rndctl/base/rj_text.h"
 #include "Utility/rndctl/ctldir/rj_updatetime.h"
 #include "Utility/rndctl/ctlfile/rj_reload.h"
+#include "Utility/rndctl/proc/rj_spawn.h"
 #include "Utility/rndctl/records/rj_dev.h"
 #include "Utility/rndctl/records/rj_frames.h"
 #include "Utility/rndctl/records/rj_job.h"
 #include "Utility/rndctl/records/rj_records.h"
 #include "Utility/rndctl/tasks/rj_joberr.h"
+#include "Utility/rndctl/tasks/rj_joblog.h"
 #include "Utility/rndctl/tasks/rj_perform.h"
 #include "Utility/rndctl/tasks/rj_select.h"
 #include "Utility/rndctl/tasks/rj_task.h"
@@ -441,4 +443,26 @@ void UpdateJobState(Job* job) {
   }
   dbgpnt("\n---------done----UpdateJobState for \"%s\" \"%s\"\n", job->name.or_else("noname"),
          job->status.or_else(""));
+}
+
+int get_task_frame_range(TASK* entry, int* first_extension) {
+  if (entry == nullptr || entry->job == nullptr || entry->rec == nullptr) {
+    if (first_extension != nullptr) *first_extension = 0;
+    return 0;
+  }
+  const Job* job = entry->job;
+  const TaskRec* rec = entry->rec;
+  if (first_extension != nullptr) *first_extension = rj_frame_extension(job, rec->start);
+  return rj_frames_span(job, rec->start, rec->end);
+}
+
+int get_current_frame_extension(Job* job, Dev* dev, int* extension) {
+  for (TASK* entry = rndctl.tasks; entry != nullptr; entry = entry->next) {
+    if (entry->job != job || entry->rec == nullptr) continue;
+    if (entry->rec->dev != dev || entry->rec->status != TASK_RUNNING) continue;
+    set_image_percentage_done(entry);
+    if (extension != nullptr) *extension = rj_frame_extension(job, entry->rec->current);
+    return 1;
+  }
+  return 0;
 }

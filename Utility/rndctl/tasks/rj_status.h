@@ -45,3 +45,13 @@ int set_image_percentage_done(TASK* entry);
 void Job_clear_tasks(Job* job);
 /// Recomputes the job's status text and doneframes from its entries.
 void UpdateJobState(Job* job);
+
+/// The number of frames of the entry's task; stores the extension number of
+/// its first frame in `*first_extension` (may be null).  An entry without
+/// job or record gives 0 (and 0 as the extension).
+int get_task_frame_range(TASK* entry, int* first_extension);
+
+/// Finds the first RUNNING entry of `job` on `dev`, refreshes its progress
+/// and stores the extension number of its frame under way.  Returns 1, or 0
+/// when there is no such entry (`*extension` untouched).
+int get_current_frame_extension(Job* job, Dev* dev, int* extension);
