@@ -215,23 +215,34 @@ void TaskGroup_free(TaskGroup** list, TaskGroup* group) {
 
 void TaskGroup_free_all(TaskGroup** list) {
   if (list == nullptr) return;
+  // What TaskGroup_free would do after marking, in one walk of the records
+  // instead of two: a file of a hundred thousand records is a cache miss a
+  // record each time round.  A record that a running-task entry has taken
+  // over stays with it unless marked 1, and one marked 2 only loses the mark
+  // (a second call releases it); everything else read from the file goes.
   while (*list != nullptr) {
     TaskGroup* group = *list;
-    // A record that a running-task entry has taken over stays with it, and
-    // one marked 2 is released only by a second call: both survive.
-    // Everything else read from the file goes now.
+    *list = group->next;
+    dbgpnt("TaskGroup_free 0x%x {\n", px(group));
     TaskRec* rec = group->tasks;
     while (rec != nullptr) {
       TaskRec* next = rec->next;
       bool owned = rec->task != nullptr && rec->task->rec == rec;
+      rec->group = nullptr;  // the group's list is being taken apart anyway
       if (rec->keep == 2) {
-        TaskRec_freeOnly(rec);
-      } else if (!owned) {
+        rec->keep = 0;
+        rec->next = nullptr;
+      } else if (rec->keep == 1 || !owned) {
         rec->keep = 1;
+        TaskRec_freeOnly(rec);
+      } else {
+        rec->next = nullptr;  // survives, owned by its running-task entry
       }
       rec = next;
     }
-    TaskGroup_free(list, group);
+    group->tasks = nullptr;
+    dbgpnt("}\n");
+    MA_delete(group, __LINE__, kUnit);
   }
 }
 
