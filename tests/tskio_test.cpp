@@ -305,6 +305,44 @@ TEST_F(TaskFileTest, RecordsOfAReadOutliveTheReadAsTheirOwnersNeed) {
   while (rndctl.tasks != nullptr) TASK_free(rndctl.tasks);
 }
 
+// Releasing the groups of a read: a record an entry owns survives unless
+// marked 1; one marked 2 only loses the mark, owned or not; the rest go.
+struct ReleaseCase {
+  int keep;
+  bool owned;
+  bool survives;
+};
+
+class ReleaseMarks : public TaskFileTest, public testing::WithParamInterface<ReleaseCase> {};
+
+TEST_P(ReleaseMarks, GroupsReleaseWhatNobodyKeeps) {
+  const ReleaseCase c = GetParam();
+  TaskGroup* groups = TaskGroup_alloc(alpha_, 2);
+  TaskRec* rec = TaskRec_alloc(groups, 1, 10, 1, here_, TASK_PENDING, nullptr, 0);
+  TaskRec* other = TaskRec_alloc(groups, 11, 20, 11, here_, TASK_PENDING, nullptr, 1);
+  ASSERT_TRUE(rec && other);
+  rec->keep = c.keep;
+  TASK* owner = c.owned ? Task_add(alpha_, rec) : nullptr;
+  TaskGroup_free_all(&groups);
+  EXPECT_EQ(groups, nullptr);
+  if (owner != nullptr) {
+    EXPECT_EQ(owner->rec, c.survives ? rec : nullptr);
+  }
+  if (c.survives) {
+    EXPECT_EQ(rec->group, nullptr);
+    EXPECT_EQ(rec->next, nullptr);
+    EXPECT_EQ(rec->keep, 0);
+    if (owner == nullptr) TaskRec_free(rec);
+  }
+  while (rndctl.tasks != nullptr) TASK_free(rndctl.tasks);
+}
+
+INSTANTIATE_TEST_SUITE_P(Marks, ReleaseMarks,
+                         testing::Values(ReleaseCase{0, true, true}, ReleaseCase{1, true, false},
+                                         ReleaseCase{2, true, true}, ReleaseCase{2, false, true},
+                                         ReleaseCase{0, false, false},
+                                         ReleaseCase{1, false, false}));
+
 // --- Status files -----------------------------------------------------------
 
 TEST_F(TaskFileTest, StatusFileListsThisHostsLiveEntries) {

@@ -42,106 +42,8 @@ namespace {
 
 constexpr int kMaxRetries = 10;
 
+// Debug lines print addresses with "%x", as the log readers expect.
 unsigned px(const void* p) { return static_cast<unsigned>(reinterpret_cast<uintptr_t>(p)); }
-
-bool dev_on_host(const Dev* dev, const char* host) { return rj_dev_on_host(dev, host); }
-
-bool dev_on_this_host(const Dev* dev) { return rj_dev_is_this_host(dev); }
-
-bool is_active(int status) { return status == TASK_STARTED || status == TASK_RUNNING; }
-
-// True when the job's host list names a host other than this one.
-bool job_names_other_host(const Job* job) {
-  for (RndDevList* e = job != nullptr ? job->resources : nullptr; e != nullptr; e = e->next) {
-    if (e->dev != nullptr && e->dev->host_name.c_str() != nullptr && !dev_on_this_host(e->dev)) {
-      return true;
-    }
-  }
-  return false;
-}
-
-template <class A, class B>
-struct PairHash {
-  size_t operator()(const std::pair<A, B>& p) const {
-    size_t h = std::hash<A>()(p.first);
-    return h ^ (std::hash<B>()(p.second) + 0x9e3779b97f4a7c15ULL + (h << 6) + (h >> 2));
-  }
-};
-
-// What one pick needs to know of the running-task list, gathered once per
-// pick rather than once per job: the list mirrors the whole task file and
-// may hold many thousand entries, while the picture does not change during
-// the pick.
-struct PickView {
-  // (job, resource of this host) pairs that this host is already working on.
-  std::unordered_set<std::pair<const Job*, const Dev*>, PairHash<const Job*, const Dev*>> worked_on;
-  // Free process slots of this host's resources, asked once each.
-  std::unordered_map<Dev*, int> slots;
-
-  // This host's resources (usually one): every resource a record or a job
-  // names comes from the control block's list, so a pointer test will do
-  // where a name compare per entry would cost a string compare each.
-  std::vector<const Dev*> here;
-
-  bool is_here(const Dev* dev) const {
-    return dev != nullptr && std::find(here.begin(), here.end(), dev) != here.end();
-  }
-
-  // Tasks started or running on each of this host's resources, counted in
-  // the same walk: what Dev_processes_available would count, one walk of the
-  // list for all of them.
-  std::vector<int> active;
-
-  PickView() {
-    for (Dev* d = rndctl.devs; d != nullptr; d = d->next) {
-      if (dev_on_this_host(d)) here.push_back(d);
-    }
-    active.assign(here.size(), 0);
-    for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
-      const TaskRec* rec = e->rec;
-      if (rec == nullptr || rec->dev == nullptr) continue;
-      auto at = std::find(here.begin(), here.end(), rec->dev);
-      if (at == here.end()) continue;
-      int s = rec->status;
-      if (is_active(s)) ++active[static_cast<size_t>(at - here.begin())];
-      if (e->job != nullptr && (s == TASK_STARTED || s == TASK_RUNNING || s == TASK_FAILED)) {
-        worked_on.insert({e->job, rec->dev});
-      }
-    }
-  }
-
-  int free_slots(Dev* dev) {
-    auto it = slots.find(dev);
-    if (it != slots.end()) return it->second;
-    int n;
-    auto at = std::find(here.begin(), here.end(), dev);
-    if (at == here.end() || debug) {
-      // The trace lists every entry it looks at; only the long way has it.
-      n = Dev_processes_available(dev);
-    } else {
-      if (dev->num_processors < 1) dev->num_processors = 1;
-      n = std::max(0, dev->num_processors - active[static_cast<size_t>(at - here.begin())]);
-    }
-    slots.emplace(dev, n);
-    return n;
-  }
-};
-
-PickView* current_view = nullptr;  // non-owning; set during extract_pending_task
-
-bool already_worked_on(const Job* job, const Dev* dev) {
-  if (current_view != nullptr) return current_view->worked_on.count({job, dev}) != 0;
-  for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
-    if (e->job != job || e->rec == nullptr || e->rec->dev != dev) continue;
-    int s = e->rec->status;
-    if (s == TASK_STARTED || s == TASK_RUNNING || s == TASK_FAILED) return true;
-  }
-  return false;
-}
-
-int free_slots(Dev* dev) {
-  return current_view != nullptr ? current_view->free_slots(dev) : Dev_processes_available(dev);
-}
 
 // Creates (or empties) the task's log stream file and opens it for reading.
 // The directory is world-writable: a link planted under the name must not
@@ -328,31 +230,6 @@ void retire_other_lives(TaskGroup* groups, TaskAfterLock* after, EntryIndex& ind
 
 // ---------------------------------------------------------------------------
 
-int Dev_processes_available(Dev* dev) {
-  if (dev == nullptr) return 0;
-  dbgpnt("Dev_processes_avail ----- start %s\n", dev->name.or_else("(null)"));
-  if (dev->num_processors < 1) dev->num_processors = 1;
-  int count = dev->num_processors;
-  // Every task started or running on the resource takes a slot, whichever
-  // job it belongs to: counting one per job would let several tasks of one
-  // job flood a host beyond its processors.
-  for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
-    const TaskRec* rec = e->rec;
-    if (rec == nullptr) continue;
-    if (rec->dev == dev && is_active(rec->status)) {
-      --count;
-      dbgpnt("matched %d\n", rec->status);
-    } else if (rec->dev != nullptr) {
-      dbgpnt("no match %d\n", rec->status);
-    } else {
-      dbgpnt("no dev found\n");
-    }
-  }
-  if (count < 0) count = 0;
-  dbgpnt("Dev_processes_avail ----- end  (count = %d )\n", count);
-  return count;
-}
-
 TASK* GetaPendingTask() {
   const char* host = rndctl.host.or_else("");
   dbgpnt("\n--------------------------------------------GetaPendingTask\n");
@@ -398,120 +275,136 @@ TASK* GetaPendingTask() {
 
 TASK* Get_a_task() { return Task_get(); }
 
-TASK* Task_get() {
+namespace {
+
+// Gives an entry the place and progress of the file's record it mirrors.
+void take_place(TaskRec* own, const TaskRec* rec) {
+  own->start = rec->start;
+  own->end = rec->end;
+  own->retries = rec->retries;
+  own->current = rec->current;
+}
+
+// Drops the entries marked as of another life (as Task_retire_marked would)
+// and retires those whose group in the file is of another life.
+void retire_old_entries(TaskGroup* groups, const std::vector<TASK*>& marked, EntryIndex& index,
+                        TaskAfterLock* after) {
+  for (TASK* e : marked) {
+    dbgpnt("freeing Task %x\n", px(e));
+    Task_let_go(e, after);
+    TASK_free(e);
+  }
+  retire_other_lives(groups, after, index);
+}
+
+// The entry that takes the picked record `rec` (already cut to size):
+// this host's entry of it if there is one, else a new one that owns it.
+TASK* take_record(TaskRec* rec, EntryIndex& index, TaskAfterLock* after) {
+  TASK* chosen = index.match(rec->group->job, rec);
+  // The record is PENDING in the file: an entry here that still held it
+  // lost it, and its render stops before the piece is taken again.
+  if (chosen != nullptr && chosen->rec != rec) Task_settle(chosen, rec, after);
+  const int ids_before = rec->group->next_task_id;
+  split_a_task(rec->group, rec);
+  if (rec->group->next_task_id != ids_before) after->wake(rec->group->job);
+  if (chosen == nullptr) {
+    TaskRec** link = &rec->group->tasks;
+    while (*link != nullptr && *link != rec) link = &(*link)->next;
+    if (*link == rec) rec = TaskRec_unpool(link);
+    chosen = Task_add(rec->group->job, rec);
+    index.file(chosen);
+  } else if (chosen->rec != rec) {
+    take_place(chosen->rec, rec);
+    chosen->rec->dev = rec->dev;
+  }
+  rec->status = TASK_STARTED;
+  return chosen;
+}
+
+// Picks the piece this host renders next, cuts it, and marks it STARTED in
+// the file and in its entry.  Returns the entry, or null when there is none.
+TASK* pick_and_cut(TaskGroup** groups, EntryIndex& index, TaskAfterLock* after) {
+  insert_unknown_pending_jobs(groups);
+  TaskRec* rec = extract_pending_task(groups);
+  if (rec == nullptr) return nullptr;
+  TASK* chosen = take_record(rec, index, after);
+  if (chosen != nullptr) {
+    chosen->rec->status = TASK_STARTED;
+    chosen->stale = 0;
+    chosen->taken = 1;
+  }
+  return chosen;
+}
+
+// Brings the entry of one record (at *link of group g) in line with it.
+void mirror_record(Job* job, TaskRec** link, bool uses_host, EntryIndex& index,
+                   TaskAfterLock* after) {
+  TaskRec* rec = *link;
+  TASK* e = index.find(rec->id);
+  if (e != nullptr && !Task_same_rec(e->rec, rec)) e = nullptr;
+  if (e == nullptr) {
+    rec = TaskRec_unpool(link);
+    e = Task_add(job, rec);  // the entry owns the record from now on
+    if (e != nullptr) index.add(e);
+  } else if (e->rec != rec && uses_host) {
+    TaskRec* own = e->rec;
+    take_place(own, rec);
+    if (rec->dev != nullptr) own->dev = rec->dev;
+    // This host knows best what its own tasks are doing, while they are
+    // its own; for the others the file is the news.
+    if (Task_settle(e, rec, after) != 0) {
+      dbgpnt("Task_get: use old status %d\n", own->status);
+    } else {
+      own->status = rec->status;
+    }
+  }
+  if (e != nullptr && !e->taken && rj_dev_is_this_host(rec->dev) && held_status(rec->status)) {
+    // Names this host as its renderer, but no daemon here took it: an
+    // earlier daemon of this host did and ended.  Nobody renders it.
+    rec->status = TASK_PENDING;
+    if (e->rec != nullptr) e->rec->status = TASK_PENDING;
+    after->wake(job);
+  }
+  if (e != nullptr && e->rec != rec) {
+    if (uses_host) dbgpnt("extra task_rec %x, setting dead state\n", px(rec));
+    rec->keep = 1;
+  }
+  if (e != nullptr) e->stale = 0;
+}
+
+// Brings the running-task list in line with the file, group by group: an
+// entry for every record, this host's view of its own pieces kept.
+void mirror_groups(TaskGroup* groups, EntryIndex& index, TaskAfterLock* after) {
   const char* host = rndctl.host.c_str();
-  TaskAfterLock after;
-  TASK* chosen = nullptr;
-  bool opened = false;
-  const int written = Task_file_rewrite([&](TaskGroup** list) {
-    opened = true;
-    TaskGroup*& groups = *list;
-    // Every entry that finds its record in the file loses the mark again;
-    // those that keep it have left the file.  One index of the entries
-    // serves the whole cycle.
-    // Entries marked as of another life go first, as Task_retire_marked
-    // would drop them, found in the same walk of the list.
-    std::vector<TASK*> marked;
-    EntryIndex index(true, &marked);
-    for (TASK* e : marked) {
-      dbgpnt("freeing Task %x\n", px(e));
-      Task_let_go(e, &after);
-      TASK_free(e);
+  for (TaskGroup* g = groups; g != nullptr; g = g->next) {
+    Job* job = g->job;
+    const bool uses_host = isa_job_using_host(host, job) != 0;
+    index.select(job);
+    for (TaskRec** link = &g->tasks; *link != nullptr; link = &(*link)->next) {
+      mirror_record(job, link, uses_host, index, after);
     }
-    retire_other_lives(groups, &after, index);
-
-    insert_unknown_pending_jobs(&groups);
-
-    if (TaskRec* rec = extract_pending_task(&groups)) {
-      chosen = index.match(rec->group->job, rec);
-      // The record is PENDING in the file: an entry here that still held it
-      // lost it, and its render stops before the piece is taken again.
-      if (chosen != nullptr && chosen->rec != rec) Task_settle(chosen, rec, &after);
-      const int ids_before = rec->group->next_task_id;
-      split_a_task(rec->group, rec);
-      if (rec->group->next_task_id != ids_before) after.wake(rec->group->job);
-      if (chosen == nullptr) {
-        TaskRec** link = &rec->group->tasks;
-        while (*link != nullptr && *link != rec) link = &(*link)->next;
-        if (*link == rec) rec = TaskRec_unpool(link);
-        chosen = Task_add(rec->group->job, rec);
-        index.file(chosen);
-      } else if (chosen->rec != rec) {
-        TaskRec* own = chosen->rec;
-        own->start = rec->start;
-        own->end = rec->end;
-        own->retries = rec->retries;
-        own->current = rec->current;
-        own->dev = rec->dev;
-      }
-      rec->status = TASK_STARTED;
-      if (chosen != nullptr) {
-        chosen->rec->status = TASK_STARTED;
-        chosen->stale = 0;
-        chosen->taken = 1;
-      }
-    }
-
-    // Bring the mirror in line with the file, group by group.
-    for (TaskGroup* g = groups; g != nullptr; g = g->next) {
-      Job* job = g->job;
-      int uses_host = isa_job_using_host(host, job);
-      index.select(job);
-      for (TaskRec** link = &g->tasks; *link != nullptr; link = &(*link)->next) {
-        TaskRec* rec = *link;
-        TASK* e = index.find(rec->id);
-        if (e != nullptr && !Task_same_rec(e->rec, rec)) e = nullptr;
-        if (e == nullptr) {
-          rec = TaskRec_unpool(link);
-          e = Task_add(job, rec);  // the entry owns the record from now on
-          if (e != nullptr) index.add(e);
-        } else if (e->rec != rec && uses_host) {
-          TaskRec* own = e->rec;
-          own->start = rec->start;
-          own->end = rec->end;
-          own->retries = rec->retries;
-          own->current = rec->current;
-          if (rec->dev != nullptr) own->dev = rec->dev;
-          // This host knows best what its own tasks are doing, while they are
-          // its own; for the others the file is the news.
-          if (Task_settle(e, rec, &after) != 0) {
-            dbgpnt("Task_get: use old status %d\n", own->status);
-          } else {
-            own->status = rec->status;
-          }
-        }
-        if (e != nullptr && !e->taken && rj_dev_is_this_host(rec->dev) &&
-            held_status(rec->status)) {
-          // Names this host as its renderer, but no daemon here took it: an
-          // earlier daemon of this host did and ended.  Nobody renders it.
-          rec->status = TASK_PENDING;
-          if (e->rec != nullptr) e->rec->status = TASK_PENDING;
-          after.wake(job);
-        }
-        if (e != nullptr && e->rec != rec) {
-          if (uses_host) dbgpnt("extra task_rec %x, setting dead state\n", px(rec));
-          rec->keep = 1;
-        }
-        if (e != nullptr) e->stale = 0;
-      }
-      for (TASK* e : index.selected()) e->seen_next_id = std::max(e->seen_next_id, g->next_task_id);
-    }
-
-    return true;
-  });
-  if (!opened) {
-    Task_retire_marked();
-    return nullptr;
+    for (TASK* e : index.selected()) e->seen_next_id = std::max(e->seen_next_id, g->next_task_id);
   }
-  after.run();
-  if (written != 1 && chosen != nullptr && chosen->rec != nullptr) {
-    // The file does not say STARTED (the failure is reported): another host
-    // may take the piece, so this one must not render it.
-    chosen->rec->status = TASK_PENDING;
-    chosen->taken = 0;
-    chosen = nullptr;
-  }
+}
 
+// One selection cycle on the groups read under the lock: old lives out,
+// pick and cut, mirror.  Returns the entry to render, or null.
+TASK* select_cycle(TaskGroup** groups, TaskAfterLock* after) {
+  // Every entry that finds its record in the file loses the stale mark
+  // again; those that keep it have left the file.  One index of the
+  // entries serves the whole cycle; entries marked as of another life are
+  // found in the same walk of the list.
+  std::vector<TASK*> marked;
+  EntryIndex index(true, &marked);
+  retire_old_entries(*groups, marked, index, after);
+  TASK* chosen = pick_and_cut(groups, index, after);
+  mirror_groups(*groups, index, after);
+  return chosen;
+}
+
+// Frees the entries whose records left the file.  Returns `chosen`, or null
+// when it was one of them.
+TASK* sweep_stale_entries(TASK* chosen) {
   TASK* e = rndctl.tasks;
   while (e != nullptr) {
     TASK* next = e->next;
@@ -526,153 +419,35 @@ TASK* Task_get() {
     }
     e = next;
   }
-  Check_RndTasks("Task_get 3");
   return chosen;
 }
 
-void insert_unknown_pending_jobs(TaskGroup** groups) {
-  if (groups == nullptr) return;
-  std::unordered_set<const Job*> grouped;
-  for (TaskGroup* g = *groups; g != nullptr; g = g->next) grouped.insert(g->job);
-  for (Job* job = rndctl.jobs; job != nullptr; job = job->next) {
-    if (grouped.count(job) != 0 || !job->status.is("pending") || job->resources == nullptr) {
-      continue;
-    }
-    dbgpnt("Insert a task for %s\n", job->name.or_else("(null)"));
-    if (insert_task(groups, job, job->frames[0], job->frames[1], TASK_PENDING) != nullptr) {
-      grouped.insert(job);
-    }
-  }
-}
+}  // namespace
 
-TaskRec* insert_task(TaskGroup** groups, Job* job, float start, float end, int status) {
-  if (groups == nullptr) return nullptr;
-  TaskGroup* group = TaskGroup_by_job(*groups, job);
-  if (group == nullptr) {
-    group = TaskGroup_alloc(job, 0);
-    if (group == nullptr) return nullptr;
-    group->next = *groups;
-    *groups = group;
-  }
-  TaskRec* rec =
-      TaskRec_alloc(group, start, end, start, nullptr, status, nullptr, group->next_task_id);
-  if (rec != nullptr) ++group->next_task_id;
-  return rec;
-}
-
-TaskRec* extract_pending_task(TaskGroup** groups) {
-  if (groups == nullptr) return nullptr;
-  PickView view;
-  // With every process slot of this host taken, no group can win, and
-  // trying them one after the other costs a walk of the list per group.
-  bool any_slot = false;
-  for (Dev* dev = rndctl.devs; dev != nullptr && !any_slot; dev = dev->next) {
-    any_slot = dev_on_this_host(dev) && view.free_slots(dev) > 0;
-  }
-  if (!any_slot) {
-    dbgpnt("No task to extract - no dev found\n");
+TASK* Task_get() {
+  TaskAfterLock after;
+  TASK* chosen = nullptr;
+  bool opened = false;
+  const int written = Task_file_rewrite([&](TaskGroup** groups) {
+    opened = true;
+    chosen = select_cycle(groups, &after);
+    return true;
+  });
+  if (!opened) {
+    Task_retire_marked();
     return nullptr;
   }
-  current_view = &view;
-  TaskRec* found = nullptr;
-  for (int mode = 0; mode <= 2 && found == nullptr; ++mode) {
-    TaskGroup* from = *groups;
-    while (found == nullptr) {
-      TaskGroup* g = get_highest_taskgroup(from, mode);
-      if (g == nullptr) break;
-      from = g->next;
-      TaskRec* rec = check_for_pending_tasks(g);
-      if (rec == nullptr) {
-        dbgpnt("No task to extract\n");
-        continue;
-      }
-      for (RndDevList* e = g->job->resources; e != nullptr; e = e->next) {
-        if (dev_on_this_host(e->dev) && free_slots(e->dev) > 0) {
-          rec->dev = e->dev;
-          found = rec;
-          dbgpnt("Extracting task\n");
-          break;
-        }
-      }
-      if (found == nullptr) dbgpnt("No task to extract - no dev found\n");
-    }
+  after.run();
+  if (written != 1 && chosen != nullptr && chosen->rec != nullptr) {
+    // The file does not say STARTED (the failure is reported): another host
+    // may take the piece, so this one must not render it.
+    chosen->rec->status = TASK_PENDING;
+    chosen->taken = 0;
+    chosen = nullptr;
   }
-  current_view = nullptr;
-  return found;
-}
-
-TaskGroup* get_highest_taskgroup(TaskGroup* groups, int mode) {
-  const char* host = rndctl.host.c_str();
-  bool immediate = rndctl.running > 0;
-  dbgpnt(" get_highest_taskgroup ---- start\n");
-  if (groups == nullptr) dbgpnt("There are no more jobs\n");
-  if (immediate) {
-    dbgpnt("Looking for immedate job tasks\n");
-  } else if (mode == 0) {
-    dbgpnt("Looking for highest job tasks\n");
-  } else {
-    dbgpnt("Looking for next job tasks\n");
-  }
-
-  TaskGroup* chosen = nullptr;
-  for (TaskGroup* g = groups; g != nullptr; g = g->next) {
-    Job* job = g->job;
-    // Only a job that may be worked on now (2) is taken: a paused one (1)
-    // keeps what it has but starts nothing new, as its owner asked.  It is
-    // asked once per job: the answer could only change if the clock crossed
-    // a half-hour mark during the walk.
-    if (job == nullptr || job->resources == nullptr || Job_available(job) != 2) continue;
-    for (RndDevList* e = job->resources; e != nullptr; e = e->next) {
-      if (!dev_on_host(e->dev, host)) continue;
-      if (mode != 2 && already_worked_on(job, e->dev)) {
-        dbgpnt("already working on \"%s\"\n", job->name.or_else("(null)"));
-        continue;
-      }
-      if (immediate) {
-        // A process already runs here: only jobs that must not wait get in.
-        if (job->priority != 0) continue;
-        if (check_for_pending_tasks(g) != nullptr) {
-          chosen = g;
-          dbgpnt("found immediate task - \"%s\"\n", job->name.or_else("(null)"));
-          break;
-        }
-        dbgpnt("no pending tasks for \"%s\"\n", job->name.or_else("(null)"));
-      } else if (chosen == nullptr || job->priority < chosen->job->priority) {
-        if (check_for_pending_tasks(g) != nullptr) {
-          chosen = g;
-          dbgpnt("found task - \"%s\"\n", job->name.or_else("(null)"));
-        } else {
-          dbgpnt("no pending tasks for \"%s\"\n", job->name.or_else("(null)"));
-        }
-      }
-    }
-    if (chosen != nullptr && (mode != 0 || immediate)) return chosen;
-  }
+  chosen = sweep_stale_entries(chosen);
+  Check_RndTasks("Task_get 3");
   return chosen;
-}
-
-TaskRec* check_for_pending_tasks(TaskGroup* group) {
-  if (group == nullptr) return nullptr;
-  int other_host = -1;  // asked only when needed
-  for (TaskRec* rec = group->tasks; rec != nullptr; rec = rec->next) {
-    if (rec->status != TASK_PENDING) continue;
-    if (rec->retries != 0 && dev_on_this_host(rec->dev)) {
-      // It failed here: leave it to another host if the job has one.  A job
-      // that only this host may render retries here, or it would never end.
-      if (other_host < 0) other_host = job_names_other_host(group->job) ? 1 : 0;
-      if (other_host) continue;
-    }
-    return rec;
-  }
-  return nullptr;
-}
-
-int isa_job_using_host(const char* host, Job* job) {
-  if (job == nullptr) return 0;
-  for (RndDevList* e = job->resources; e != nullptr; e = e->next) {
-    if (dev_on_host(e->dev, host)) return 1;
-  }
-  return 0;
 }
 
 TASK* match_a_taskrec(TaskRec* rec) {
@@ -682,45 +457,6 @@ TASK* match_a_taskrec(TaskRec* rec) {
     if (e->job == job && Task_same_rec(e->rec, rec)) return e;
   }
   return nullptr;
-}
-
-void split_a_task(TaskGroup* group, TaskRec* rec) {
-  if (group == nullptr || rec == nullptr || rec->dev == nullptr || group->job == nullptr ||
-      !group->job->animate) {
-    return;
-  }
-  Job* job = group->job;
-  float by = job->frames[2];
-  float span = (rec->end - rec->start) / by;
-  // A zero or negative step, or a range no int can count, cannot be cut.
-  int steps = std::isfinite(span) && span > -2147483648.0f && span < 2147483648.0f
-                  ? static_cast<int>(span)
-                  : 0;
-  dbgpnt(" split frames_to_do = %d\n", steps);
-  dbgpnt(" (frame1 - frame0) / job_frame_by = ( %f - %f ) / %f\n", rec->start, rec->end, by);
-  if (rec->dev->max_frames < 1) rec->dev->max_frames = 1;
-  int n = rec->dev->max_frames;
-  if (n > steps) return;
-
-  float old_end = rec->end;
-  float new_start = rec->start + static_cast<float>(n) * by;
-  dbgpnt(" doing task split: old_end = %f, new_start = %f, new_end = %f\n", old_end, new_start,
-         old_end);
-  TaskRec* rest = TaskRec_alloc(group, new_start, old_end, new_start, nullptr, TASK_PENDING,
-                                nullptr, group->next_task_id);
-  if (rest == nullptr) return;
-  ++group->next_task_id;
-  // The remainder gets its own entry when the mirror is brought in line; it
-  // is not linked to the entry of the piece, which may go away first.
-  rest->task = nullptr;
-  rest->dev = nullptr;
-  rec->end = new_start - by;
-  dbgpnt(" back from doing split\n");
-  dbgpnt("\nsplit_a_task -------------------------------\n");
-  dbgpnt("0x%x %d\t(%3.3f, %3.3f, %d)\n", px(rec), rec->id, rec->start, rec->end, rec->status);
-  dbgpnt("0x%x  %d\t(%3.3f, %3.3f, %d)\n", px(rest), rest->id, rest->start, rest->end,
-         rest->status);
-  dbgpnt("--------------------------------------------\n");
 }
 
 TaskRec* Split_first_splittable_failed_tasks() {
