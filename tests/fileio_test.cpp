@@ -237,13 +237,13 @@ TEST_F(FileopTest, WaitersRacingAtAStaleLockBreakItOnceAndTakeItInTurn) {
       char byte;
       if (read(go[0], &byte, 1) != 0) _exit(3);
       if (freopen("/dev/null", "w", stderr) == nullptr) _exit(4);
-      lock_fileop(FILE_TASKS, 1);
+      if (lock_fileop(FILE_TASKS, 1) != 1) _exit(5);
       int fd = open(inside.c_str(), O_WRONLY | O_CREAT | O_EXCL, 0666);
       if (fd < 0) _exit(2);  // somebody else is inside
       close(fd);
       usleep(2000);
       unlink(inside.c_str());
-      lock_fileop(FILE_TASKS, 0);
+      if (lock_fileop(FILE_TASKS, 0) != 1) _exit(6);
       fflush(nullptr);
       _exit(0);
     }

@@ -56,7 +56,7 @@ int init_fileop();
 /// take zero: releases it when this process holds it (its holder file names
 /// this host and this pid) and leaves anyone else's alone; returns 1.
 /// 0 only for a bad index or when the paths cannot be built.
-int lock_fileop(int index, int take);
+[[nodiscard]] int lock_fileop(int index, int take);
 /// Opens file `index` for reading, creating it empty when absent.
 FILE* read_fileop(int index);
 /// Opens file `index` for a rewrite (creating it empty when absent): reads
@@ -121,7 +121,7 @@ class FileopLock {
  public:
   explicit FileopLock(int index) : index_(index), held_(lock_fileop(index, 1) == 1) {}
   ~FileopLock() {
-    if (held_) lock_fileop(index_, 0);
+    if (held_) (void)lock_fileop(index_, 0);  // only a bad index fails, and it was taken
   }
   FileopLock(const FileopLock&) = delete;
   FileopLock& operator=(const FileopLock&) = delete;

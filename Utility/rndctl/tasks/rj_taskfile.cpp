@@ -316,7 +316,7 @@ int Task_write_dump(TaskGroup* groups) {
 }
 
 void Task_file_dump() {
-  lock_fileop(FILE_TASKS, 1);
+  FileopLock lock(FILE_TASKS);
   FILE* fp = read_fileop(FILE_TASKS);
   if (fp != nullptr) {
     TaskGroup* groups = Task_read(fp);
@@ -324,12 +324,11 @@ void Task_file_dump() {
     (void)close_fileop(FILE_TASKS);  // read only: nothing to lose
     TaskGroup_free_all(&groups);
   }
-  lock_fileop(FILE_TASKS, 0);
 }
 
 int Task_file_search(const char* host) {
   int found = 0;
-  lock_fileop(FILE_TASKS, 1);
+  FileopLock lock(FILE_TASKS);
   FILE* fp = read_fileop(FILE_TASKS);
   if (fp != nullptr) {
     TaskGroup* groups = Task_read(fp);
@@ -337,46 +336,45 @@ int Task_file_search(const char* host) {
     (void)close_fileop(FILE_TASKS);  // read only: nothing to lose
     TaskGroup_free_all(&groups);
   }
-  lock_fileop(FILE_TASKS, 0);
   return found;
 }
 
 int Task_file_rewrite(const std::function<bool(TaskGroup** groups)>& change) {
-  lock_fileop(FILE_TASKS, 1);
-  FILE* fp = update_fileop(FILE_TASKS);
-  if (fp == nullptr) {
-    lock_fileop(FILE_TASKS, 0);
-    return -1;
-  }
-  TaskGroup* groups = Task_read(fp);
+  TaskGroup* groups = nullptr;
   int result = 0;
-  if (change(&groups)) {
-    rewind_fileop(FILE_TASKS);
-    bool written = Task_write(fp, groups) >= 0;
-    result = close_and_truncate_fileop(FILE_TASKS) == 0 && written ? 1 : -1;
-  } else {
-    // Nothing changed: a rewrite would only turn the groups round.
-    (void)close_fileop(FILE_TASKS);  // read only: nothing to lose
+  {
+    // The lock covers the read, the change and the write; freeing the
+    // groups waits until it is released.
+    FileopLock lock(FILE_TASKS);
+    FILE* fp = update_fileop(FILE_TASKS);
+    if (fp == nullptr) return -1;
+    groups = Task_read(fp);
+    if (change(&groups)) {
+      rewind_fileop(FILE_TASKS);
+      bool written = Task_write(fp, groups) >= 0;
+      result = close_and_truncate_fileop(FILE_TASKS) == 0 && written ? 1 : -1;
+    } else {
+      // Nothing changed: a rewrite would only turn the groups round.
+      (void)close_fileop(FILE_TASKS);  // read only: nothing to lose
+    }
   }
-  lock_fileop(FILE_TASKS, 0);
   TaskGroup_free_all(&groups);
   return result;
 }
 
 void Editor_load_Tasks() {
   while (rndctl.tasks != nullptr) TASK_free(rndctl.tasks);
-  lock_fileop(FILE_TASKS, 1);
-  FILE* fp = read_fileop(FILE_TASKS);
-  if (fp == nullptr) {
-    lock_fileop(FILE_TASKS, 0);
-    return;
+  TaskGroup* groups = nullptr;
+  {
+    FileopLock lock(FILE_TASKS);
+    FILE* fp = read_fileop(FILE_TASKS);
+    if (fp == nullptr) return;
+    groups = Task_read(fp);
+    for (TaskGroup* g = groups; g != nullptr; g = g->next) {
+      for (TaskRec** link = &g->tasks; *link != nullptr; link = &(*link)->next)
+        Task_add(g->job, TaskRec_unpool(link));
+    }
+    (void)close_fileop(FILE_TASKS);  // read only: nothing to lose
   }
-  TaskGroup* groups = Task_read(fp);
-  for (TaskGroup* g = groups; g != nullptr; g = g->next) {
-    for (TaskRec** link = &g->tasks; *link != nullptr; link = &(*link)->next)
-      Task_add(g->job, TaskRec_unpool(link));
-  }
-  (void)close_fileop(FILE_TASKS);  // read only: nothing to lose
-  lock_fileop(FILE_TASKS, 0);
   TaskGroup_free_all(&groups);
 }

@@ -16,6 +16,8 @@
 #include "Utility/rndctl/base/rj_control.h"
 #include "Utility/rndctl/base/rj_log.h"
 #include "Utility/rndctl/base/rj_text.h"
+#include "Utility/rndctl/ctldir/rj_paths.h"
+#include "Utility/rndctl/ctldir/rj_pidfile.h"
 #include "Utility/rndctl/ctlfile/rj_ctlfile.h"
 #include "Utility/rndctl/proc/rj_signal.h"
 #include "Utility/rndctl/records/rj_dev.h"
@@ -29,40 +31,12 @@ namespace {
 
 using rj_tasktext::TokenSource;
 
-// The daemon-alive test: the pid file names the daemon of a host.
-int daemon_alive(const char* host) {
-  char path[4096];
-  snprintf(path, sizeof path, "%s/%s.pid", rndctl.location.or_else("."), host);
-  int fd = open(path, O_RDONLY | O_CLOEXEC);
-  if (fd < 0) return 0;
-  int pid = 0;
-  ssize_t n;
-  do n = read(fd, &pid, sizeof pid);
-  while (n < 0 && errno == EINTR);
-  if (n != static_cast<ssize_t>(sizeof pid)) {
-    dbgpnt("%s\n", strerror(n < 0 ? errno : EIO));
-    if (n < 0) pid = 0;
-  }
-  close(fd);
-  if (pid == 0) return 0;
-  if (RJ_signal(host, pid, 0) == 0) {
-    dbgpnt("process is alive --> %s:%d\n", host, pid);
-    return 1;
-  }
-  dbgpnt("process is DEAD --> %s:%d\n", host, pid);
-  return 0;
-}
-
 bool on_this_host(const Dev* dev) { return rj_dev_is_this_host(dev); }
 
 // States in which the job's group leaves the task file.
 bool job_is_over(const Job* job) {
   const Text& state = job->status;
   return state.is("aborted") || state.is("failed") || state.is("finished") || state.is("restarted");
-}
-
-void status_file_path(char* out, size_t size, const char* host) {
-  snprintf(out, size, "%s/TSKSTAT/%s", rndctl.location.or_else("."), host);
 }
 
 // Reads a status file whole: lines "%s %d %d %s" (job name, job index,
@@ -75,8 +49,8 @@ struct StatusLine {
 };
 
 bool read_status_file(const char* host, std::vector<StatusLine>* lines) {
-  char path[4096];
-  status_file_path(path, sizeof path, host);
+  const std::string path_text = rj_tskstat_path(host);
+  const char* path = path_text.c_str();
   int fd = open(path, O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
   if (fd < 0) return false;
   std::string text;
@@ -164,7 +138,8 @@ int Task_file_check(Job* job) {
       for (TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
         rec->retries = 0;
         if ((rec->status == TASK_RUNNING || rec->status == TASK_STARTED) && rec->dev != nullptr &&
-            rec->dev->host_name.c_str() != nullptr && !daemon_alive(rec->dev->host_name.c_str())) {
+            rec->dev->host_name.c_str() != nullptr &&
+            Pidfile_probe(rec->dev->host_name.c_str()) == 0) {
           rec->status = TASK_PENDING;
           set_back = 1;
           dbgpnt("set job pending failed daemon on \"%s\"\n", rec->dev->host_name.c_str());
@@ -184,14 +159,12 @@ int Task_file_check(Job* job) {
 void Task_update_status() {
   const char* host = rndctl.host.c_str();
   if (host == nullptr) return;
-  char dir[4096];
-  snprintf(dir, sizeof dir, "%s/TSKSTAT", rndctl.location.or_else("."));
-  if (mkdir(dir, 0775) != 0 && errno != EEXIST) {
+  if (mkdir(rj_tskstat_dir().c_str(), 0775) != 0 && errno != EEXIST) {
     perror("in Task_update_status");
     return;
   }
-  char path[4096];
-  status_file_path(path, sizeof path, host);
+  const std::string path_text = rj_tskstat_path(host);
+  const char* path = path_text.c_str();
   // The control directory is writable by every user of the farm: refuse to
   // follow a link planted where the file should be.
   int fd = open(path, O_RDWR | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0666);
