@@ -21,7 +21,7 @@ constexpr int kDevEntryTag = 122;
 // Each list keeps its last entry in the owner, so that an append is one
 // step: the reader appends every search path, resource and job of a file,
 // and walking to the end for each made a job of 200,000 search paths take
-// half a minute to read, under the lock.  append and unlink are the only
+// half a minute to read, under the lock.  append and unlink_entry are the only
 // places that change a list's links, and they keep the tail right.
 template <class E>
 void append(E*& head, E*& tail, E* entry) {
@@ -35,7 +35,7 @@ void append(E*& head, E*& tail, E* entry) {
 }
 
 template <class E>
-void unlink(E*& head, E*& tail, E* entry) {
+void unlink_entry(E*& head, E*& tail, E* entry) {
   if (entry->prev != nullptr)
     entry->prev->next = entry->next;
   else if (head == entry)
@@ -50,7 +50,7 @@ void unlink(E*& head, E*& tail, E* entry) {
 // Takes one entry out of a resource's job list and frees it; the other half
 // of the pair is left to the caller.
 void drop_job_entry(Dev* dev, RndJobList* entry) {
-  unlink(dev->jobs, dev->jobs_tail, entry);
+  unlink_entry(dev->jobs, dev->jobs_tail, entry);
   if (entry->mirror != nullptr) entry->mirror->mirror = nullptr;
   entry->mirror = nullptr;
   entry->picked = -1;
@@ -58,7 +58,7 @@ void drop_job_entry(Dev* dev, RndJobList* entry) {
 }
 
 void drop_dev_entry(Job* job, RndDevList* entry) {
-  unlink(job->resources, job->resources_tail, entry);
+  unlink_entry(job->resources, job->resources_tail, entry);
   if (entry->mirror != nullptr) entry->mirror->mirror = nullptr;
   entry->mirror = nullptr;
   entry->picked = -1;
@@ -182,7 +182,7 @@ void RndPathList_del(Job* job, const char* path) {
   if (job == nullptr) return;
   for (RndPathList* e = job->searchpath; e != nullptr; e = e->next) {
     if (rj_strcmp(e->path.c_str(), path) == 0) {
-      unlink(job->searchpath, job->searchpath_tail, e);
+      unlink_entry(job->searchpath, job->searchpath_tail, e);
       MA_delete(e, __LINE__, kUnit);
       return;
     }

@@ -79,7 +79,7 @@ bool Task_same_rec(const TaskRec* own, const TaskRec* file_rec) {
   return std::fabs(a - b) <= 2e-6 + 1e-7 * std::fabs(a);
 }
 
-void TaskAfterLock::kill(int pid) {
+void TaskAfterLock::kill_later(int pid) {
   if (pid >= 2) kills.push_back(pid);
 }
 
@@ -111,7 +111,7 @@ void Task_let_go(TASK* entry, TaskAfterLock* after) {
   if (entry == nullptr) return;
   if (entry->pid >= 2) {
     if (after != nullptr) {
-      after->kill(entry->pid);
+      after->kill_later(entry->pid);
     } else {
       kill_here(entry->pid);
     }

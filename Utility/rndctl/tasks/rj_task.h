@@ -35,7 +35,7 @@ int Task_judge_exits();
 struct TaskAfterLock {
   std::vector<int> kills;
   std::vector<Job*> wakes;  // non-owning; each job once
-  void kill(int pid);
+  void kill_later(int pid);
   void wake(Job* job);
   /// Kills, then wakes.  Call only without the task file's lock.
   void run();
