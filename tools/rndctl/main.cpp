@@ -6,6 +6,9 @@
 
 #include "tools/rndctl/commands.h"
 #include "tools/rndctl/editor_side.h"
+#if defined(RNDCTL_SERVE)
+#include "tools/rndctl/serve.h"
+#endif
 
 int main(int argc, char** argv) {
   PrgName = "rndctl";
@@ -103,6 +106,13 @@ int main(int argc, char** argv) {
   watch->add_option("--interval", interval, "milliseconds between looks at the files")
       ->check(CLI::Range(50, 10000));
   watch->callback([&] { result = Cmd_watch(interval); });
+
+#if defined(RNDCTL_SERVE)
+  std::string listen = "127.0.0.1:8470";
+  auto* serve = app.add_subcommand("serve", "the farm's status page in a browser (read-only)");
+  serve->add_option("--listen", listen, "address and port to listen on")->capture_default_str();
+  serve->callback([&] { result = Cmd_serve(listen); });
+#endif
 
   // The control block must be set up before any callback runs.
   app.parse_complete_callback([&] { Ctl_open(location.empty() ? nullptr : location.c_str()); });
