@@ -1,7 +1,9 @@
 #include "tools/rndctl/serve.h"
 
 #include <dirent.h>
+#include <netinet/in.h>
 #include <signal.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
 
 #include <atomic>
@@ -45,6 +47,31 @@ std::string newest_with(const std::string& dir, const std::string& prefix) {
   }
   closedir(d);
   return best;
+}
+
+// The library listens with a backlog of 5: a burst of page loads (ten
+// screens reconnecting after a restart) would see stalled connects.  On
+// Linux a second listen() on the listening socket only widens the backlog;
+// the library hands out no descriptor, so it is found by its port.
+void widen_backlog(int port) {
+  DIR* d = opendir("/proc/self/fd");
+  if (d == nullptr) return;
+  while (struct dirent* e = readdir(d)) {
+    int fd = atoi(e->d_name);
+    if (fd <= 2 || fd == dirfd(d)) continue;
+    sockaddr_storage a{};
+    socklen_t len = sizeof a;
+    int listening = 0;
+    socklen_t ll = sizeof listening;
+    if (getsockname(fd, reinterpret_cast<sockaddr*>(&a), &len) != 0 ||
+        getsockopt(fd, SOL_SOCKET, SO_ACCEPTCONN, &listening, &ll) != 0 || listening == 0)
+      continue;
+    int p = a.ss_family == AF_INET    ? ntohs(reinterpret_cast<sockaddr_in*>(&a)->sin_port)
+            : a.ss_family == AF_INET6 ? ntohs(reinterpret_cast<sockaddr_in6*>(&a)->sin6_port)
+                                      : -1;
+    if (p == port) (void)listen(fd, SOMAXCONN);
+  }
+  closedir(d);
 }
 
 // Bytes of a file that need not be UTF-8 made safe for a JSON text.
@@ -95,6 +122,13 @@ void serve_frame(const ServeSnapshot& snap, int index, const std::string& name,
 
 void routes(httplib::Server& svr, const ServeState& state) {
   svr.set_pre_routing_handler([](const httplib::Request& req, httplib::Response& res) {
+    // The library reads no body of a GET: the size is judged from the header.
+    if (req.has_header("Content-Length") &&
+        strtoull(req.get_header_value("Content-Length").c_str(), nullptr, 10) > kBodyLimit) {
+      res.status = 413;
+      res.set_content("{\"error\":\"request too large\"}", kJson);
+      return httplib::Server::HandlerResponse::Handled;
+    }
     if (req.method != "GET" && req.method != "HEAD") {
       res.status = 405;
       res.set_content("{\"error\":\"read-only\"}", kJson);
@@ -205,6 +239,7 @@ int Cmd_serve(const std::string& listen) {
     pthread_sigmask(SIG_SETMASK, &old, nullptr);
     return 1;
   }
+  widen_backlog(port);
   printf("rndctl: serving %s read-only on http://%s:%d/\n", rndctl.location.or_else("."),
          addr.find(':') != std::string::npos ? ("[" + addr + "]").c_str() : addr.c_str(), port);
   fflush(stdout);
