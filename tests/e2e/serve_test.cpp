@@ -199,9 +199,10 @@ TEST_F(ServeTest, FramesAreServedOnlyAsPngFromTheJobsDirectory) {
       {"/" + std::string(20000, 'a'), 414},
   };
   for (const auto& [path, want] : refused) EXPECT_EQ(s.status(path), want) << path.substr(0, 60);
-  EXPECT_EQ(raw_status(s.port, "GET /api/jobs HTTP/1.1\r\nHost: x\r\nContent-Length: 1048576\r\n\r\n" +
-                                    std::string(1 << 20, 'x')),
-            413);
+  EXPECT_EQ(
+      raw_status(s.port, "GET /api/jobs HTTP/1.1\r\nHost: x\r\nContent-Length: 1048576\r\n\r\n" +
+                             std::string(1 << 20, 'x')),
+      413);
   EXPECT_EQ(s.client().Post("/api/jobs", "x", "text/plain")->status, 405);
   EXPECT_EQ(s.status("/api/jobs"), 200);
 }
@@ -238,8 +239,8 @@ std::string browse(const std::string& browser, const std::string& url, const std
                    const std::string& profile) {
   std::string cmd = browser +
                     " --headless --no-sandbox --disable-gpu --no-first-run --user-data-dir='" +
-                    profile + "' --virtual-time-budget=5000 --window-size=1280,900 " + what +
-                    " '" + url + "' 2>/dev/null";
+                    profile + "' --virtual-time-budget=5000 --window-size=1280,900 " + what + " '" +
+                    url + "' 2>/dev/null";
   std::string out;
   FILE* p = popen(cmd.c_str(), "r");
   if (p == nullptr) return out;
@@ -253,8 +254,7 @@ std::string browse(const std::string& browser, const std::string& url, const std
 // The progress shown in the jobs table's row of job `index`, or -1.
 double shown_progress(const std::string& dom, int index) {
   std::smatch m;
-  std::regex row("<tr data-job=\"" + std::to_string(index) +
-                 "\">.*?aria-valuenow=\"([0-9.]+)\"");
+  std::regex row("<tr data-job=\"" + std::to_string(index) + "\">.*?aria-valuenow=\"([0-9.]+)\"");
   return std::regex_search(dom, m, row) ? std::stod(m[1]) : -1;
 }
 

@@ -26,6 +26,7 @@ th{color:#99a;font-weight:normal}
 .strip img{height:90px;margin:2px;background:#000}
 pre{background:#0d0f11;padding:6px;max-height:240px;overflow:auto;white-space:pre-wrap}
 #problem{color:#f77}
+pre:empty{display:none}
 </style></head>
 <body>
 <header><h1><a href="#">render farm</a></h1><span id="problem"></span><span id="seen"></span></header>

@@ -1,6 +1,7 @@
 #include "tools/rndctl/serve.h"
 
 #include <dirent.h>
+#include <httplib.h>
 #include <netinet/in.h>
 #include <signal.h>
 #include <sys/socket.h>
@@ -10,7 +11,6 @@
 #include <condition_variable>
 #include <cstdio>
 #include <cstring>
-#include <httplib.h>
 #include <nlohmann/json.hpp>
 #include <thread>
 
@@ -89,12 +89,12 @@ bool job_of(const httplib::Request& req, const ServeSnapshot& snap, int* index) 
   long n = strtol(req.matches[1].str().c_str(), &end, 10);
   if (*end != '\0' || n < 0 || n > 1000000000) return false;
   *index = static_cast<int>(n);
-  return snap.files.count(*index) != 0;
+  return snap.jobs->files.count(*index) != 0;
 }
 
 void job_detail(const ServeSnapshot& snap, int index, httplib::Response& res) {
-  const ServeJobFiles& files = snap.files.at(index);
-  std::string out = snap.job_detail.at(index);
+  const ServeJobFiles& files = snap.jobs->files.at(index);
+  std::string out = snap.jobs->detail.at(index);
   // The detail object is closed by its last '}': the file parts go before it.
   out.pop_back();
   out += ",\"log\":" + valid_utf8(State_tail(files.log_path, kLogTail));
@@ -115,7 +115,7 @@ void job_detail(const ServeSnapshot& snap, int index, httplib::Response& res) {
 void serve_frame(const ServeSnapshot& snap, int index, const std::string& name,
                  httplib::Response& res) {
   std::string png;
-  if (!State_frame_bytes(snap.files.at(index), name, &png)) return not_found(res);
+  if (!State_frame_bytes(snap.jobs->files.at(index), name, &png)) return not_found(res);
   res.set_header("Cache-Control", "no-cache");
   res.set_content(png, "image/png");
 }
@@ -146,7 +146,7 @@ void routes(httplib::Server& svr, const ServeState& state) {
     res.set_content(Page_html(), "text/html; charset=utf-8");
   });
   svr.Get("/api/jobs", [&state](const httplib::Request&, httplib::Response& res) {
-    res.set_content(State_current(state)->jobs, kJson);
+    res.set_content(State_current(state)->jobs->json, kJson);
   });
   svr.Get("/api/hosts", [&state](const httplib::Request&, httplib::Response& res) {
     res.set_content(State_current(state)->hosts, kJson);
@@ -168,7 +168,7 @@ void routes(httplib::Server& svr, const ServeState& state) {
             int index = 0;
             if (!job_of(req, *snap, &index)) return not_found(res);
             std::string newest;
-            (void)State_frames(snap->files.at(index), &newest);
+            (void)State_frames(snap->jobs->files.at(index), &newest);
             if (newest.empty()) return not_found(res);
             serve_frame(*snap, index, newest, res);
           });

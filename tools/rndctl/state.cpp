@@ -127,10 +127,8 @@ nlohmann::json host_status(const std::string& host) {
     char job[256], output[1024];
     int index = 0, status = 0;
     if (sscanf(line.c_str(), "%255s %d %d %1023s", job, &index, &status, output) != 4) continue;
-    out.push_back({{"job", job},
-                   {"index", index},
-                   {"status", GetTaskStatusStr(status)},
-                   {"output", output}});
+    out.push_back(
+        {{"job", job}, {"index", index}, {"status", GetTaskStatusStr(status)}, {"output", output}});
   }
   return out;
 }
@@ -210,6 +208,12 @@ bool State_refresh(ServeState* state) {
     now[i] = State_stamp(location() + "/" + kControl[i]);
     if (!(now[i] == state->control[i])) control = true;
   }
+  std::map<std::string, ServeStamp> around =
+      control ? std::map<std::string, ServeStamp>{} : around_stamps();
+  time_t t = time(nullptr);
+  bool hosts = control || around != state->around || t - state->hosts_built >= kHostsEvery;
+  // The usual look: nothing moved, nothing copied.
+  if (!hosts) return false;
   auto next = std::make_shared<ServeSnapshot>(*old);
   if (control) {
     std::string why;
@@ -230,26 +234,24 @@ bool State_refresh(ServeState* state) {
     state->loaded = true;
     state->loads++;
     std::copy(now, now + 3, state->control);
+    auto part = std::make_shared<ServeJobs>();
     nlohmann::json jobs = nlohmann::json::array();
-    next->job_detail.clear();
-    next->files.clear();
     for (const Job* j = rndctl.jobs; j != nullptr; j = j->next) {
       jobs.push_back(job_json(j, nullptr));
-      next->job_detail[j->index] = job_json(j, state->tasks.get()).dump();
-      next->files[j->index] = job_files(j, *state->tasks);
+      part->detail[j->index] = job_json(j, state->tasks.get()).dump();
+      part->files[j->index] = job_files(j, *state->tasks);
     }
-    next->jobs = jobs.dump();
+    part->json = jobs.dump();
+    if (part->json != old->jobs->json || part->detail != old->jobs->detail) next->jobs = part;
     next->problem.clear();
+    around = around_stamps();  // the host list may have changed with the load
   }
-  std::map<std::string, ServeStamp> around = around_stamps();
-  time_t t = time(nullptr);
-  if (state->tasks && (control || around != state->around || t - state->hosts_built >= kHostsEvery)) {
+  if (state->tasks) {
     state->around = std::move(around);
     state->hosts_built = t;
     next->hosts = hosts_json(*state->tasks);
   }
-  if (next->jobs == old->jobs && next->hosts == old->hosts && next->job_detail == old->job_detail &&
-      next->problem == old->problem)
+  if (next->jobs == old->jobs && next->hosts == old->hosts && next->problem == old->problem)
     return false;
   next->generation = old->generation + 1;
   std::lock_guard<std::mutex> hold(state->mu);
@@ -272,9 +274,9 @@ std::vector<std::string> State_frames(const ServeJobFiles& files, std::string* n
     struct stat st;
     if (fd.fd < 0 || fstat(fd.fd, &st) != 0 || !S_ISREG(st.st_mode) || !png_head(fd.fd)) continue;
     found.emplace_back(number, name);
-    if (newest != nullptr && (st.st_mtim.tv_sec > latest.tv_sec ||
-                              (st.st_mtim.tv_sec == latest.tv_sec &&
-                               st.st_mtim.tv_nsec >= latest.tv_nsec))) {
+    if (newest != nullptr &&
+        (st.st_mtim.tv_sec > latest.tv_sec ||
+         (st.st_mtim.tv_sec == latest.tv_sec && st.st_mtim.tv_nsec >= latest.tv_nsec))) {
       latest = st.st_mtim;
       *newest = name;
     }
@@ -314,7 +316,8 @@ std::string State_tail(const std::string& path, size_t max_bytes) {
   CloseFd fd{open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK)};
   struct stat st;
   if (fd.fd < 0 || fstat(fd.fd, &st) != 0 || !S_ISREG(st.st_mode)) return "";
-  off_t from = st.st_size > static_cast<off_t>(max_bytes) ? st.st_size - static_cast<off_t>(max_bytes) : 0;
+  off_t from =
+      st.st_size > static_cast<off_t>(max_bytes) ? st.st_size - static_cast<off_t>(max_bytes) : 0;
   std::string text(static_cast<size_t>(st.st_size - from), '\0');
   ssize_t n = pread(fd.fd, text.data(), text.size(), from);
   text.resize(n > 0 ? static_cast<size_t>(n) : 0);

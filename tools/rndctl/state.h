@@ -39,13 +39,19 @@ struct ServeJobFiles {
   std::vector<Running> running;
 };
 
+/// What a load of the control files gives; shared by the snapshots until
+/// the next load (a large queue's texts are not copied for a host change).
+struct ServeJobs {
+  std::string json;                    // JSON array
+  std::map<int, std::string> detail;   // JSON object per job index
+  std::map<int, ServeJobFiles> files;  // per job index
+};
+
 struct ServeSnapshot {
   uint64_t generation = 0;
-  std::string jobs;                         // JSON array
-  std::string hosts;                        // JSON array
-  std::map<int, std::string> job_detail;    // JSON object per job index
-  std::map<int, ServeJobFiles> files;       // per job index
-  std::string problem;                      // why the last load failed, or ""
+  std::shared_ptr<const ServeJobs> jobs = std::make_shared<ServeJobs>();
+  std::string hosts = "[]";  // JSON array
+  std::string problem;       // why the last load failed, or ""
 };
 
 struct ServeStamp {
