@@ -29,6 +29,9 @@ fi
 have_pkg libcli11-dev || need+=(libcli11-dev)
 have_pkg nlohmann-json3-dev || need+=(nlohmann-json3-dev)
 have_cmd tmux || need+=(tmux)
+# Its status page server, and the browser its page test loads it in.
+have_pkg libcpp-httplib-dev || need+=(libcpp-httplib-dev)
+have_cmd chromium || need+=(chromium)
 if [ "${RJ_NEED_CLANG:-0}" = 1 ]; then
   have_cmd clang++ || need+=(clang)
   have_pkg libclang-rt-dev || have_pkg libclang-rt-14-dev || need+=(libclang-rt-dev)

@@ -7,6 +7,9 @@
 
 #include "tools/rndctl/commands.h"
 #include "tools/rndctl/editor_side.h"
+#if defined(RNDCTL_SERVE)
+#include "tools/rndctl/serve.h"
+#endif
 
 namespace {
 
@@ -21,6 +24,7 @@ struct Parsed {
   double timeout = 120;
   int task = -1;
   int interval = 500;
+  std::string listen = "127.0.0.1:8470";
 };
 
 void add_json(CLI::App* c, Parsed& p) { c->add_flag("--json", p.json, "print JSON"); }
@@ -115,6 +119,12 @@ void add_farm_commands(CLI::App& app, Parsed& p) {
   watch->add_option("--interval", p.interval, "milliseconds between looks at the files")
       ->check(CLI::Range(50, 10000));
   watch->callback([&p] { p.result = Cmd_watch(p.interval); });
+
+#if defined(RNDCTL_SERVE)
+  auto* serve = app.add_subcommand("serve", "the farm's status page in a browser (read-only)");
+  serve->add_option("--listen", p.listen, "address and port to listen on")->capture_default_str();
+  serve->callback([&p] { p.result = Cmd_serve(p.listen); });
+#endif
 }
 
 }  // namespace
