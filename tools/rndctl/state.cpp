@@ -55,16 +55,6 @@ std::string schedule_text(const int* grid) {
   return text;
 }
 
-// The project directory of a scene, as the daemon finds it: everything
-// before the character ahead of the first "sdl".
-bool project_dir(const char* sdl, std::string* dir) {
-  if (sdl == nullptr) return false;
-  const char* hit = strstr(sdl, "sdl");
-  if (hit == nullptr || hit == sdl) return false;
-  dir->assign(sdl, static_cast<size_t>(hit - sdl - 1));
-  return true;
-}
-
 ServeJobFiles job_files(const Job* job, const CtlTasks& tasks) {
   ServeJobFiles f;
   f.log_path = location() + "/JOBLOG/" + RJC_label_form(job->name.c_str());
@@ -75,7 +65,7 @@ ServeJobFiles job_files(const Job* job, const CtlTasks& tasks) {
   f.base = slash == std::string::npos ? pix : pix.substr(slash + 1);
   // A relative path is the render program's, which runs in the project.
   std::string project;
-  if (dir[0] != '/' && project_dir(job->sdl.c_str(), &project)) dir = project + "/" + dir;
+  if (dir[0] != '/' && rj_project_dir_of(job->sdl.c_str(), &project)) dir = project + "/" + dir;
   f.out_dir = dir;
   for (const TaskGroup* g = tasks.groups; g != nullptr; g = g->next) {
     if (g->job == nullptr || g->job->index != job->index) continue;

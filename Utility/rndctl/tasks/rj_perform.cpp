@@ -59,21 +59,10 @@ std::vector<char*> c_array(std::vector<std::string>& texts) {
   return array;
 }
 
-// The project directory of a scene path: everything before the character
-// that precedes the first "sdl" ("/proj/sdl/a.sdl" -> "/proj").  A path that
-// starts with "sdl" or holds none names no directory to change to.
-bool project_dir_of(const char* sdl, std::string* dir) {
-  if (sdl == nullptr) return false;
-  const char* hit = strstr(sdl, "sdl");
-  if (hit == nullptr || hit == sdl) return false;
-  dir->assign(sdl, static_cast<size_t>(hit - sdl - 1));
-  return true;
-}
-
 // The directory a job's render program runs in: its project directory when
 // that exists, else (false) wherever the daemon is.
 bool render_dir_of(const Job* job, std::string* dir) {
-  if (job == nullptr || !project_dir_of(job->sdl.c_str(), dir)) return false;
+  if (job == nullptr || !rj_project_dir_of(job->sdl.c_str(), dir)) return false;
   struct stat st;
   return stat(dir->c_str(), &st) == 0 && S_ISDIR(st.st_mode);
 }
@@ -283,4 +272,12 @@ void daemon_kill_running_tasks(const char* host) {
     if (entry->rec == nullptr || !rj_dev_on_host(entry->rec->dev, host)) continue;
     rj_kill_render(host, entry->pid, 9);
   }
+}
+
+bool rj_project_dir_of(const char* sdl, std::string* dir) {
+  if (sdl == nullptr) return false;
+  const char* hit = strstr(sdl, "sdl");
+  if (hit == nullptr || hit == sdl) return false;
+  dir->assign(sdl, static_cast<size_t>(hit - sdl - 1));
+  return true;
 }

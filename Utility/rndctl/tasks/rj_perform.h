@@ -62,3 +62,10 @@ void rj_set_paths(Job* job, char** path, char** root);
 
 /// Kills (signal 9) the render of every entry whose resource is on `host`.
 void daemon_kill_running_tasks(const char* host);
+
+/// The project directory of a scene path: everything before the character
+/// that precedes the first "sdl" ("/proj/sdl/a.sdl" -> "/proj"), where a
+/// job's render program runs and relative output paths start.  False (and
+/// `dir` untouched) for a null path or one that starts with "sdl" or holds
+/// none.
+bool rj_project_dir_of(const char* sdl, std::string* dir);
