@@ -115,13 +115,21 @@ bool edit_job_file(Farm& farm, const std::string& from, const std::string& to,
 
 bool set_job_status(Farm& farm, const std::string& job, const std::string& status,
                     const std::string& host) {
-  for (int attempt = 0; attempt < 100; ++attempt) {
-    std::string block = job_block(farm, job);
-    size_t at = block.find("\tstatus \t\t= \"");
-    if (at == std::string::npos) return false;
-    size_t end = block.find(";\n", at);
-    std::string line = block.substr(at, end - at);
-    if (edit_job_file(farm, line, "\tstatus \t\t= \"" + status + "\"", host)) return true;
+  // The status line is looked for inside the job's own block: another job
+  // may show the very same line.
+  const std::string key = "\tstatus \t\t= \"";
+  if (!take_lock(farm, "Render_Job_Control")) return false;
+  std::string text = farm.read("Render_Job_Control");
+  size_t block = text.find("\n" + job + " ");
+  size_t at = block == std::string::npos ? block : text.find(key, block);
+  size_t end = at == std::string::npos ? at : text.find(";\n", at);
+  bool found = end != std::string::npos;
+  if (found) {
+    text.replace(at, end - at, key + status + "\"");
+    farm.write("Render_Job_Control", text);
   }
-  return false;
+  drop_lock(farm, "Render_Job_Control");
+  std::string pid_file = farm.path(host + ".pid");
+  utimensat(AT_FDCWD, pid_file.c_str(), nullptr, 0);
+  return found;
 }

@@ -311,10 +311,13 @@ TEST_F(RndctlFarmTest, RestartRendersEveryFrameExactlyOnceOnTwoHosts) {
   ASSERT_EQ(r.status, 0) << r.out;
   long long restarted_ns = wall_ns();
   ASSERT_TRUE(finished(120)) << farm_.read("Render_Tasks");
+  // The restart returns once no render of the old life runs: every frame
+  // that ends afterwards is of the new life (one may have begun just before
+  // the tool returned), and a killed render leaves no stamp.
   std::map<int, int> again;
   std::map<std::string, int> by_host;
   for (const Stamp& s : stamps()) {
-    if (s.start_ns < restarted_ns) continue;
+    if (s.end_ns < restarted_ns) continue;
     again[static_cast<int>(s.frame)]++;
     by_host[s.host]++;
   }
