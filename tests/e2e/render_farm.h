@@ -8,12 +8,12 @@
 #include "tests/e2e/e2e_support.h"
 
 struct ResourceSpec {
-  std::string name;  // also the host name
+  std::string name{};  // also the host name
   int index = 1;
   int max_frames = 3;
   int num_processors = 2;
   std::string status = "AVAILABLE";
-  std::string locks;  // e.g. "\t{ 800 to 1700 Monday }"
+  std::string locks{};  // e.g. "\t{ 800 to 1700 Monday }"
 };
 
 struct JobSpec {
@@ -22,10 +22,10 @@ struct JobSpec {
   int priority = 0;
   std::string status = "pending";
   float start = 1, end = 6, by = 1;
-  std::string opts;  // the render program's options argument
-  std::vector<std::string> hosts;
-  std::string ctrl;  // "SCHEDULE", "PAUSED", ... or empty
-  std::string runs;  // e.g. "\t{ 800 to 900 Monday }"
+  std::string opts{};  // the render program's options argument
+  std::vector<std::string> hosts{};
+  std::string ctrl{};  // "SCHEDULE", "PAUSED", ... or empty
+  std::string runs{};  // e.g. "\t{ 800 to 900 Monday }"
   bool save_out = false;
   std::string executable = "frame_painter";
 };
