@@ -6,6 +6,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdlib>
 #include <string>
 
@@ -13,12 +14,6 @@
 #include "tests/support/task_text.h"
 
 namespace {
-
-int count_of(const std::string& text, const std::string& needle) {
-  int n = 0;
-  for (size_t at = text.find(needle); at != std::string::npos; at = text.find(needle, at + 1)) ++n;
-  return n;
-}
 
 class ReclaimTest : public TaskFixture {
  protected:
@@ -34,8 +29,7 @@ class ReclaimTest : public TaskFixture {
     rj_render_kill_leftovers();  // forgets whatever a test registered
     TaskFixture::TearDown();
   }
-  // Ages are taken against `now` when given, so that a second that passes
-  // during the test does not shift them.
+  // Against `now` when given, so that a second passing in the test shifts nothing.
   void set_age(const std::string& name, time_t seconds, time_t now = 0) {
     if (now == 0) now = time(nullptr);
     struct timespec t[2] = {{now - seconds, 0}, {now - seconds, 0}};
@@ -44,10 +38,8 @@ class ReclaimTest : public TaskFixture {
   // A child in its own process group that waits to be killed.
   static pid_t sleeper() {
     pid_t pid = fork();
-    if (pid == 0) {
-      setpgid(0, 0);
-      for (;;) pause();
-    }
+    if (pid == 0)
+      for (setpgid(0, 0);;) pause();
     setpgid(pid, pid);
     return pid;
   }
@@ -78,10 +70,9 @@ TEST_P(ReclaimPutBack, CutsAtTheFrameReachedKeepingRetries) {
   rec->retries = 3;
   Task_put_back(&groups, groups, rec);
   std::string got;
-  for (TaskRec* r = groups->tasks; r != nullptr; r = r->next) {
+  for (TaskRec* r = groups->tasks; r != nullptr; r = r->next)
     got += rec_line(r->id, r->start, r->end, r->current, r->dev ? r->dev->index : 0, r->retries,
                     GetTaskStatusStr(r->status));
-  }
   EXPECT_EQ(got, GetParam().expected);
   TaskGroup_free_all(&groups);
 }
@@ -117,35 +108,23 @@ TEST_F(ReclaimTest, AnotherHostsTaskIsPutBackOnlyWhenItsHeartbeatIsOldAndItsDaem
   chmod(path("fake_rsh").c_str(), 0755);
   setenv("ZARNO_RSH", path("fake_rsh").c_str(), 1);
   mkdir(path("TSKSTAT").c_str(), 0775);
-  std::string name = job_->name.c_str();
-  std::string held = group_line(name, 1, 1, 1) + rec_line(0, 1, 4, 1, 2, 0, "STARTED");
-  struct Case {
-    const char* label;
-    long heartbeat_age;  // -1: no heartbeat file
-    bool daemon_alive;
-    bool put_back;
-  } cases[] = {
-      {"young heartbeat", 30, false, false},
-      {"no heartbeat file", -1, false, false},
-      {"old heartbeat, daemon alive", 3600, true, false},
-      {"old heartbeat, daemon gone", 3600, false, true},
-  };
+  std::string name = job_->name.c_str(),
+              held = group_line(name, 1, 1, 1) + rec_line(0, 1, 4, 1, 2, 0, "STARTED");
   time_t now = time(nullptr);
-  for (const Case& c : cases) {
+  int32_t me = getpid();
+  // Heartbeat age (-1: no heartbeat file), whether the daemon lives, whether put back.
+  for (auto [age, alive, put_back] : {std::tuple{30, false, false},
+                                      {-1, false, false},
+                                      {3600, true, false},
+                                      {3600, false, true}}) {
     write_file("Render_Tasks", held);
     unlink(path("TSKSTAT/farhost").c_str());
-    if (c.heartbeat_age >= 0) {
-      write_file("TSKSTAT/farhost", "");
-      set_age("TSKSTAT/farhost", c.heartbeat_age, now);
-    }
     unlink(path("farhost.pid").c_str());
-    if (c.daemon_alive) {
-      int32_t me = getpid();
-      write_file("farhost.pid", std::string(reinterpret_cast<const char*>(&me), sizeof me));
-    }
-    EXPECT_EQ(Task_reclaim_dead_hosts(now), c.put_back ? 1 : 0) << c.label;
-    EXPECT_EQ(read_file("Render_Tasks").find("STARTED") == std::string::npos, c.put_back)
-        << c.label;
+    if (age >= 0) write_file("TSKSTAT/farhost", "");
+    if (age >= 0) set_age("TSKSTAT/farhost", age, now);
+    if (alive) write_file("farhost.pid", std::string(reinterpret_cast<const char*>(&me), 4));
+    EXPECT_EQ(Task_reclaim_dead_hosts(now), put_back ? 1 : 0) << age << alive;
+    EXPECT_EQ(read_file("Render_Tasks").find("STARTED") == std::string::npos, put_back) << age;
   }
   std::string access = read_file("Render_Access");
   const std::string line = "put back task 0 of \"" + name + "\" from host farhost: ";
@@ -177,12 +156,12 @@ TEST_F(ReclaimTest, RegistryKillsOnlyTheRendersItRecordedAndIgnoresAPlantedLink)
   struct stat st;
   ASSERT_EQ(lstat(rj_render_registry_path(), &st), 0);
   EXPECT_TRUE(S_ISREG(st.st_mode));
-  EXPECT_EQ(count_of(both, "\n"), 2) << both;
+  EXPECT_EQ(std::count(both.begin(), both.end(), '\n'), 2) << both;
 
   // A line that names a live process under another start time: its pid was
   // reused, the process is not ours.
-  std::string text = read_text_file(rj_render_registry_path());
-  write_text_file(rj_render_registry_path(), text + std::to_string(other) + " 1\n");
+  write_text_file(rj_render_registry_path(),
+                  read_text_file(rj_render_registry_path()) + std::to_string(other) + " 1\n");
   EXPECT_EQ(rj_render_kill_leftovers(), 1);
   EXPECT_TRUE(killed(render));
   EXPECT_EQ(waitpid(other, nullptr, WNOHANG), 0) << "a reused pid was killed";
@@ -198,10 +177,10 @@ TEST_F(ReclaimTest, RegistryKillsOnlyTheRendersItRecordedAndIgnoresAPlantedLink)
 }
 
 TEST(UpdateTimeSettled, AWholeSecondStampWaitsForTheServersNextSecond) {
-  const int64_t second = 1000000000;
-  EXPECT_TRUE(rj_update_time_settled(1700000000 * second + 123, 1700000000));
-  EXPECT_FALSE(rj_update_time_settled(1700000000 * second, 1700000000));
-  EXPECT_TRUE(rj_update_time_settled(1700000000 * second, 1700000001));
+  const int64_t stamp = 1700000000 * int64_t{1000000000};
+  EXPECT_TRUE(rj_update_time_settled(stamp + 123, 1700000000));
+  EXPECT_FALSE(rj_update_time_settled(stamp, 1700000000));
+  EXPECT_TRUE(rj_update_time_settled(stamp, 1700000001));
   EXPECT_TRUE(rj_update_time_settled(0, 1700000000));
 }
 
