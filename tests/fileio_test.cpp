@@ -19,10 +19,6 @@ namespace {
 
 using Names = std::vector<std::string>;
 
-bool exists(const std::string& p) {
-  struct stat st;
-  return lstat(p.c_str(), &st) == 0;
-}
 mode_t mode_of(const std::string& p) {
   struct stat st;
   return stat(p.c_str(), &st) == 0 ? st.st_mode & 07777 : 0;
@@ -57,10 +53,7 @@ class FileopTest : public ControlDirTest {
   }
   void TearDown() override {
     fileop_release_held_locks();
-    fileop_poll_seconds = saved_poll_;
-    fileop_sleep = saved_sleep_;
-    fileop_monotonic_ns = saved_mono_;
-    fileop_server_clock = saved_server_;
+    std::tie(fileop_poll_seconds, fileop_sleep, fileop_monotonic_ns, fileop_server_clock) = saved_;
     debug_fileacc = 0;
     ControlDirTest::TearDown();
   }
@@ -84,10 +77,8 @@ class FileopTest : public ControlDirTest {
     return names;
   }
 
-  unsigned saved_poll_ = fileop_poll_seconds;
-  void (*saved_sleep_)(int64_t) = fileop_sleep;
-  int64_t (*saved_mono_)() = fileop_monotonic_ns;
-  time_t (*saved_server_)() = fileop_server_clock;
+  const std::tuple<unsigned, void (*)(int64_t), int64_t (*)(), time_t (*)()> saved_{
+      fileop_poll_seconds, fileop_sleep, fileop_monotonic_ns, fileop_server_clock};
 };
 
 TEST_F(FileopTest, FreeLockHoldsHostFileWithPidAndReleaseRemovesBoth) {
@@ -101,15 +92,14 @@ TEST_F(FileopTest, FreeLockHoldsHostFileWithPidAndReleaseRemovesBoth) {
   EXPECT_EQ(read_file("Render_Access"), "\n\n *** Start of new process entries ***\n\n");
   // Reading a missing file makes it, empty.
   FILE* fp = read_fileop(FILE_TASKS);
-  ASSERT_NE(fp, nullptr);
-  EXPECT_EQ(fgetc(fp), EOF);
+  EXPECT_TRUE(fp != nullptr && fgetc(fp) == EOF);
   EXPECT_EQ(close_fileop(FILE_TASKS), 0);
   EXPECT_EQ(read_file("Render_Tasks"), "");
 
   long before = fileop_hold_stats(FILE_TASKS).count;
   fake_mono += 3 * kSecond / 1000;
   ASSERT_EQ(lock_fileop(FILE_TASKS, 0), 1);
-  EXPECT_FALSE(exists(lock_dir(FILE_TASKS)));
+  EXPECT_EQ(entries(), Names{"Render_Tasks"});
   EXPECT_EQ(fileop_hold_stats(FILE_TASKS).count, before + 1);
   EXPECT_GE(fileop_hold_stats(FILE_TASKS).longest_ns, 3 * kSecond / 1000);
 }
@@ -177,8 +167,8 @@ INSTANTIATE_TEST_SUITE_P(
 TEST_F(FileopTest, WaitersRacingAtAStaleLockBreakItOnceAndTakeItInTurn) {
   plant_lock(FILE_TASKS, "otherhost", "1\n");
   fake_server = kLockMade + 200;
-  fileop_sleep = saved_sleep_;  // real, short pauses: the children really wait
-  fileop_monotonic_ns = saved_mono_;
+  // Real, short pauses: the children really wait.
+  std::tie(std::ignore, fileop_sleep, fileop_monotonic_ns, std::ignore) = saved_;
   fileop_poll_seconds = 1;
   debug_fileacc = 1;
   ASSERT_EQ(init_fileop(), 1);
@@ -221,8 +211,8 @@ TEST_F(FileopTest, ReleaseRemovesOnlyLocksThisProcessHolds) {
   testing::internal::GetCapturedStdout();
   RJC_fatal_exit = saved_exit;
   EXPECT_EQ(entries(), (Names{"Render_Job_Control.lock", "Render_Resource_Control.lock"}));
-  EXPECT_TRUE(exists(lock_dir(FILE_JOBS) + "/otherhost"));
-  EXPECT_TRUE(exists(lock_dir(FILE_RESOURCES) + "/testhost"));
+  EXPECT_EQ(dir_names(lock_dir(FILE_JOBS)), Names{"otherhost"});
+  EXPECT_EQ(dir_names(lock_dir(FILE_RESOURCES)), Names{"testhost"});
 }
 
 // One rewrite through each calling shape: the classic one (read, rewind,
