@@ -232,72 +232,53 @@ TEST_F(StatusTest, FailedTaskOfThisHostsJobEndsInTheJobFileWithItsError) {
   EXPECT_NE(read_file("JOBLOG/scene.sdl").find("\t FAILED  10\n"), std::string::npos);
 }
 
-struct ErrorCase {
-  const char* label;
-  int waitstatus;
-  const char *log, *old_comment, *comment;
-};
-
-class ErrorRecord : public StatusTest, public testing::WithParamInterface<ErrorCase> {};
-
-TEST_P(ErrorRecord, ReasonPilesUpInTheComment) {
-  const ErrorCase& c = GetParam();
-  TASK* entry = entry_with_stream(2.5f, 10, "", c.log);
-  entry->waitstatus = c.waitstatus;
-  job_->comment.set(c.old_comment);
-  Job_Error_Update(entry);
-  EXPECT_STREQ(job_->comment.c_str(), c.comment);
-}
-
-// clang-format off
-INSTANTIATE_TEST_SUITE_P(Reasons, ErrorRecord, testing::Values(
-    ErrorCase{"first_error_line_wins", 1, "a\nparse error at 3\nb Error\n", nullptr, "ERROR: render1 (testhost) frame 2.5\nparse error at 3\n\n \n"},
-    ErrorCase{"last_line_when_nothing_matches", 0, "one\ntwo\n", "old\n", "old\nERROR: render1 (testhost) frame 2.5\ntwo\n\n \n"},
-    ErrorCase{"empty_log_unknown_reason", 1, "", nullptr, "ERROR: render1 (testhost) frame 2.5\nQuit for Unknown reasons\n \n"},
-    ErrorCase{"signal_reason_skips_the_log", 9, "parse error\n", nullptr, "ERROR: render1 (testhost) frame 2.5\nSIGKILL (Killed)\n\n \n"}),
-    label_of);
-// clang-format on
-
-struct StateCase {
-  const char* label;
-  std::vector<int> statuses;  // one task of frames i*2+1 .. i*2+2 each
-  const char* job_status;
-  int ctrl;
-  const char* expected;
-};
-
-class JobState : public StatusTest, public testing::WithParamInterface<StateCase> {};
-
-TEST_P(JobState, TasksDecideTheJobsStatusText) {
-  const StateCase& c = GetParam();
-  job_->status.set(c.job_status);
-  job_->ctrl = c.ctrl;
-  job_->frames[1] = static_cast<float>(c.statuses.size() * 2);
-  job_->totalframes = static_cast<int>(c.statuses.size() * 2);
-  for (size_t i = 0; i < c.statuses.size(); ++i) {
-    TASK* entry = add_entry(job_, dev_, static_cast<float>(i * 2 + 1),
-                            static_cast<float>(i * 2 + 2), c.statuses[i], static_cast<int>(i));
-    entry->rec->retries = 10;
-    if (c.statuses[i] == TASK_RUNNING) entry->progress = 50.0f;
+TEST_F(StatusTest, ErrorReasonPilesUpInTheComment) {
+  // The first error line wins, else the last line; a signal's reason skips the log.
+  // clang-format off
+  for (auto [waitstatus, log, old_comment, comment] : {
+           std::tuple<int, const char*, const char*, const char*>{1, "a\nparse error at 3\nb Error\n", nullptr, "ERROR: render1 (testhost) frame 2.5\nparse error at 3\n\n \n"},
+           {0, "one\ntwo\n", "old\n", "old\nERROR: render1 (testhost) frame 2.5\ntwo\n\n \n"},
+           {1, "", nullptr, "ERROR: render1 (testhost) frame 2.5\nQuit for Unknown reasons\n \n"},
+           {9, "parse error\n", nullptr, "ERROR: render1 (testhost) frame 2.5\nSIGKILL (Killed)\n\n \n"}}) {
+    // clang-format on
+    TASK* entry = entry_with_stream(2.5f, 10, "", log);
+    entry->waitstatus = waitstatus;
+    job_->comment.set(old_comment);
+    Job_Error_Update(entry);
+    EXPECT_STREQ(job_->comment.c_str(), comment) << log;
   }
-  UpdateJobState(job_);
-  EXPECT_STREQ(job_->status.c_str(), c.expected);
 }
 
-// Frames 1-2 finished and frame 3 under way count 3 of 4 frames; half of a
-// task spread over the job's 4 frames adds 12.5.
-// clang-format off
-INSTANTIATE_TEST_SUITE_P(Masks, JobState, testing::Values(
-    StateCase{"only_pending", {TASK_PENDING, TASK_PENDING}, "none", RUN_AVAILABLE, "pending"},
-    StateCase{"only_started", {TASK_STARTED}, "pending", RUN_AVAILABLE, "started"},
-    StateCase{"only_failed", {TASK_FAILED, TASK_FAILED}, "started", RUN_AVAILABLE, "failed"},
-    StateCase{"mixed_shows_progress", {TASK_FINISHED, TASK_RUNNING}, "started", RUN_AVAILABLE, "87.50% "},
-    StateCase{"paused_job_says_so", {TASK_FINISHED, TASK_RUNNING}, "started", RUN_PAUSED, "87.50% Paused"},
-    StateCase{"restarted_keeps_its_text", {TASK_FINISHED, TASK_PENDING}, "restarted", RUN_AVAILABLE, "restarted"},
-    StateCase{"restarted_with_pending_only", {TASK_PENDING}, "restarted", RUN_AVAILABLE, "pending"},
-    StateCase{"no_tasks_restarted_job", {}, "restarted", RUN_AVAILABLE, "pending"}),
-    label_of);
-// clang-format on
+// One task of frames i*2+1 .. i*2+2 for each status.  Frames 1-2 finished
+// and frame 3 under way count 3 of 4 frames; half of a task spread over the
+// job's 4 frames adds 12.5.
+TEST_F(StatusTest, TasksDecideTheJobsStatusText) {
+  // clang-format off
+  for (auto [statuses, job_status, ctrl, expected] : {
+           std::tuple<std::vector<int>, const char*, int, const char*>{{TASK_PENDING, TASK_PENDING}, "none", RUN_AVAILABLE, "pending"},
+           {{TASK_STARTED}, "pending", RUN_AVAILABLE, "started"},
+           {{TASK_FAILED, TASK_FAILED}, "started", RUN_AVAILABLE, "failed"},
+           {{TASK_FINISHED, TASK_RUNNING}, "started", RUN_AVAILABLE, "87.50% "},
+           {{TASK_FINISHED, TASK_RUNNING}, "started", RUN_PAUSED, "87.50% Paused"},
+           {{TASK_FINISHED, TASK_PENDING}, "restarted", RUN_AVAILABLE, "restarted"},
+           {{TASK_PENDING}, "restarted", RUN_AVAILABLE, "pending"},
+           {{}, "restarted", RUN_AVAILABLE, "pending"}}) {
+    // clang-format on
+    while (rndctl.tasks != nullptr) TASK_free(rndctl.tasks);
+    job_->status.set(job_status);
+    job_->ctrl = ctrl;
+    job_->frames[1] = static_cast<float>(statuses.size() * 2);
+    job_->totalframes = static_cast<int>(statuses.size() * 2);
+    for (size_t i = 0; i < statuses.size(); ++i) {
+      TASK* entry = add_entry(job_, dev_, static_cast<float>(i * 2 + 1),
+                              static_cast<float>(i * 2 + 2), statuses[i], static_cast<int>(i));
+      entry->rec->retries = 10;
+      if (statuses[i] == TASK_RUNNING) entry->progress = 50.0f;
+    }
+    UpdateJobState(job_);
+    EXPECT_STREQ(job_->status.c_str(), expected) << job_status << " " << statuses.size();
+  }
+}
 
 TEST_F(StatusTest, FinishedJobWritesItsLogAndClearsItsTasks) {
   job_->executable.set("shadepass");

@@ -200,8 +200,7 @@ void run(unsigned seed, const SshServer* ssh) {
       std::max(left, 0.0));
   std::string logs;
   for (const auto& h : names) {
-    // One read: the log still grows while the daemons run.
-    std::string log = hosts.daemon(h)->log();
+    std::string log = hosts.daemon(h)->log();  // one read: the log still grows
     logs += "--- " + h + " log tail:\n" + log.substr(log.size() > 600 ? log.size() - 600 : 0);
   }
   EXPECT_TRUE(finished) << "not finished within " << kRunBound << " s: a host waited on a lock "

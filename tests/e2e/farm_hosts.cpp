@@ -42,11 +42,8 @@ int free_port() {
 
 std::string uts_of(int pid) {
   char link[128];
-  std::string path = "/proc/" + std::to_string(pid) + "/ns/uts";
-  ssize_t n = readlink(path.c_str(), link, sizeof link - 1);
-  if (n <= 0) return "";
-  link[n] = '\0';
-  return link;
+  ssize_t n = readlink(("/proc/" + std::to_string(pid) + "/ns/uts").c_str(), link, sizeof link);
+  return n > 0 ? std::string(link, static_cast<size_t>(n)) : "";
 }
 
 std::vector<int> pids_where(const std::function<bool(int)>& keep) {
@@ -176,8 +173,7 @@ Daemon* FarmHosts::daemon(const std::string& host) {
 
 bool FarmHosts::start(const std::string& name) {
   Host& host = hosts_[name];
-  std::string dir = farm_.dir();
-  std::string script = "hostname \"$0\" || exit 1; ";
+  std::string dir = farm_.dir(), script = "hostname \"$0\" || exit 1; ";
   std::vector<std::string> argv = uts_unshare();
   if (ssh_ != nullptr) {
     // The client runs in the foreground as a child of the shell, and so of
@@ -189,16 +185,13 @@ bool FarmHosts::start(const std::string& name) {
               "/Render_Job_Control' ] && break; sleep 0.05; done; ";
     dir = mnt;
   }
-  for (const std::string& a :
-       {std::string("/bin/sh"), std::string("-c"), script + "exec \"$@\"", name,
-        std::string(DAEMON_PATH), std::string("-l"), dir, std::string("-d"), std::string("1")})
-    argv.push_back(a);
+  argv.insert(argv.end(),
+              {"/bin/sh", "-c", script + "exec \"$@\"", name, DAEMON_PATH, "-l", dir, "-d", "1"});
   Daemon* started = &farm_.run(argv, name, env_);
   host.starts.push_back(started);
   bool up =
       wait_for([&] { return started->in_loop() || started->ended(); }, 30) && !started->ended();
-  std::string ns = up ? uts_of(started->pid) : "";
-  if (!ns.empty()) host.namespaces.insert(ns);
+  if (std::string ns = up ? uts_of(started->pid) : ""; !ns.empty()) host.namespaces.insert(ns);
   return up;
 }
 
