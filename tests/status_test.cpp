@@ -60,51 +60,38 @@ class StatusTest : public TaskFixture {
   }
 };
 
-struct ProgressCase {
-  const char *label, *stream;
-  float by;
-  int extension;  // 0: none; else ext_start 100, ext_by 10
-  float start, end;
-  int changed;
-  float current, progress;
-  const char* output;  // null: none
-};
-
-class Progress : public StatusTest, public testing::WithParamInterface<ProgressCase> {};
-
-TEST_P(Progress, LastProgressLineSetsFrameAndPercentage) {
-  const ProgressCase& c = GetParam();
-  job_->frames[2] = c.by;
-  if (c.extension != 0) {
-    job_->extension = 291;
-    job_->ext_start = 100;
-    job_->ext_by = 10;
-  }
-  TASK* entry = entry_with_stream(c.start, c.end, c.stream);
-  EXPECT_EQ(set_image_percentage_done(entry), c.changed);
-  EXPECT_FLOAT_EQ(entry->rec->current, c.current);
-  EXPECT_NEAR(entry->progress, c.progress, 1e-3);
-  EXPECT_STREQ(entry->output.c_str(), c.output);
-  // Nothing new on the stream: nothing changes.
-  EXPECT_EQ(set_image_percentage_done(entry), 0);
-}
-
+// The last progress line sets the frame and the percentage: the stream, the
+// step, the job's extension (0: none; else from 100 by 10), the task's
+// frames, whether it changed, the frame and progress then, and the output.
 // Frame 3 of 1..10 in progress: current is that frame, not the next.
-// clang-format off
-INSTANTIATE_TEST_SUITE_P(Lines, Progress, testing::Values(
-    ProgressCase{"third_frame", "pix.0003 r 10 of 100\n", 1, 0, 1, 10, 1, 3, 30.8f, "pix.0003"},
-    ProgressCase{"first_frame_stays_at_start", "pix.0001 r 50 of 100\n", 1, 0, 1, 10, 1, 1, 14.8f, "pix.0001"},
-    ProgressCase{"finished_frame_moves_on", "pix.0003 r 102 of 100\n", 1, 0, 1, 10, 1, 4, 40, "pix.0003"},
-    ProgressCase{"never_past_the_end", "pix.0003 r 102 of 100\n", 1, 0, 1, 3, 1, 3, 133.33333f, "pix.0003"},
-    ProgressCase{"line_zero_is_the_frames_last", "pix.0003 r 0 of 100\n", 1, 0, 1, 10, 1, 3, 39.8f, "pix.0003"},
-    ProgressCase{"only_the_last_line_counts", "pix.0002 r 10 of 100\npix.0004 r 20 of 100\nnoblanks\n", 1, 0, 1, 10, 1, 4, 41.8f, "pix.0004"},
-    ProgressCase{"other_text_last_changes_nothing", "pix.0003 r 10 of 100\nError: frame 4 did not build\n", 1, 0, 1, 10, 0, 1, 0, nullptr},
-    ProgressCase{"letter_other_than_r_changes_nothing", "pix.0004 w 10 of 100\n", 1, 0, 1, 10, 0, 1, 0, nullptr},
-    ProgressCase{"step_two_counts_frames", "pix.0005 r 10 of 100\n", 2, 0, 1, 9, 1, 5, 61.6f, "pix.0005"},
-    ProgressCase{"half_step_counts_its_own_numbers", "pix.0005 r 10 of 100\n", 0.5f, 0, 2, 4, 1, 3, 61.6f, "pix.0005"},
-    ProgressCase{"job_extension_numbers", "pix.0140 r 10 of 100\n", 1, 1, 4, 6, 1, 5, 69.33333f, "pix.0140"}),
-    label_of);
-// clang-format on
+TEST_F(StatusTest, LastProgressLineSetsFrameAndPercentage) {
+  using Row = std::tuple<const char*, float, int, float, float, int, float, float, const char*>;
+  // clang-format off
+  for (auto [stream, by, extension, start, end, changed, current, progress, output] : {
+           Row{"pix.0003 r 10 of 100\n", 1, 0, 1, 10, 1, 3, 30.8f, "pix.0003"},
+           Row{"pix.0001 r 50 of 100\n", 1, 0, 1, 10, 1, 1, 14.8f, "pix.0001"},  // stays at the start
+           Row{"pix.0003 r 102 of 100\n", 1, 0, 1, 10, 1, 4, 40, "pix.0003"},  // a finished frame moves on
+           Row{"pix.0003 r 102 of 100\n", 1, 0, 1, 3, 1, 3, 133.33333f, "pix.0003"},  // never past the end
+           Row{"pix.0003 r 0 of 100\n", 1, 0, 1, 10, 1, 3, 39.8f, "pix.0003"},  // line zero is the frame's last
+           Row{"pix.0002 r 10 of 100\npix.0004 r 20 of 100\nnoblanks\n", 1, 0, 1, 10, 1, 4, 41.8f, "pix.0004"},
+           Row{"pix.0003 r 10 of 100\nError: frame 4 did not build\n", 1, 0, 1, 10, 0, 1, 0, nullptr},
+           Row{"pix.0004 w 10 of 100\n", 1, 0, 1, 10, 0, 1, 0, nullptr},
+           Row{"pix.0005 r 10 of 100\n", 2, 0, 1, 9, 1, 5, 61.6f, "pix.0005"},
+           Row{"pix.0005 r 10 of 100\n", 0.5f, 0, 2, 4, 1, 3, 61.6f, "pix.0005"},  // its own numbers
+           Row{"pix.0140 r 10 of 100\n", 1, 1, 4, 6, 1, 5, 69.33333f, "pix.0140"}}) {
+    // clang-format on
+    job_->frames[2] = by;
+    job_->extension = extension != 0 ? 291 : 0;
+    std::tie(job_->ext_start, job_->ext_by) = std::tuple(100, 10);
+    TASK* entry = entry_with_stream(start, end, stream);
+    EXPECT_EQ(set_image_percentage_done(entry), changed) << stream;
+    EXPECT_FLOAT_EQ(entry->rec->current, current) << stream;
+    EXPECT_NEAR(entry->progress, progress, 1e-3) << stream;
+    EXPECT_STREQ(entry->output.c_str(), output) << stream;
+    // Nothing new on the stream: nothing changes.
+    EXPECT_EQ(set_image_percentage_done(entry), 0) << stream;
+  }
+}
 
 TEST_F(StatusTest, HalfWrittenProgressLineWaitsForItsEnd) {
   TASK* entry = entry_with_stream(1, 10, "pix.0002 r 10 of 100\npix.0005 r 1");
