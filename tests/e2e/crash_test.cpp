@@ -15,31 +15,9 @@
 
 namespace {
 
-struct FileRec {
-  int id;
-  float start, end, current;
-  int dev, retries;
-  std::string status;
-};
-
-// The records of the task file, of every group.
-std::vector<FileRec> task_records(Farm& farm) {
-  std::vector<FileRec> recs;
-  std::string text = farm.read("Render_Tasks");
-  size_t at = 0;
-  while ((at = text.find("\n\t", at)) != std::string::npos) {
-    FileRec r{};
-    char status[32];
-    if (sscanf(text.c_str() + ++at + 1, "%d %f %f %f %d %d %31s", &r.id, &r.start, &r.end,
-               &r.current, &r.dev, &r.retries, status) == 7)
-      recs.push_back((r.status = status, r));
-  }
-  return recs;
-}
-
 bool any_held(Farm& farm) {
   for (const FileRec& r : task_records(farm))
-    if (r.status == "STARTED" || r.status == "RUNNING") return true;
+    if (r.held()) return true;
   return false;
 }
 

@@ -9,6 +9,7 @@
 #include <chrono>
 #include <cstdint>
 #include <cstdlib>
+#include <cstring>
 #include <thread>
 
 std::string this_host_name() {
@@ -67,9 +68,8 @@ void Daemon::stop() {
 Farm::Farm() {
   const char* tmp = getenv("TMPDIR");
   std::string base = std::string(tmp != nullptr ? tmp : "/tmp") + "/rndctl_e2e_XXXXXX";
-  char* made = mkdtemp(base.data());
-  if (made != nullptr) {
-    scratch_ = made;
+  if (mkdtemp(base.data()) != nullptr) {
+    scratch_ = base;
     dir_ = scratch_ + "/ctl";
     mkdir(dir_.c_str(), 0777);
   }
@@ -174,20 +174,15 @@ bool can_name_hosts() {
 }
 
 int read_pid_file(const std::string& path) {
+  std::string data = read_text_file(path);
   int32_t pid = 0;
-  FILE* fp = fopen(path.c_str(), "r");
-  if (fp == nullptr) return 0;
-  if (fread(&pid, sizeof pid, 1, fp) != 1) pid = 0;
-  fclose(fp);
+  if (data.size() >= sizeof pid) memcpy(&pid, data.data(), sizeof pid);
   return pid;
 }
 
 void write_pid_file(const std::string& path, int pid) {
-  FILE* fp = fopen(path.c_str(), "w");
-  if (fp == nullptr) return;
   int32_t value = pid;
-  fwrite(&value, sizeof value, 1, fp);
-  fclose(fp);
+  write_text_file(path, std::string(reinterpret_cast<const char*>(&value), sizeof value));
 }
 
 std::vector<int> children_of(int pid, int* zombies) {

@@ -7,7 +7,6 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <cstdio>
 #include <map>
 #include <sstream>
 
@@ -48,20 +47,9 @@ std::vector<Render> renders(Farm& farm, size_t from = 0) {
 
 bool group_gone(int pid) { return kill(-pid, 0) != 0 && errno == ESRCH; }
 
-// Render_Tasks records of resource `dev` that are STARTED or RUNNING.
 int active_on(Farm& farm, int dev) {
-  std::istringstream in(farm.read("Render_Tasks"));
-  std::string line;
   int n = 0;
-  while (std::getline(in, line)) {
-    int id, d, retries;
-    float s, e, c;
-    char status[32];
-    n += line.starts_with("\t") &&
-         sscanf(line.c_str(), "%d %f %f %f %d %d %31s", &id, &s, &e, &c, &d, &retries, status) ==
-             7 &&
-         d == dev && (std::string(status) == "STARTED" || std::string(status) == "RUNNING");
-  }
+  for (const FileRec& r : task_records(farm)) n += r.dev == dev && r.held();
   return n;
 }
 

@@ -53,6 +53,19 @@ std::string job_file(const std::vector<JobSpec>& jobs, const std::string& scene)
   return out + "End\n";
 }
 
+std::vector<FileRec> task_records(Farm& farm) {
+  std::vector<FileRec> recs;
+  std::string text = farm.read("Render_Tasks");
+  for (size_t at = 0; (at = text.find("\n\t", at)) != std::string::npos;) {
+    FileRec r{};
+    char status[32];
+    if (sscanf(text.c_str() + ++at + 1, "%d %f %f %f %d %d %31s", &r.id, &r.start, &r.end,
+               &r.current, &r.dev, &r.retries, status) == 7)
+      recs.push_back((r.status = status, r));
+  }
+  return recs;
+}
+
 std::string make_project(Farm& farm) {
   std::string project = farm.path("project"), scene = project + "/sdl/scene.sdl";
   for (const char* dir : {"", "/sdl", "/pix"}) mkdir((project + dir).c_str(), 0777);

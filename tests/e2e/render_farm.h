@@ -30,6 +30,17 @@ struct JobSpec {
   std::string executable = "frame_painter";
 };
 
+/// A record of the task file.
+struct FileRec {
+  int id;
+  float start, end, current;
+  int dev, retries;
+  std::string status;
+  bool held() const { return status == "STARTED" || status == "RUNNING"; }
+};
+/// The records of the task file, of every group.
+std::vector<FileRec> task_records(Farm& farm);
+
 std::string resource_file(const std::vector<ResourceSpec>& resources);
 std::string job_file(const std::vector<JobSpec>& jobs, const std::string& scene);
 
