@@ -24,9 +24,11 @@ class ReclaimTest : public TaskFixture {
     far_->host_name.set("farhost");
   }
   void TearDown() override {
+    // Forgets whatever a test registered, in its own registry: the shared
+    // default one may list another test process's renders.
+    rj_render_kill_leftovers();
     unsetenv("DRCTMPDIR");
     unsetenv("ZARNO_RSH");
-    rj_render_kill_leftovers();  // forgets whatever a test registered
     TaskFixture::TearDown();
   }
   // Against `now` when given, so that a second passing in the test shifts nothing.
