@@ -20,30 +20,27 @@ namespace {
 
 constexpr const char* kUnit = "tests/ma_test";
 
-struct BucketCase {
-  size_t request;
-  int bucket;  // -1: refused
-};
-
 TEST(MaBuckets, RequestsGoToTheFirstBucketThatHoldsThemRoundedToEight) {
-  const BucketCase cases[] = {
-      {0, 0},       {8, 0},          {9, 1},          {1024, 13},     {1025, 14},
-      {262201, 25}, {268435460, 45}, {268435461, -1}, {SIZE_MAX, -1},
-  };
-  for (const BucketCase& c : cases) {
-    EXPECT_EQ(MA_bucket_of(c.request), c.bucket) << c.request;
-    if (c.bucket >= 0) {
-      EXPECT_GE(MA_bucket_size(c.bucket), c.request) << c.request;
-    }
+  // Bucket -1: refused.
+  for (auto [request, bucket] : std::initializer_list<std::pair<size_t, int>>{{0, 0},
+                                                                              {8, 0},
+                                                                              {9, 1},
+                                                                              {1024, 13},
+                                                                              {1025, 14},
+                                                                              {262201, 25},
+                                                                              {268435460, 45},
+                                                                              {268435461, -1},
+                                                                              {SIZE_MAX, -1}}) {
+    EXPECT_EQ(MA_bucket_of(request), bucket) << request;
+    EXPECT_TRUE(bucket < 0 || MA_bucket_size(bucket) >= request) << request;
   }
 }
 
 TEST(MaBuckets, ARequestBeyondTheLastBucketIsRefusedWithItsCaller) {
   testing::internal::CaptureStderr();
-  void* p = MA_malloc(268435461, 41, kUnit, 1);
-  std::string err = testing::internal::GetCapturedStderr();
-  EXPECT_EQ(p, nullptr);
-  EXPECT_EQ(err, "Bucket request of 268435461 too large! in tests/ma_test line 41\n");
+  EXPECT_EQ(MA_malloc(268435461, 41, kUnit, 1), nullptr);
+  EXPECT_EQ(testing::internal::GetCapturedStderr(),
+            "Bucket request of 268435461 too large! in tests/ma_test line 41\n");
 }
 
 TEST(MaNormal, BlocksAreAlignedReusedLastInFirstOutAndKeepTheirBytes) {
@@ -105,9 +102,7 @@ class MaDebug : public testing::Test {
  protected:
   void SetUp() override {
     MA_init();  // reads the environment once; the settings below must win
-    ma_debug = 1;
-    ma_chkfree = 1;
-    ma_stomp = 1;
+    ma_debug = ma_chkfree = ma_stomp = 1;
   }
   void TearDown() override { ma_debug = ma_chkfree = ma_stomp = 0; }
 };
@@ -120,14 +115,12 @@ TEST_F(MaDebug, SoundBlocksPassEveryCheckAndTheirOwnerIsListed) {
   memset(p, 'x', 40);
   EXPECT_EQ(MA_checkit(p), 1);
   MA_allcheck(__LINE__, kUnit);
-  int fds[2];
-  ASSERT_EQ(pipe(fds), 0);
-  MA_dump_alloc_list(fds[1]);
-  close(fds[1]);
-  std::string listing;
-  char buf[4096];
-  for (ssize_t n; (n = read(fds[0], buf, sizeof buf)) > 0;) listing.append(buf, n);
-  close(fds[0]);
+  FILE* dump = tmpfile();
+  ASSERT_NE(dump, nullptr);
+  MA_dump_alloc_list(fileno(dump));
+  std::string listing(8192, '\0');
+  listing.resize(pread(fileno(dump), listing.data(), listing.size(), 0));
+  fclose(dump);
   char line[128];
   snprintf(line, sizeof line, "alloc   0x%08lx 40     77   tests/ma_test\n",
            static_cast<unsigned long>(reinterpret_cast<uintptr_t>(p)));
@@ -140,42 +133,6 @@ struct Fault {
   void (*provoke)();
   const char* says;
 };
-
-void double_free() {
-  void* p = MA_malloc(16, 10, kUnit, 1);
-  MA_free(p, 11, kUnit);
-  MA_free(p, 12, "second_caller");
-}
-void garbage_pointer() {
-  static char not_ours[64];
-  MA_free(not_ours + 32, 20, "garbage_caller");
-}
-void damaged_header_magic() {
-  char* p = static_cast<char*>(MA_malloc(16, 30, kUnit, 1));
-  memset(p - 16, 0x55, 4);
-  MA_free(p, 31, "magic_caller");
-}
-void damaged_header_address() {
-  char* p = static_cast<char*>(MA_malloc(16, 40, kUnit, 1));
-  memset(p - 8, 0x55, 8);
-  MA_free(p, 41, "bounds_caller");
-}
-void write_past_the_end() {
-  char* p = static_cast<char*>(MA_malloc(24, 50, "owner_unit", 1));
-  memset(p, 0, 32);  // one word too many
-  MA_free(p, 51, "freeing_unit");
-}
-void write_into_a_freed_block() {
-  char* p = static_cast<char*>(MA_malloc(64, 60, kUnit, 1));
-  MA_free(p, 61, kUnit);
-  p[8] = 'x';
-  MA_allcheck(62, "checking_unit");
-}
-void free_null_strictly() {
-  ma_chkfree = 2;
-  MA_free(nullptr, 70, "null_caller");
-}
-
 class MaFault : public MaDebug, public testing::WithParamInterface<Fault> {};
 
 TEST_P(MaFault, EndsTheProcessSayingWhatWasFound) {
@@ -183,24 +140,29 @@ TEST_P(MaFault, EndsTheProcessSayingWhatWasFound) {
   EXPECT_DEATH(GetParam().provoke(), GetParam().says);
 }
 
-INSTANTIATE_TEST_SUITE_P(
-    Release, MaFault,
-    testing::Values(
-        Fault{"DoubleFree", double_free, "Freeing memory twice in second_caller line 12\n"},
-        Fault{"Garbage", garbage_pointer,
-              "Free of garbage pointer 0x[0-9a-f]+ in garbage_caller line 20\n"},
-        Fault{"HeaderMagic", damaged_header_magic,
-              "Magic number in freed memory is incorect. magic_caller line 31\n"},
-        Fault{"HeaderBounds", damaged_header_address,
-              "Freeing damaged memory in bounds_caller line 41\n"},
-        Fault{"Trailer", write_past_the_end,
-              "Trailer damage\nMemory allocated from owner_unit line 50\n"
-              "Memory check failed in 'freeing_unit' line 51\n"},
-        Fault{"StompedReuse", write_into_a_freed_block,
-              "base 0x[0-9a-f]+: offset=8\nFree block reused at\n0x[0-9a-f]+: '0x[0-9a-f]+"
-              ".*Memory check failed in 'checking_unit' line 62\n"},
-        Fault{"NullStrict", free_null_strictly, "Free of NULL in null_caller line 70\n"}),
+char* block(size_t n, int line, const char* unit = kUnit) {
+  return static_cast<char*>(MA_malloc(n, line, unit, 1));
+}
+
+// clang-format off
+INSTANTIATE_TEST_SUITE_P(Release, MaFault, testing::Values(
+    Fault{"DoubleFree", [] { char* p = block(16, 10); MA_free(p, 11, kUnit); MA_free(p, 12, "second_caller"); },
+          "Freeing memory twice in second_caller line 12\n"},
+    Fault{"Garbage", [] { static char not_ours[64]; MA_free(not_ours + 32, 20, "garbage_caller"); },
+          "Free of garbage pointer 0x[0-9a-f]+ in garbage_caller line 20\n"},
+    Fault{"HeaderMagic", [] { char* p = block(16, 30); memset(p - 16, 0x55, 4); MA_free(p, 31, "magic_caller"); },
+          "Magic number in freed memory is incorect. magic_caller line 31\n"},
+    Fault{"HeaderBounds", [] { char* p = block(16, 40); memset(p - 8, 0x55, 8); MA_free(p, 41, "bounds_caller"); },
+          "Freeing damaged memory in bounds_caller line 41\n"},
+    // One word past the end.
+    Fault{"Trailer", [] { char* p = block(24, 50, "owner_unit"); memset(p, 0, 32); MA_free(p, 51, "freeing_unit"); },
+          "Trailer damage\nMemory allocated from owner_unit line 50\nMemory check failed in 'freeing_unit' line 51\n"},
+    Fault{"StompedReuse", [] { char* p = block(64, 60); MA_free(p, 61, kUnit); p[8] = 'x'; MA_allcheck(62, "checking_unit"); },
+          "base 0x[0-9a-f]+: offset=8\nFree block reused at\n0x[0-9a-f]+: '0x[0-9a-f]+.*Memory check failed in 'checking_unit' line 62\n"},
+    Fault{"NullStrict", [] { ma_chkfree = 2; MA_free(nullptr, 70, "null_caller"); },
+          "Free of NULL in null_caller line 70\n"}),
     [](const testing::TestParamInfo<Fault>& info) { return std::string(info.param.name); });
+// clang-format on
 
 // Settings come from the environment; a child reads them, so the trace file
 // and the trap stay out of this process.
@@ -209,12 +171,13 @@ using MaSettings = ControlDirTest;
 TEST_F(MaSettings, TheTraceFileGetsOneLinePerOperationAndTheChosenLineTraps) {
   EXPECT_EXIT(
       {
-        setenv("HOME", dir_.c_str(), 1);
-        setenv("MA_DEBUG", "1", 1);
-        setenv("MA_TRACE", "1", 1);
-        setenv("MA_TSTART", "", 1);
-        setenv("MA_LINE", "205", 1);
-        setenv("MA_FILE", "trap_unit", 1);
+        for (auto [name, value] : {std::pair{"HOME", dir_.c_str()},
+                                   {"MA_DEBUG", "1"},
+                                   {"MA_TRACE", "1"},
+                                   {"MA_TSTART", ""},
+                                   {"MA_LINE", "205"},
+                                   {"MA_FILE", "trap_unit"}})
+          setenv(name, value, 1);
         MA_read_settings();
         void* p = MA_malloc(20, 201, kUnit, 1);
         MA_free(p, 202, kUnit);

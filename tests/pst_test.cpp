@@ -14,18 +14,11 @@
 namespace {
 
 std::optional<std::string> get_env(const char* name) {
-  const char* v = getenv(name);
-  return v != nullptr ? std::optional<std::string>(v) : std::nullopt;
+  return getenv(name) != nullptr ? std::optional<std::string>(getenv(name)) : std::nullopt;
 }
-
 void restore_env(const char* name, const std::optional<std::string>& v) {
-  if (v) {
-    setenv(name, v->c_str(), 1);
-  } else {
-    unsetenv(name);
-  }
+  v ? setenv(name, v->c_str(), 1) : unsetenv(name);
 }
-
 std::string prefs_line(const std::string& name, const std::string& value) {
   return name + " \"" + value + "\"\n";
 }
@@ -65,77 +58,57 @@ class PstTest : public ::testing::Test {
   std::string home_, site_;
 };
 
-struct Files {
-  const char* name;
-  mode_t site_mode;
-  bool user_file;
-  const char* expected;
-};
-
-class PrefsFileTest : public PstTest, public ::testing::WithParamInterface<Files> {};
-
-TEST_P(PrefsFileTest, WritableSiteFileElseTheUsersElseTheSiteFile) {
-  const Files& f = GetParam();
-  write_prefs(site_, prefs_line("ZARNO_RNDCTL_LOCATION", "/site/ctl"), f.site_mode);
-  if (f.user_file) write_prefs(home_, prefs_line("ZARNO_RNDCTL_LOCATION", "/user/ctl"));
+// A writable site file, else the user's, else the site file.
+TEST_F(PstTest, PrefsFileChoice) {
   ASSERT_EQ(chmod(home_.c_str(), 0755), 0);
   ASSERT_EQ(chmod(site_.c_str(), 0755), 0);
-  // Looked up in a child that cannot override file permissions, so that a
-  // read-only file is read-only for it; its exit code is the answer.
-  pid_t child = fork();
-  ASSERT_GE(child, 0);
-  if (child == 0) {
-    if (geteuid() == 0 && (setgid(65534) != 0 || setuid(65534) != 0)) _exit(2);
-    const char* v = get_zarno_variable("ZARNO_RNDCTL_LOCATION");
-    _exit(v != nullptr && strcmp(v, f.expected) == 0 ? 0 : 1);
+  for (auto [site_mode, user_file, expected] : {std::tuple{0666, true, "/site/ctl"},
+                                                {0444, true, "/user/ctl"},
+                                                {0444, false, "/site/ctl"}}) {
+    unlink((home_ + "/.ZarnoPrefs").c_str());
+    write_prefs(site_, prefs_line("ZARNO_RNDCTL_LOCATION", "/site/ctl"), site_mode);
+    if (user_file) write_prefs(home_, prefs_line("ZARNO_RNDCTL_LOCATION", "/user/ctl"));
+    // Looked up in a child that cannot override file permissions, so that a
+    // read-only file is read-only for it; its exit code is the answer.
+    static const char* want;
+    want = expected;
+    int status = race_children(
+                     1,
+                     [](int, void*) {
+                       if (geteuid() == 0 && (setgid(65534) != 0 || setuid(65534) != 0)) return 2;
+                       const char* v = get_zarno_variable("ZARNO_RNDCTL_LOCATION");
+                       return v != nullptr && strcmp(v, want) == 0 ? 0 : 1;
+                     },
+                     nullptr)[0]
+                     .status;
+    ASSERT_TRUE(WIFEXITED(status));
+    if (WEXITSTATUS(status) == 2) GTEST_SKIP() << "cannot drop privileges";
+    EXPECT_EQ(WEXITSTATUS(status), 0) << site_mode << user_file;
   }
-  int status = 0;
-  ASSERT_EQ(waitpid(child, &status, 0), child);
-  ASSERT_TRUE(WIFEXITED(status));
-  if (WEXITSTATUS(status) == 2) GTEST_SKIP() << "cannot drop privileges";
-  EXPECT_EQ(WEXITSTATUS(status), 0);
 }
 
-INSTANTIATE_TEST_SUITE_P(Choices, PrefsFileTest,
-                         testing::Values(Files{"WritableSite", 0666, true, "/site/ctl"},
-                                         Files{"ReadOnlySite", 0444, true, "/user/ctl"},
-                                         Files{"OnlyReadOnlySite", 0444, false, "/site/ctl"}),
-                         [](const auto& info) { return std::string(info.param.name); });
-
-struct Expansion {
-  const char* name;
-  std::string value;     // as written in the file
-  std::string expected;  // "(null)" for no value
-};
-
-class ExpansionTest : public PstTest, public ::testing::WithParamInterface<Expansion> {};
-
-TEST_P(ExpansionTest, ExpandsFromTheEnvironment) {
+TEST_F(PstTest, ExpandsFromTheEnvironment) {
   setenv("PST_A", "a", 1);
   setenv("PST_EMPTY", "", 1);
   setenv("PST_LONG", std::string(200, 'L').c_str(), 1);
   unsetenv("UNSET_VAR");
-  write_prefs(site_, prefs_line("V", GetParam().value));
-  std::string expected = GetParam().expected;
-  for (size_t at; (at = expected.find("<HOME>")) != std::string::npos;) {
-    expected.replace(at, 6, home_);
+  // As written in the file, and what a lookup gives ("(null)": no value).
+  for (const auto& [value, expected] : std::vector<std::pair<std::string, std::string>>{
+           {"${HOME}/ctl", home_ + "/ctl"},
+           {"~/ctl", home_ + "/ctl"},
+           {"$UNSET_VAR/ctl", "/ctl"},
+           {"x${PST_EMPTY}y", "xy"},
+           {"$PST_A-$PST_A.$PST_A", "a-a.a"},  // an unbraced name ends at any non-name
+           {"${PST_A x", "ax"},                // a blank ends a braced name
+           {"${}x$/y$", "x/y"},
+           {"   ", "(null)"},
+           {"$UNSET_VAR", "(null)"},
+           {"$PST_LONG$PST_LONG", std::string(255, 'L')}}) {  // cut at the buffer
+    write_prefs(site_, prefs_line("V", value));
+    pst_reset_cache();
+    EXPECT_EQ(lookup("V"), expected) << value;
   }
-  EXPECT_EQ(lookup("V"), expected);
 }
-
-INSTANTIATE_TEST_SUITE_P(
-    Values, ExpansionTest,
-    testing::Values(Expansion{"BracedHome", "${HOME}/ctl", "<HOME>/ctl"},
-                    Expansion{"Tilde", "~/ctl", "<HOME>/ctl"},
-                    Expansion{"UnsetVariableVanishes", "$UNSET_VAR/ctl", "/ctl"},
-                    Expansion{"EmptyVariableVanishes", "x${PST_EMPTY}y", "xy"},
-                    Expansion{"UnbracedEndKept", "$PST_A-$PST_A.$PST_A", "a-a.a"},
-                    Expansion{"BlankEndingBracedNameDropped", "${PST_A x", "ax"},
-                    Expansion{"EmptyNameVanishes", "${}x$/y$", "x/y"},
-                    Expansion{"BlanksOnly", "   ", "(null)"},
-                    Expansion{"NothingLeft", "$UNSET_VAR", "(null)"},
-                    Expansion{"CutAtTheBuffer", "$PST_LONG$PST_LONG", std::string(255, 'L')}),
-    [](const auto& info) { return std::string(info.param.name); });
 
 TEST_F(PstTest, UnknownVariableAndUnreadableFileYieldNull) {
   write_prefs(site_, prefs_line("KNOWN", "yes"));
@@ -157,11 +130,10 @@ TEST_F(PstTest, DefaultProjectComesFromTheBrowserFileNeverThePrefs) {
   EXPECT_EQ(lookup("zarno_Default_Project"), "demo");
   EXPECT_EQ(testing::internal::GetCapturedStderr(), "");
 
-  ASSERT_TRUE(write_text_file(home_ + "/.ZarnoBrowserPrefs",
-                              "CURRENT_PROJECT \"first\"\n"
-                              "OTHER_KEY \"other\"\n"
-                              "CURRENT_PROJECT \"second\" \n"
-                              "CURRENT_PROJECT_X \"longer key, no value\"\n"));
+  ASSERT_TRUE(
+      write_text_file(home_ + "/.ZarnoBrowserPrefs",
+                      "CURRENT_PROJECT \"first\"\nOTHER_KEY \"other\"\n"
+                      "CURRENT_PROJECT \"second\" \nCURRENT_PROJECT_X \"longer, no value\"\n"));
   EXPECT_EQ(lookup("ZARNO_DEFAULT_PROJECT"), "second");
 }
 

@@ -6,6 +6,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdlib>
 #include <string>
 
@@ -13,12 +14,6 @@
 #include "tests/support/task_text.h"
 
 namespace {
-
-int count_of(const std::string& text, const std::string& needle) {
-  int n = 0;
-  for (size_t at = text.find(needle); at != std::string::npos; at = text.find(needle, at + 1)) ++n;
-  return n;
-}
 
 class ReclaimTest : public TaskFixture {
  protected:
@@ -29,13 +24,14 @@ class ReclaimTest : public TaskFixture {
     far_->host_name.set("farhost");
   }
   void TearDown() override {
+    // Forgets whatever a test registered, in its own registry: the shared
+    // default one may list another test process's renders.
+    rj_render_kill_leftovers();
     unsetenv("DRCTMPDIR");
     unsetenv("ZARNO_RSH");
-    rj_render_kill_leftovers();  // forgets whatever a test registered
     TaskFixture::TearDown();
   }
-  // Ages are taken against `now` when given, so that a second that passes
-  // during the test does not shift them.
+  // Against `now` when given, so that a second passing in the test shifts nothing.
   void set_age(const std::string& name, time_t seconds, time_t now = 0) {
     if (now == 0) now = time(nullptr);
     struct timespec t[2] = {{now - seconds, 0}, {now - seconds, 0}};
@@ -44,10 +40,8 @@ class ReclaimTest : public TaskFixture {
   // A child in its own process group that waits to be killed.
   static pid_t sleeper() {
     pid_t pid = fork();
-    if (pid == 0) {
-      setpgid(0, 0);
-      for (;;) pause();
-    }
+    if (pid == 0)
+      for (setpgid(0, 0);;) pause();
     setpgid(pid, pid);
     return pid;
   }
@@ -64,37 +58,27 @@ class ReclaimTest : public TaskFixture {
   Dev* far_ = nullptr;
 };
 
-struct CutCase {
-  const char* label;
-  float current;
-  const char* expected;  // the group's records after the put-back
-};
-
-class ReclaimPutBack : public ReclaimTest, public testing::WithParamInterface<CutCase> {};
-
-TEST_P(ReclaimPutBack, CutsAtTheFrameReachedKeepingRetries) {
-  TaskGroup* groups = TaskGroup_alloc(job_, 5);
-  TaskRec* rec = TaskRec_alloc(groups, 1, 6, GetParam().current, dev_, TASK_RUNNING, nullptr, 2);
-  rec->retries = 3;
-  Task_put_back(&groups, groups, rec);
-  std::string got;
-  for (TaskRec* r = groups->tasks; r != nullptr; r = r->next) {
-    got += rec_line(r->id, r->start, r->end, r->current, r->dev ? r->dev->index : 0, r->retries,
-                    GetTaskStatusStr(r->status));
+// Nothing done goes back pending, whole, for any host; midway keeps the done
+// frames; at the last frame that frame stays pending.  Retries are kept.
+TEST_F(ReclaimTest, PutBackCutsAtTheFrameReached) {
+  // clang-format off
+  for (auto [current, expected] : {
+           std::pair<float, const char*>{1, "\t2\t 1.000000\t 6.000000\t 1.000000  0\t 3\tPENDING\n"},
+           {4, "\t2\t 1.000000\t 3.000000\t 3.000000  1\t 3\tFINISHED\n\t5\t 4.000000\t 6.000000\t 4.000000  0\t 3\tPENDING\n"},
+           {6, "\t2\t 1.000000\t 5.000000\t 5.000000  1\t 3\tFINISHED\n\t5\t 6.000000\t 6.000000\t 6.000000  0\t 3\tPENDING\n"}}) {
+    // clang-format on
+    TaskGroup* groups = TaskGroup_alloc(job_, 5);
+    TaskRec* rec = TaskRec_alloc(groups, 1, 6, current, dev_, TASK_RUNNING, nullptr, 2);
+    rec->retries = 3;
+    Task_put_back(&groups, groups, rec);
+    std::string got;
+    for (TaskRec* r = groups->tasks; r != nullptr; r = r->next)
+      got += rec_line(r->id, r->start, r->end, r->current, r->dev ? r->dev->index : 0, r->retries,
+                      GetTaskStatusStr(r->status));
+    EXPECT_EQ(got, expected) << current;
+    TaskGroup_free_all(&groups);
   }
-  EXPECT_EQ(got, GetParam().expected);
-  TaskGroup_free_all(&groups);
 }
-
-// clang-format off
-INSTANTIATE_TEST_SUITE_P(Progress, ReclaimPutBack, testing::Values(
-    CutCase{"none_goes_pending_whole_for_any_host", 1, "\t2\t 1.000000\t 6.000000\t 1.000000  0\t 3\tPENDING\n"},
-    CutCase{"midway_keeps_the_done_frames", 4, "\t2\t 1.000000\t 3.000000\t 3.000000  1\t 3\tFINISHED\n"
-                                               "\t5\t 4.000000\t 6.000000\t 4.000000  0\t 3\tPENDING\n"},
-    CutCase{"at_the_last_frame_leaves_it_pending", 6, "\t2\t 1.000000\t 5.000000\t 5.000000  1\t 3\tFINISHED\n"
-                                                      "\t5\t 6.000000\t 6.000000\t 6.000000  0\t 3\tPENDING\n"}),
-    [](const testing::TestParamInfo<CutCase>& info) { return std::string(info.param.label); });
-// clang-format on
 
 TEST_F(ReclaimTest, StartUpPutsBackOnlyThisHostsHeldTasks) {
   std::string name = job_->name.c_str();
@@ -117,35 +101,23 @@ TEST_F(ReclaimTest, AnotherHostsTaskIsPutBackOnlyWhenItsHeartbeatIsOldAndItsDaem
   chmod(path("fake_rsh").c_str(), 0755);
   setenv("ZARNO_RSH", path("fake_rsh").c_str(), 1);
   mkdir(path("TSKSTAT").c_str(), 0775);
-  std::string name = job_->name.c_str();
-  std::string held = group_line(name, 1, 1, 1) + rec_line(0, 1, 4, 1, 2, 0, "STARTED");
-  struct Case {
-    const char* label;
-    long heartbeat_age;  // -1: no heartbeat file
-    bool daemon_alive;
-    bool put_back;
-  } cases[] = {
-      {"young heartbeat", 30, false, false},
-      {"no heartbeat file", -1, false, false},
-      {"old heartbeat, daemon alive", 3600, true, false},
-      {"old heartbeat, daemon gone", 3600, false, true},
-  };
+  std::string name = job_->name.c_str(),
+              held = group_line(name, 1, 1, 1) + rec_line(0, 1, 4, 1, 2, 0, "STARTED");
   time_t now = time(nullptr);
-  for (const Case& c : cases) {
+  int32_t me = getpid();
+  // Heartbeat age (-1: no heartbeat file), whether the daemon lives, whether put back.
+  for (auto [age, alive, put_back] : {std::tuple{30, false, false},
+                                      {-1, false, false},
+                                      {3600, true, false},
+                                      {3600, false, true}}) {
     write_file("Render_Tasks", held);
     unlink(path("TSKSTAT/farhost").c_str());
-    if (c.heartbeat_age >= 0) {
-      write_file("TSKSTAT/farhost", "");
-      set_age("TSKSTAT/farhost", c.heartbeat_age, now);
-    }
     unlink(path("farhost.pid").c_str());
-    if (c.daemon_alive) {
-      int32_t me = getpid();
-      write_file("farhost.pid", std::string(reinterpret_cast<const char*>(&me), sizeof me));
-    }
-    EXPECT_EQ(Task_reclaim_dead_hosts(now), c.put_back ? 1 : 0) << c.label;
-    EXPECT_EQ(read_file("Render_Tasks").find("STARTED") == std::string::npos, c.put_back)
-        << c.label;
+    if (age >= 0) write_file("TSKSTAT/farhost", "");
+    if (age >= 0) set_age("TSKSTAT/farhost", age, now);
+    if (alive) write_file("farhost.pid", std::string(reinterpret_cast<const char*>(&me), 4));
+    EXPECT_EQ(Task_reclaim_dead_hosts(now), put_back ? 1 : 0) << age << alive;
+    EXPECT_EQ(read_file("Render_Tasks").find("STARTED") == std::string::npos, put_back) << age;
   }
   std::string access = read_file("Render_Access");
   const std::string line = "put back task 0 of \"" + name + "\" from host farhost: ";
@@ -177,12 +149,12 @@ TEST_F(ReclaimTest, RegistryKillsOnlyTheRendersItRecordedAndIgnoresAPlantedLink)
   struct stat st;
   ASSERT_EQ(lstat(rj_render_registry_path(), &st), 0);
   EXPECT_TRUE(S_ISREG(st.st_mode));
-  EXPECT_EQ(count_of(both, "\n"), 2) << both;
+  EXPECT_EQ(std::count(both.begin(), both.end(), '\n'), 2) << both;
 
   // A line that names a live process under another start time: its pid was
   // reused, the process is not ours.
-  std::string text = read_text_file(rj_render_registry_path());
-  write_text_file(rj_render_registry_path(), text + std::to_string(other) + " 1\n");
+  write_text_file(rj_render_registry_path(),
+                  read_text_file(rj_render_registry_path()) + std::to_string(other) + " 1\n");
   EXPECT_EQ(rj_render_kill_leftovers(), 1);
   EXPECT_TRUE(killed(render));
   EXPECT_EQ(waitpid(other, nullptr, WNOHANG), 0) << "a reused pid was killed";
@@ -198,10 +170,10 @@ TEST_F(ReclaimTest, RegistryKillsOnlyTheRendersItRecordedAndIgnoresAPlantedLink)
 }
 
 TEST(UpdateTimeSettled, AWholeSecondStampWaitsForTheServersNextSecond) {
-  const int64_t second = 1000000000;
-  EXPECT_TRUE(rj_update_time_settled(1700000000 * second + 123, 1700000000));
-  EXPECT_FALSE(rj_update_time_settled(1700000000 * second, 1700000000));
-  EXPECT_TRUE(rj_update_time_settled(1700000000 * second, 1700000001));
+  const int64_t stamp = 1700000000 * int64_t{1000000000};
+  EXPECT_TRUE(rj_update_time_settled(stamp + 123, 1700000000));
+  EXPECT_FALSE(rj_update_time_settled(stamp, 1700000000));
+  EXPECT_TRUE(rj_update_time_settled(stamp, 1700000001));
   EXPECT_TRUE(rj_update_time_settled(0, 1700000000));
 }
 

@@ -6,7 +6,6 @@
 // wait on a lock that a host which came back had left behind.
 //
 // CI runs one fixed seed.  CHAOS_SEEDS="1,2,3,..." runs a sweep by hand.
-#include <dirent.h>
 #include <signal.h>
 
 #include <algorithm>
@@ -31,9 +30,8 @@ const char* const kFaultNames[] = {"kill -9", "power cut", "SIGSTOP", "restart j
 
 struct Event {
   Fault fault;
-  std::string target;  // host, or job for a restart
-  double before;       // seconds of work before the fault
-  double down;         // seconds the host stays down or frozen
+  std::string target;   // host, or job for a restart
+  double before, down;  // seconds of work before the fault; the host stays down or frozen
   long long at_ns = 0;
 };
 
@@ -79,25 +77,18 @@ std::string without_group(const std::string& tasks, const std::string& job, bool
 // Returns the time from which its frames count again, or 0.
 long long restart_job(FarmHosts& hosts, Farm& farm, const std::string& job, std::string* trouble) {
   bool active = true;
-  if (!set_job_status(farm, job, "restarted", "chaos0")) {
-    *trouble = "the job file's lock was never free";
-    return 0;
-  }
+  auto fail = [&](const std::string& why) { return *trouble = why, 0LL; };
+  if (!set_job_status(farm, job, "restarted", "chaos0"))
+    return fail("the job file's lock was never free");
   hosts.touch_pid_files();
   if (!hosts.wait_until(
           [&] { return (void)without_group(farm.read("Render_Tasks"), job, &active), !active; },
-          30)) {
-    *trouble = "tasks still in flight 30 s after the restart:\n" + farm.read("Render_Tasks");
-    return 0;
-  }
-  if (!take_lock(farm, "Render_Job_Control")) {
-    *trouble = "the job file's lock was never free";
-    return 0;
-  }
+          30))
+    return fail("tasks still in flight 30 s after the restart:\n" + farm.read("Render_Tasks"));
+  if (!take_lock(farm, "Render_Job_Control")) return fail("the job file's lock was never free");
   if (!take_lock(farm, "Render_Tasks")) {
     drop_lock(farm, "Render_Job_Control");
-    *trouble = "the task file's lock was never free";
-    return 0;
+    return fail("the task file's lock was never free");
   }
   farm.write("Render_Tasks", without_group(farm.read("Render_Tasks"), job, &active));
   std::string block = job_block(farm, job), text = farm.read("Render_Job_Control");
@@ -150,26 +141,24 @@ void run(unsigned seed, const SshServer* ssh) {
     max_frames[names[i]] = 1 + i % 2;
     resources.push_back({names[i], i + 1, max_frames[names[i]], i == 0 ? 2 : 1, "AVAILABLE", ""});
   }
-  std::vector<JobSpec> jobs(2);
-  for (int i = 0; i < 2; ++i) {
-    jobs[i].name = job_names[i];
-    jobs[i].index = i + 1;
-    jobs[i].end = kFrames;
-    jobs[i].opts = "sleep=" + std::to_string(kFrameSeconds) +
-                   " stamp=" + farm.path("../stamps." + job_names[i]);
-    jobs[i].hosts = names;
-    jobs[i].executable = "stamp_render";
-  }
+  std::vector<JobSpec> jobs;
+  for (int i = 0; i < 2; ++i)
+    jobs.push_back({.name = job_names[i],
+                    .index = i + 1,
+                    .end = kFrames,
+                    .opts = "sleep=" + std::to_string(kFrameSeconds) +
+                            " stamp=" + farm.path("../stamps." + job_names[i]),
+                    .hosts = names,
+                    .executable = "stamp_render"});
   farm.write("Render_Resource_Control", resource_file(resources));
   farm.write("Render_Job_Control", job_file(jobs, scene));
 
   auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(int(kRunBound));
   long long begun_ns = wall_ns();
-  for (const auto& h : names) {
+  for (const auto& h : names)
     ASSERT_TRUE(hosts.start(h)) << h << " did not start:\n"
                                 << read_text_file(hosts.daemon(h)->tmpdir + "/early")
                                 << hosts.daemon(h)->log();
-  }
 
   std::vector<Event> events = plan(seed, names, job_names);
   std::map<std::string, long long> counts_from = {{"alpha", begun_ns}, {"beta", begun_ns}};
@@ -211,8 +200,7 @@ void run(unsigned seed, const SshServer* ssh) {
       std::max(left, 0.0));
   std::string logs;
   for (const auto& h : names) {
-    // One read: the log still grows while the daemons run.
-    std::string log = hosts.daemon(h)->log();
+    std::string log = hosts.daemon(h)->log();  // one read: the log still grows
     logs += "--- " + h + " log tail:\n" + log.substr(log.size() > 600 ? log.size() - 600 : 0);
   }
   EXPECT_TRUE(finished) << "not finished within " << kRunBound << " s: a host waited on a lock "
@@ -223,13 +211,11 @@ void run(unsigned seed, const SshServer* ssh) {
   // where a host died with the frame's task in flight.
   for (const auto& j : job_names) {
     std::map<int, std::vector<Stamp>> by_frame;
-    for (const Stamp& s : read_stamps(farm.path("../stamps." + j))) {
+    for (const Stamp& s : read_stamps(farm.path("../stamps." + j)))
       if (s.start_ns >= counts_from[j]) by_frame[static_cast<int>(s.frame)].push_back(s);
-    }
     std::string missing;
-    for (int f = 1; f <= kFrames; ++f) {
+    for (int f = 1; f <= kFrames; ++f)
       if (by_frame[f].empty()) missing += " " + std::to_string(f);
-    }
     EXPECT_TRUE(missing.empty()) << j << " frames never rendered since its last restart:" << missing
                                  << "\njob log:\n"
                                  << farm.read("JOBLOG/" + j) << logs;
@@ -248,13 +234,8 @@ void run(unsigned seed, const SshServer* ssh) {
   EXPECT_TRUE(stuck.empty()) << stuck.size() << " daemon(s) did not leave within 30 s of an "
                              << "operator's stop (waiting on a lock?), first " << stuck[0];
   std::string locks;
-  if (DIR* dir = opendir(farm.dir().c_str())) {
-    while (struct dirent* e = readdir(dir)) {
-      std::string name = e->d_name;
-      if (name.size() > 5 && name.compare(name.size() - 5, 5, ".lock") == 0) locks += " " + name;
-    }
-    closedir(dir);
-  }
+  for (const std::string& name : dir_names(farm.dir()))
+    if (name.ends_with(".lock")) locks += " " + name;
   EXPECT_EQ(locks, "") << "lock directories left";
   EXPECT_TRUE(wait_for([&] { return hosts.renders_left().empty(); }, 10))
       << hosts.renders_left().size() << " render(s) left running";

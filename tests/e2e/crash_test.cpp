@@ -1,7 +1,6 @@
 // A daemon that crashes, dies with its host or exits loses no task and
 // leaves no render running: the real daemon, killed and restarted on the
 // same control directory.
-#include <dirent.h>
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/stat.h>
@@ -16,47 +15,15 @@
 
 namespace {
 
-struct FileRec {
-  int id;
-  float start, end, current;
-  int dev, retries;
-  std::string status;
-};
-
-// The records of the task file, of every group.
-std::vector<FileRec> task_records(Farm& farm) {
-  std::vector<FileRec> recs;
-  std::string text = farm.read("Render_Tasks");
-  size_t at = 0;
-  while ((at = text.find("\n\t", at)) != std::string::npos) {
-    FileRec r{};
-    char status[32];
-    if (sscanf(text.c_str() + at + 2, "%d %f %f %f %d %d %31s", &r.id, &r.start, &r.end, &r.current,
-               &r.dev, &r.retries, status) == 7) {
-      r.status = status;
-      recs.push_back(r);
-    }
-    ++at;
-  }
-  return recs;
-}
-
 bool any_held(Farm& farm) {
-  for (const FileRec& r : task_records(farm)) {
-    if (r.status == "STARTED" || r.status == "RUNNING") return true;
-  }
+  for (const FileRec& r : task_records(farm))
+    if (r.held()) return true;
   return false;
 }
 
 std::vector<std::string> lock_dirs(Farm& farm) {
-  std::vector<std::string> locks;
-  DIR* d = opendir(farm.dir().c_str());
-  if (d == nullptr) return locks;
-  while (struct dirent* e = readdir(d)) {
-    std::string name = e->d_name;
-    if (name.size() > 5 && name.compare(name.size() - 5, 5, ".lock") == 0) locks.push_back(name);
-  }
-  closedir(d);
+  std::vector<std::string> locks = dir_names(farm.dir());
+  std::erase_if(locks, [](const std::string& name) { return !name.ends_with(".lock"); });
   return locks;
 }
 
@@ -73,22 +40,10 @@ class CrashTest : public ::testing::Test {
     host_ = this_host_name();
     scene_ = make_project(farm_);
   }
-  ResourceSpec resource(const std::string& name, int index, int max_frames) {
-    ResourceSpec r;
-    r.name = name;
-    r.index = index;
-    r.max_frames = max_frames;
-    r.num_processors = 1;
-    return r;
-  }
-  JobSpec job(float start, float end, const std::vector<std::string>& hosts,
-              const std::string& opts) {
-    JobSpec j;
-    j.start = start;
-    j.end = end;
-    j.hosts = hosts;
-    j.opts = opts;
-    return j;
+  // This host's resource and a job of frames 1 to 6 on it.
+  void write_farm(const std::string& opts) {
+    farm_.write("Render_Resource_Control", resource_file({{host_, 1, 6, 1}}));
+    farm_.write("Render_Job_Control", job_file({{.opts = opts, .hosts = {host_}}}, scene_));
   }
   std::string image(int frame) { return farm_.path("project/pix/spin." + std::to_string(frame)); }
   bool rendered(int frame) { return access(image(frame).c_str(), F_OK) == 0; }
@@ -110,13 +65,11 @@ class CrashTest : public ::testing::Test {
   }
 
   Farm farm_;
-  std::string host_;
-  std::string scene_;
+  std::string host_, scene_;
 };
 
 TEST_F(CrashTest, ARestartedDaemonEndsTheOldRenderAndRendersTheRestFromTheFrameReached) {
-  farm_.write("Render_Resource_Control", resource_file({resource(host_, 1, 6)}));
-  farm_.write("Render_Job_Control", job_file({job(1, 6, {host_}, "slow=1")}, scene_));
+  write_farm("slow=1");
   Daemon& first = farm_.start_on_farm({}, "", render_env());
   int render = running_render(first);
   ASSERT_GT(render, 0) << first.log();
@@ -128,9 +81,8 @@ TEST_F(CrashTest, ARestartedDaemonEndsTheOldRenderAndRendersTheRestFromTheFrameR
   float reached = 0;
   ASSERT_TRUE(wait_for(
       [&] {
-        for (const FileRec& r : task_records(farm_)) {
+        for (const FileRec& r : task_records(farm_))
           if (r.status == "RUNNING" && r.current > r.start) reached = r.current;
-        }
         return reached > 0 && lock_dirs(farm_).empty();
       },
       30))
@@ -156,8 +108,8 @@ TEST_F(CrashTest, ARestartedDaemonEndsTheOldRenderAndRendersTheRestFromTheFrameR
   for (size_t i = 0; i < done.size(); ++i) {
     struct stat st {};
     ASSERT_EQ(stat(image(static_cast<int>(i) + 1).c_str(), &st), 0);
-    EXPECT_TRUE(st.st_ino == done[i].st_ino && st.st_mtim.tv_nsec == done[i].st_mtim.tv_nsec &&
-                st.st_mtim.tv_sec == done[i].st_mtim.tv_sec)
+    EXPECT_TRUE(st.st_ino == done[i].st_ino && st.st_mtim.tv_sec == done[i].st_mtim.tv_sec &&
+                st.st_mtim.tv_nsec == done[i].st_mtim.tv_nsec)
         << "frame " << i + 1 << " was rendered again";
   }
   // The old task was cut where it had got to: done frames stay done.
@@ -171,8 +123,7 @@ TEST_F(CrashTest, ARestartedDaemonEndsTheOldRenderAndRendersTheRestFromTheFrameR
 }
 
 TEST_F(CrashTest, ACleanExitEndsItsRenderAndPutsTheTaskBack) {
-  farm_.write("Render_Resource_Control", resource_file({resource(host_, 1, 6)}));
-  farm_.write("Render_Job_Control", job_file({job(1, 6, {host_}, "slow=2")}, scene_));
+  write_farm("slow=2");
   Daemon& d = farm_.start_on_farm({}, "", render_env());
   int render = running_render(d);
   ASSERT_GT(render, 0) << d.log();
@@ -189,7 +140,7 @@ TEST_F(CrashTest, ACleanExitEndsItsRenderAndPutsTheTaskBack) {
 // A control file the grammar cannot read ends the daemon at once: whatever
 // locks it held on the way must go with it, or every host waits them out.
 TEST_F(CrashTest, AFatalExitOnABadControlFileLeavesNoLockBehind) {
-  farm_.write("Render_Resource_Control", resource_file({resource(host_, 1, 6)}));
+  write_farm("");
   farm_.write("Render_Job_Control", "RenderJobControl 1 1\nspin 1 {\n\tpriority = 4\n}\n");
   Daemon& d = farm_.start_on_farm({}, "", render_env());
   ASSERT_TRUE(wait_for([&] { return d.ended(); }, 60)) << d.log();
@@ -200,11 +151,9 @@ TEST_F(CrashTest, AFatalExitOnABadControlFileLeavesNoLockBehind) {
 }
 
 TEST_F(CrashTest, TasksOfAHostWhoseHeartbeatStoppedAreCutAndRenderedHere) {
-  farm_.write("Render_Resource_Control",
-              resource_file({resource(host_, 1, 6), resource("ghost", 2, 6)}));
-  JobSpec spin = job(1, 4, {host_, "ghost"}, "");
-  spin.status = "started";
-  farm_.write("Render_Job_Control", job_file({spin}, scene_));
+  farm_.write("Render_Resource_Control", resource_file({{host_, 1, 6, 1}, {"ghost", 2, 6, 1}}));
+  farm_.write("Render_Job_Control",
+              job_file({{.status = "started", .end = 4, .hosts = {host_, "ghost"}}}, scene_));
   // The ghost had rendered frames 1 and 2 when its host went dark an hour ago.
   farm_.write("Render_Tasks", group_line("spin", 1, 1, 1) + rec_line(0, 1, 4, 3, 2, 0, "RUNNING"));
   ASSERT_EQ(mkdir(farm_.path("TSKSTAT").c_str(), 0775), 0);
@@ -214,8 +163,7 @@ TEST_F(CrashTest, TasksOfAHostWhoseHeartbeatStoppedAreCutAndRenderedHere) {
 
   Daemon& d = farm_.start_on_farm({}, "", {render_env()[0], "ZARNO_RNDCTL_HOST_TIMEOUT=60"});
   ASSERT_TRUE(finished(d)) << d.log() << farm_.read("Render_Tasks");
-  EXPECT_TRUE(rendered(3));
-  EXPECT_TRUE(rendered(4));
+  EXPECT_TRUE(rendered(3) && rendered(4));
   EXPECT_FALSE(rendered(1)) << "frames the ghost had done are not rendered again";
   std::string access = farm_.read("Render_Access");
   EXPECT_NE(access.find("* put back task 0 of \"spin\" from host ghost: no heartbeat for 36"),

@@ -1,14 +1,15 @@
 #include "tests/e2e/e2e_support.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cstdint>
 #include <cstdlib>
+#include <cstring>
 #include <thread>
 
 std::string this_host_name() {
@@ -28,26 +29,15 @@ bool Daemon::in_loop() const {
 }
 
 void Daemon::wake() const {
-  if (pid <= 0 || reaped) return;
-  kill(pid, SIGALRM);
+  if (pid > 0 && !reaped) kill(pid, SIGALRM);
 }
 
 bool Daemon::ended() {
-  if (reaped) return true;
-  if (pid <= 0) return true;
-  int st = 0;
-  pid_t r = waitpid(pid, &st, WNOHANG);
-  if (r == pid) {
-    status = st;
-    reaped = true;
-  }
-  return reaped;
+  if (!reaped && pid > 0 && waitpid(pid, &status, WNOHANG) == pid) reaped = true;
+  return reaped || pid <= 0;
 }
 
-int Daemon::exit_code() const {
-  if (!reaped || !WIFEXITED(status)) return -1;
-  return WEXITSTATUS(status);
-}
+int Daemon::exit_code() const { return reaped && WIFEXITED(status) ? WEXITSTATUS(status) : -1; }
 
 namespace {
 // Kills a process and everything below it (render programs run in process
@@ -63,19 +53,14 @@ void Daemon::stop() {
   if (pid <= 0 || reaped) return;
   std::vector<int> killed;
   kill_tree(pid, &killed);
-  int st = 0;
-  if (waitpid(pid, &st, 0) == pid) {
-    status = st;
-    reaped = true;
-  }
+  if (waitpid(pid, &status, 0) == pid) reaped = true;
   // Orphans are reaped by someone else: wait until they are really gone, so
   // that a probe of their pid no longer finds them.
   wait_for(
       [&] {
-        for (int p : killed) {
-          if (access(("/proc/" + std::to_string(p)).c_str(), F_OK) == 0) return false;
-        }
-        return true;
+        return std::none_of(killed.begin(), killed.end(), [](int p) {
+          return access(("/proc/" + std::to_string(p)).c_str(), F_OK) == 0;
+        });
       },
       10);
 }
@@ -83,9 +68,8 @@ void Daemon::stop() {
 Farm::Farm() {
   const char* tmp = getenv("TMPDIR");
   std::string base = std::string(tmp != nullptr ? tmp : "/tmp") + "/rndctl_e2e_XXXXXX";
-  char* made = mkdtemp(base.data());
-  if (made != nullptr) {
-    scratch_ = made;
+  if (mkdtemp(base.data()) != nullptr) {
+    scratch_ = base;
     dir_ = scratch_ + "/ctl";
     mkdir(dir_.c_str(), 0777);
   }
@@ -93,8 +77,7 @@ Farm::Farm() {
 
 Farm::~Farm() {
   for (Daemon* d : daemons_) {
-    d->stop();
-    // Render programs run in their own process groups; end what is left.
+    d->stop();  // with its renders, in process groups of their own
     delete d;
   }
   if (!scratch_.empty() && getenv("RJ_KEEP_TEST_DIRS") == nullptr) remove_tree(scratch_);
@@ -107,16 +90,13 @@ void Farm::write(const std::string& name, const std::string& content) const {
 Daemon& Farm::start(const std::vector<std::string>& args, const std::string& host,
                     const std::vector<std::string>& env) {
   std::vector<std::string> argv;
-  bool own_uts = !host.empty() && host != this_host_name();
-  if (own_uts) {
+  if (!host.empty() && host != this_host_name()) {
     argv = uts_unshare();
     for (const char* a : {"/bin/sh", "-c", "hostname \"$0\" && exec \"$@\""}) argv.push_back(a);
     argv.push_back(host);
-    argv.push_back(DAEMON_PATH);
-  } else {
-    argv.push_back(DAEMON_PATH);
   }
-  for (const auto& a : args) argv.push_back(a);
+  argv.push_back(DAEMON_PATH);
+  argv.insert(argv.end(), args.begin(), args.end());
   return run(argv, host.empty() ? this_host_name() : host, env);
 }
 
@@ -155,7 +135,7 @@ Daemon& Farm::run(std::vector<std::string> argv, const std::string& host,
 Daemon& Farm::start_on_farm(const std::vector<std::string>& extra, const std::string& host,
                             const std::vector<std::string>& env) {
   std::vector<std::string> args = {"-l", dir_, "-d", "1"};
-  for (const auto& a : extra) args.push_back(a);
+  args.insert(args.end(), extra.begin(), extra.end());
   return start(args, host, env);
 }
 
@@ -194,49 +174,31 @@ bool can_name_hosts() {
 }
 
 int read_pid_file(const std::string& path) {
+  std::string data = read_text_file(path);
   int32_t pid = 0;
-  FILE* fp = fopen(path.c_str(), "r");
-  if (fp == nullptr) return 0;
-  if (fread(&pid, sizeof pid, 1, fp) != 1) pid = 0;
-  fclose(fp);
+  if (data.size() >= sizeof pid) memcpy(&pid, data.data(), sizeof pid);
   return pid;
 }
 
 void write_pid_file(const std::string& path, int pid) {
-  FILE* fp = fopen(path.c_str(), "w");
-  if (fp == nullptr) return;
   int32_t value = pid;
-  fwrite(&value, sizeof value, 1, fp);
-  fclose(fp);
-}
-
-int dead_pid() {
-  pid_t child = fork();
-  if (child == 0) _exit(0);
-  int st;
-  waitpid(child, &st, 0);
-  return child;
+  write_text_file(path, std::string(reinterpret_cast<const char*>(&value), sizeof value));
 }
 
 std::vector<int> children_of(int pid, int* zombies) {
   std::vector<int> kids;
   int z = 0;
-  DIR* proc = opendir("/proc");
-  if (proc == nullptr) return kids;
-  while (struct dirent* e = readdir(proc)) {
-    int child = atoi(e->d_name);
-    if (child <= 0) continue;
-    std::string stat = read_text_file("/proc/" + std::string(e->d_name) + "/stat");
+  for (const std::string& name : dir_names("/proc")) {
+    std::string stat = read_text_file("/proc/" + name + "/stat");
     size_t close = stat.rfind(')');
-    if (close == std::string::npos) continue;
     char state = 0;
     int ppid = 0;
-    if (sscanf(stat.c_str() + close + 1, " %c %d", &state, &ppid) != 2) continue;
-    if (ppid != pid) continue;
-    kids.push_back(child);
-    if (state == 'Z') ++z;
+    if (atoi(name.c_str()) <= 0 || close == std::string::npos ||
+        sscanf(stat.c_str() + close + 1, " %c %d", &state, &ppid) != 2 || ppid != pid)
+      continue;
+    kids.push_back(atoi(name.c_str()));
+    z += state == 'Z';
   }
-  closedir(proc);
   if (zombies != nullptr) *zombies = z;
   return kids;
 }

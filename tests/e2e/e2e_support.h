@@ -90,5 +90,3 @@ bool can_name_hosts();
 int read_pid_file(const std::string& path);
 /// Writes a 4-byte native pid file.
 void write_pid_file(const std::string& path, int pid);
-/// The pid of a process that has surely ended (a reaped child).
-int dead_pid();

@@ -1,7 +1,6 @@
 #include "tests/e2e/farm_hosts.h"
 
 #include <arpa/inet.h>
-#include <dirent.h>
 #include <fcntl.h>
 #include <netinet/in.h>
 #include <signal.h>
@@ -10,6 +9,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
@@ -42,22 +42,14 @@ int free_port() {
 
 std::string uts_of(int pid) {
   char link[128];
-  std::string path = "/proc/" + std::to_string(pid) + "/ns/uts";
-  ssize_t n = readlink(path.c_str(), link, sizeof link - 1);
-  if (n <= 0) return "";
-  link[n] = '\0';
-  return link;
+  ssize_t n = readlink(("/proc/" + std::to_string(pid) + "/ns/uts").c_str(), link, sizeof link);
+  return n > 0 ? std::string(link, static_cast<size_t>(n)) : "";
 }
 
 std::vector<int> pids_where(const std::function<bool(int)>& keep) {
   std::vector<int> pids;
-  DIR* proc = opendir("/proc");
-  if (proc == nullptr) return pids;
-  while (struct dirent* e = readdir(proc)) {
-    int pid = atoi(e->d_name);
-    if (pid > 0 && keep(pid)) pids.push_back(pid);
-  }
-  closedir(proc);
+  for (const std::string& name : dir_names("/proc"))
+    if (int pid = atoi(name.c_str()); pid > 0 && keep(pid)) pids.push_back(pid);
   return pids;
 }
 
@@ -77,22 +69,15 @@ std::vector<Stamp> read_stamps(const std::string& path) {
   if (fp == nullptr) return stamps;
   char line[512], host[128];
   Stamp s;
-  while (fgets(line, sizeof line, fp) != nullptr) {
-    if (sscanf(line, "%127s %f %lld %lld", host, &s.frame, &s.start_ns, &s.end_ns) != 4) continue;
-    s.host = host;
-    stamps.push_back(s);
-  }
+  while (fgets(line, sizeof line, fp) != nullptr)
+    if (sscanf(line, "%127s %f %lld %lld", host, &s.frame, &s.start_ns, &s.end_ns) == 4)
+      stamps.push_back({host, s.frame, s.start_ns, s.end_ns});
   fclose(fp);
   return stamps;
 }
 
-// ---------------------------------------------------------------- SshServer
-
 SshServer::~SshServer() {
-  if (pid_ > 0) {
-    kill(pid_, SIGTERM);
-    waitpid(pid_, nullptr, 0);
-  }
+  if (pid_ > 0 && kill(pid_, SIGTERM) == 0) waitpid(pid_, nullptr, 0);
   if (!dir_.empty()) remove_tree(dir_);
 }
 
@@ -164,8 +149,6 @@ std::string SshServer::sshfs_command(const std::string& remote_dir,
          " " + mount_point;
 }
 
-// ---------------------------------------------------------------- FarmHosts
-
 FarmHosts::FarmHosts(Farm& farm, const SshServer* ssh) : farm_(farm), ssh_(ssh) {
   // Probes of another host's pid go through a remote shell; every host of
   // this farm shares this machine's pids, so the shim runs the probe here.
@@ -190,8 +173,7 @@ Daemon* FarmHosts::daemon(const std::string& host) {
 
 bool FarmHosts::start(const std::string& name) {
   Host& host = hosts_[name];
-  std::string dir = farm_.dir();
-  std::string script = "hostname \"$0\" || exit 1; ";
+  std::string dir = farm_.dir(), script = "hostname \"$0\" || exit 1; ";
   std::vector<std::string> argv = uts_unshare();
   if (ssh_ != nullptr) {
     // The client runs in the foreground as a child of the shell, and so of
@@ -203,16 +185,13 @@ bool FarmHosts::start(const std::string& name) {
               "/Render_Job_Control' ] && break; sleep 0.05; done; ";
     dir = mnt;
   }
-  for (const std::string& a :
-       {std::string("/bin/sh"), std::string("-c"), script + "exec \"$@\"", name,
-        std::string(DAEMON_PATH), std::string("-l"), dir, std::string("-d"), std::string("1")})
-    argv.push_back(a);
+  argv.insert(argv.end(),
+              {"/bin/sh", "-c", script + "exec \"$@\"", name, DAEMON_PATH, "-l", dir, "-d", "1"});
   Daemon* started = &farm_.run(argv, name, env_);
   host.starts.push_back(started);
   bool up =
       wait_for([&] { return started->in_loop() || started->ended(); }, 30) && !started->ended();
-  std::string ns = up ? uts_of(started->pid) : "";
-  if (!ns.empty()) host.namespaces.insert(ns);
+  if (std::string ns = up ? uts_of(started->pid) : ""; !ns.empty()) host.namespaces.insert(ns);
   return up;
 }
 
@@ -225,14 +204,7 @@ void FarmHosts::power_cut(const std::string& name) {
       pids_where([&](int pid) { return host.namespaces.count(uts_of(pid)) != 0; });
   for (int pid : victims) kill(pid, SIGKILL);
   if (d != nullptr) d->stop();
-  wait_for(
-      [&] {
-        for (int pid : victims) {
-          if (!gone(pid)) return false;
-        }
-        return true;
-      },
-      10);
+  wait_for([&] { return std::all_of(victims.begin(), victims.end(), gone); }, 10);
 }
 
 bool FarmHosts::wait_until(const std::function<bool()>& done, double seconds) {
@@ -242,10 +214,8 @@ bool FarmHosts::wait_until(const std::function<bool()>& done, double seconds) {
     if (done()) return true;
     if (std::chrono::steady_clock::now() >= next_wake) {
       // A stopped daemon keeps the wake-up for when it continues.
-      for (auto& [name, host] : hosts_) {
-        Daemon* d = host.starts.empty() ? nullptr : host.starts.back();
-        if (d != nullptr && !d->ended() && d->in_loop()) d->wake();
-      }
+      for (auto& [name, host] : hosts_)
+        if (Daemon* d = daemon(name); d != nullptr && !d->ended() && d->in_loop()) d->wake();
       next_wake += std::chrono::seconds(1);
     }
     std::this_thread::sleep_for(std::chrono::milliseconds(20));
@@ -260,22 +230,14 @@ void FarmHosts::touch_pid_files() const {
 
 std::vector<std::string> FarmHosts::shut_down(double seconds) {
   for (const auto& [name, host] : hosts_) unlink(farm_.path(name + ".pid").c_str());
-  auto running = [&](const Host& host) {
-    return !host.starts.empty() && !host.starts.back()->ended();
+  auto stuck = [&] {
+    std::vector<std::string> names;
+    for (auto& [name, host] : hosts_)
+      if (!host.starts.empty() && !host.starts.back()->ended()) names.push_back(name);
+    return names;
   };
-  wait_until(
-      [&] {
-        for (auto& [name, host] : hosts_) {
-          if (running(host)) return false;
-        }
-        return true;
-      },
-      seconds);
-  std::vector<std::string> stuck;
-  for (auto& [name, host] : hosts_) {
-    if (running(host)) stuck.push_back(name);
-  }
-  return stuck;
+  wait_until([&] { return stuck().empty(); }, seconds);
+  return stuck();
 }
 
 std::vector<int> FarmHosts::renders_left() const {

@@ -12,14 +12,12 @@ std::string resource_file(const std::vector<ResourceSpec>& resources) {
   std::string out = "RenderResourceControl\n";
   char line[512];
   for (const auto& r : resources) {
-    snprintf(line, sizeof line, "%s %d {\n\tlock_pid \t= 0;\n\thost_name\t\t= %s;\n",
-             r.name.c_str(), r.index, r.name.c_str());
-    out += line;
     snprintf(line, sizeof line,
-             "\tstatus \t\t\t= %s;\n\tmax_frames \t\t= %d;\n\tnum_processors \t= %d;\n",
-             r.status.c_str(), r.max_frames, r.num_processors);
+             "%s %d {\n\tlock_pid \t= 0;\n\thost_name\t\t= %s;\n\tstatus \t\t\t= %s;\n"
+             "\tmax_frames \t\t= %d;\n\tnum_processors \t= %d;\n  default_dev     = 0;\n",
+             r.name.c_str(), r.index, r.name.c_str(), r.status.c_str(), r.max_frames,
+             r.num_processors);
     out += line;
-    out += "  default_dev     = 0;\n";
     if (!r.locks.empty()) out += "\tlocks =" + r.locks + ";\n";
     out += "\t}\n\n";
   }
@@ -55,12 +53,22 @@ std::string job_file(const std::vector<JobSpec>& jobs, const std::string& scene)
   return out + "End\n";
 }
 
+std::vector<FileRec> task_records(Farm& farm) {
+  std::vector<FileRec> recs;
+  std::string text = farm.read("Render_Tasks");
+  for (size_t at = 0; (at = text.find("\n\t", at)) != std::string::npos;) {
+    FileRec r{};
+    char status[32];
+    if (sscanf(text.c_str() + ++at + 1, "%d %f %f %f %d %d %31s", &r.id, &r.start, &r.end,
+               &r.current, &r.dev, &r.retries, status) == 7)
+      recs.push_back((r.status = status, r));
+  }
+  return recs;
+}
+
 std::string make_project(Farm& farm) {
-  std::string project = farm.path("project");
-  mkdir(project.c_str(), 0777);
-  mkdir((project + "/sdl").c_str(), 0777);
-  mkdir((project + "/pix").c_str(), 0777);
-  std::string scene = project + "/sdl/scene.sdl";
+  std::string project = farm.path("project"), scene = project + "/sdl/scene.sdl";
+  for (const char* dir : {"", "/sdl", "/pix"}) mkdir((project + dir).c_str(), 0777);
   write_text_file(scene,
                   "animation = ON;\nstartframe = 1;\nendframe = 6;\nbyframe = 1;\n"
                   "extensionsize = 4;\nsize = 16x12;\n");
@@ -103,13 +111,9 @@ bool edit_job_file(Farm& farm, const std::string& from, const std::string& to,
   std::string text = farm.read("Render_Job_Control");
   size_t at = text.find(from);
   bool found = at != std::string::npos;
-  if (found) {
-    text.replace(at, from.size(), to);
-    farm.write("Render_Job_Control", text);
-  }
+  if (found) farm.write("Render_Job_Control", text.replace(at, from.size(), to));
   drop_lock(farm, "Render_Job_Control");
-  std::string pid_file = farm.path(host + ".pid");
-  utimensat(AT_FDCWD, pid_file.c_str(), nullptr, 0);
+  utimensat(AT_FDCWD, farm.path(host + ".pid").c_str(), nullptr, 0);
   return found;
 }
 

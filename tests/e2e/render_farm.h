@@ -8,12 +8,12 @@
 #include "tests/e2e/e2e_support.h"
 
 struct ResourceSpec {
-  std::string name;  // also the host name
+  std::string name{};  // also the host name
   int index = 1;
   int max_frames = 3;
   int num_processors = 2;
   std::string status = "AVAILABLE";
-  std::string locks;  // e.g. "\t{ 800 to 1700 Monday }"
+  std::string locks{};  // e.g. "\t{ 800 to 1700 Monday }"
 };
 
 struct JobSpec {
@@ -22,13 +22,24 @@ struct JobSpec {
   int priority = 0;
   std::string status = "pending";
   float start = 1, end = 6, by = 1;
-  std::string opts;  // the render program's options argument
-  std::vector<std::string> hosts;
-  std::string ctrl;  // "SCHEDULE", "PAUSED", ... or empty
-  std::string runs;  // e.g. "\t{ 800 to 900 Monday }"
+  std::string opts{};  // the render program's options argument
+  std::vector<std::string> hosts{};
+  std::string ctrl{};  // "SCHEDULE", "PAUSED", ... or empty
+  std::string runs{};  // e.g. "\t{ 800 to 900 Monday }"
   bool save_out = false;
   std::string executable = "frame_painter";
 };
+
+/// A record of the task file.
+struct FileRec {
+  int id;
+  float start, end, current;
+  int dev, retries;
+  std::string status;
+  bool held() const { return status == "STARTED" || status == "RUNNING"; }
+};
+/// The records of the task file, of every group.
+std::vector<FileRec> task_records(Farm& farm);
 
 std::string resource_file(const std::vector<ResourceSpec>& resources);
 std::string job_file(const std::vector<JobSpec>& jobs, const std::string& scene);

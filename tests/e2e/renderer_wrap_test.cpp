@@ -1,53 +1,22 @@
 // The installed programs from the outside: their command lines, the real
 // renderers' wrappers under the real daemon, the systemd units, and an
 // install into a scratch prefix whose daemon renders the demo.
-#include <fcntl.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
-#include <cstdio>
 #include <regex>
 
 #include "tests/e2e/render_farm.h"
 
 namespace {
 
-struct Ran {
-  int status = -1;
-  std::string out, err;
-  int code() const { return WIFEXITED(status) ? WEXITSTATUS(status) : -1; }
-};
-
-// Runs argv (a path or a name found through PATH) with `cwd` as working
-// directory, its stdout and stderr in files under `scratch`.
-Ran run(const std::vector<std::string>& args, const std::string& scratch,
-        const std::string& cwd = "") {
-  std::string out_path = scratch + "/run.out", err_path = scratch + "/run.err";
-  std::vector<std::string> copy = args;
-  std::vector<char*> argv;
-  for (std::string& a : copy) argv.push_back(a.data());
-  argv.push_back(nullptr);
-  pid_t pid = fork();
-  if (pid == 0) {
-    int out = open(out_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-    int err = open(err_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-    if (out < 0 || err < 0 || (!cwd.empty() && chdir(cwd.c_str()) != 0)) _exit(127);
-    dup2(out, 1);
-    dup2(err, 2);
-    execvp(argv[0], argv.data());
-    _exit(127);
-  }
-  Ran r;
-  waitpid(pid, &r.status, 0);
-  r.out = read_text_file(out_path);
-  r.err = read_text_file(err_path);
-  return r;
+Ran run(const std::vector<std::string>& args, const std::string& dir, const std::string& cwd = "") {
+  return run_program(args, dir + "/run", cwd);
 }
-
 bool on_path(const std::string& program) {
-  Farm scratch;
-  return run({"sh", "-c", "command -v " + program}, scratch.dir()).code() == 0;
+  return run_program({"sh", "-c", "command -v " + program},
+                     "/tmp/on_path." + std::to_string(getpid()))
+             .code() == 0;
 }
 
 // Width and height from a PNG's header; false when it is not a PNG.
@@ -57,17 +26,14 @@ bool png_size(const std::string& path, int* width, int* height) {
       data.compare(12, 4, "IHDR") != 0)
     return false;
   auto be32 = [&](size_t at) {
-    return (static_cast<unsigned char>(data[at]) << 24) |
-           (static_cast<unsigned char>(data[at + 1]) << 16) |
-           (static_cast<unsigned char>(data[at + 2]) << 8) |
-           static_cast<unsigned char>(data[at + 3]);
+    int v = 0;
+    for (size_t i = at; i < at + 4; i++) v = v << 8 | static_cast<unsigned char>(data[i]);
+    return v;
   };
   *width = be32(16);
   *height = be32(20);
   return true;
 }
-
-// ---- Command lines ----------------------------------------------------------
 
 struct Program {
   const char* path;
@@ -97,13 +63,7 @@ TEST_P(CommandLine, HelpExitsZeroAndABadOptionExitsTwoWithTheUsage) {
   EXPECT_FALSE(access(scratch.path(this_host_name() + ".pid").c_str(), F_OK) == 0);
 }
 
-const std::vector<std::string> kWrapperWords = {"-p", "-m", "-A", "-s", "-e", "-b",
-                                                "-S", "-B", "-E", "-V", "-n", "OPTIONS"};
-std::vector<std::string> wrapper_words(const char* env) {
-  std::vector<std::string> w = kWrapperWords;
-  w.push_back(env);
-  return w;
-}
+#define WRAPPER_WORDS "-p", "-m", "-A", "-s", "-e", "-b", "-S", "-B", "-E", "-V", "-n", "OPTIONS"
 
 INSTANTIATE_TEST_SUITE_P(
     InstalledPrograms, CommandLine,
@@ -111,9 +71,9 @@ INSTANTIATE_TEST_SUITE_P(
                             {"-l", "-u", "-d", "-s", "RNDCTL_DEBUG", "ZARNO_RNDCTL_LOCATION",
                              "ZARNO_RNDCTL_ACCESS_LOG", "ZARNO_RNDCTL_HOST_TIMEOUT", "DRCTMPDIR",
                              "ZARNO_LOCATION", "HOME", "ZARNO_RSH"}},
-                    Program{FRAME_PAINTER_PATH, kWrapperWords},
-                    Program{BLENDER_RENDER_PATH, wrapper_words("BLENDER")},
-                    Program{POVRAY_RENDER_PATH, wrapper_words("POVRAY")}));
+                    Program{FRAME_PAINTER_PATH, {WRAPPER_WORDS}},
+                    Program{BLENDER_RENDER_PATH, {WRAPPER_WORDS, "BLENDER"}},
+                    Program{POVRAY_RENDER_PATH, {WRAPPER_WORDS, "POVRAY"}}));
 
 TEST(CommandLine, TheDaemonWarnsInItsLogWhenItRunsAsRoot) {
   if (geteuid() != 0) GTEST_SKIP() << "needs root";
@@ -124,8 +84,6 @@ TEST(CommandLine, TheDaemonWarnsInItsLogWhenItRunsAsRoot) {
   ASSERT_TRUE(wait_for([&] { return d.log().find("running as root") != std::string::npos; }, 30))
       << d.log();
 }
-
-// ---- Real renderers under the daemon ----------------------------------------
 
 struct Renderer {
   const char* program;         // the renderer itself
@@ -159,18 +117,11 @@ class RealRenderer : public ::testing::TestWithParam<Renderer> {
     return project_ + "/sdl/ball.ini";
   }
   Daemon& start(const std::string& scene, int processors) {
-    ResourceSpec r;
-    r.name = host_;
-    r.max_frames = 2;
-    r.num_processors = processors;
-    JobSpec j;
-    j.name = "ball";
-    j.start = 1;
-    j.end = 6;
-    j.hosts = {host_};
-    j.executable = GetParam().wrapper;
-    farm_.write("Render_Resource_Control", resource_file({r}));
-    farm_.write("Render_Job_Control", job_file({j}, scene));
+    farm_.write("Render_Resource_Control",
+                resource_file({{.name = host_, .max_frames = 2, .num_processors = processors}}));
+    farm_.write(
+        "Render_Job_Control",
+        job_file({{.name = "ball", .hosts = {host_}, .executable = GetParam().wrapper}}, scene));
     return farm_.start_on_farm({}, "", render_env());
   }
 
@@ -180,8 +131,7 @@ class RealRenderer : public ::testing::TestWithParam<Renderer> {
 
 TEST_P(RealRenderer, RendersSixFramesInPiecesOfTwoWithProgress) {
   Daemon& d = start(demo_scene(), 1);
-  // One processor: the pieces run one after the other, and the job shows
-  // its percentage between them.
+  // One processor: the three pieces run in turn, the job's percentage between them.
   std::regex progress("[0-9]+\\.[0-9][0-9]% ");
   ASSERT_TRUE(
       wait_for([&] { return std::regex_match(job_status(farm_, "ball"), progress); }, 120, &d))
@@ -190,15 +140,12 @@ TEST_P(RealRenderer, RendersSixFramesInPiecesOfTwoWithProgress) {
   ASSERT_TRUE(
       wait_for([&] { return job_status(farm_, "ball") == "finished" || d.ended(); }, 240, &d));
   ASSERT_EQ(job_status(farm_, "ball"), "finished") << d.log();
-  for (int frame = 1; frame <= 6; ++frame) {
-    int w = 0, h = 0;
+  for (int frame = 1, w = 0, h = 0; frame <= 6; ++frame, w = h = 0) {
     std::string image = project_ + "/pix/ball." + std::to_string(frame);
     ASSERT_TRUE(png_size(image, &w, &h)) << image;
-    EXPECT_EQ(w, 64);
-    EXPECT_EQ(h, 48);
+    EXPECT_EQ(std::pair(w, h), std::pair(64, 48)) << image;
   }
   EXPECT_FALSE(access((project_ + "/pix/ball.7").c_str(), F_OK) == 0);
-  // The three pieces, as the job log lists them.
   EXPECT_EQ(count_of(farm_.read("JOBLOG/ball"), "FINISHED"), 3) << farm_.read("JOBLOG/ball");
 }
 
@@ -221,8 +168,6 @@ INSTANTIATE_TEST_SUITE_P(
                     Renderer{"povray", "povray_render", "Error: Problem with option setting"}),
     [](const testing::TestParamInfo<Renderer>& info) { return std::string(info.param.program); });
 
-// ---- Install and supervision -------------------------------------------------
-
 TEST(Install, TheInstalledDaemonRendersTheDemo) {
   Farm scratch;
   std::string prefix = scratch.path("prefix");
@@ -231,8 +176,8 @@ TEST(Install, TheInstalledDaemonRendersTheDemo) {
   for (const char* program :
        {"zarno_render_demon", "frame_painter", "blender_render", "povray_render"})
     EXPECT_EQ(access((prefix + "/bin/" + program).c_str(), X_OK), 0) << program;
-  EXPECT_EQ(access((prefix + "/lib/systemd/system/zarno-render.service").c_str(), R_OK), 0);
-  EXPECT_EQ(access((prefix + "/lib/systemd/system/zarno-render@.service").c_str(), R_OK), 0);
+  for (const char* unit : {"zarno-render.service", "zarno-render@.service"})
+    EXPECT_EQ(access((prefix + "/lib/systemd/system/" + unit).c_str(), R_OK), 0) << unit;
 
   // The installed demo script, run on the installed programs only.
   Ran demo = run({"env", "PATH=/usr/bin:/bin", prefix + "/share/zarno_render/demo/run.sh", prefix},

@@ -1,8 +1,6 @@
 // The command-line tool against a real control directory and a real daemon.
 #if defined(RNDCTL_TOOL)
-#include <dirent.h>
 #include <signal.h>
-#include <sys/wait.h>
 
 #include <map>
 #include <nlohmann/json.hpp>
@@ -14,26 +12,17 @@ namespace {
 
 struct ToolRun {
   int status = -1;
-  std::string out;
+  std::string out;  // stdout, then stderr
 };
 
-// Runs the tool with `args` on the farm; stderr joins stdout.  Probes of
-// another host's daemon go through the farm's remote-shell shim.
+// Runs the tool with `args` on the farm.  Probes of another host's daemon go
+// through the farm's remote-shell shim.
 ToolRun rndctl(Farm& farm, const std::vector<std::string>& args) {
-  std::string rsh = farm.dir().substr(0, farm.dir().rfind('/')) + "/rsh_here";
-  std::string cmd =
-      "ZARNO_RSH='" + rsh + "' " + std::string(RNDCTL_PATH) + " -l '" + farm.dir() + "'";
-  for (const auto& a : args) cmd += " '" + a + "'";
-  cmd += " 2>&1";
-  ToolRun r;
-  FILE* p = popen(cmd.c_str(), "r");
-  if (p == nullptr) return r;
-  char buf[4096];
-  size_t n;
-  while ((n = fread(buf, 1, sizeof buf, p)) > 0) r.out.append(buf, n);
-  int st = pclose(p);
-  r.status = WIFEXITED(st) ? WEXITSTATUS(st) : -1;
-  return r;
+  std::vector<std::string> argv = {"env", "ZARNO_RSH=" + farm.path("../rsh_here"), RNDCTL_PATH,
+                                   "-l", farm.dir()};
+  argv.insert(argv.end(), args.begin(), args.end());
+  Ran r = run_program(argv, farm.path("../tool"));
+  return {r.code(), r.out + r.err};
 }
 
 class RndctlTest : public ::testing::Test {
@@ -41,9 +30,7 @@ class RndctlTest : public ::testing::Test {
   void SetUp() override {
     host_ = this_host_name();
     scene_ = make_project(farm_);
-    ResourceSpec here;
-    here.name = host_;
-    farm_.write("Render_Resource_Control", resource_file({here}));
+    farm_.write("Render_Resource_Control", resource_file({{host_}}));
     farm_.write("Render_Job_Control", job_file({}, scene_));
   }
   std::vector<std::string> submit(const std::string& name, const std::string& frames) {
@@ -51,8 +38,7 @@ class RndctlTest : public ::testing::Test {
             "--executable", "frame_painter", "--pix",  "pix/" + name, "--hosts",  host_};
   }
   Farm farm_;
-  std::string host_;
-  std::string scene_;
+  std::string host_, scene_;
 };
 
 TEST_F(RndctlTest, ASubmittedJobRendersToFinishedAndListsAsJson) {
@@ -66,20 +52,16 @@ TEST_F(RndctlTest, ASubmittedJobRendersToFinishedAndListsAsJson) {
   ASSERT_EQ(j.status, 0) << j.out;
   nlohmann::json jobs = nlohmann::json::parse(j.out);
   ASSERT_EQ(jobs.size(), 1u);
-  EXPECT_EQ(jobs[0]["name"], "spin");
-  EXPECT_EQ(jobs[0]["state"], "finished");
-  EXPECT_EQ(jobs[0]["doneframes"], 4);
-  EXPECT_EQ(jobs[0]["hosts"][0], host_);
+  EXPECT_EQ(std::tuple(jobs[0]["name"], jobs[0]["state"], jobs[0]["doneframes"], jobs[0]["hosts"]),
+            std::tuple("spin", "finished", 4, nlohmann::json{host_}));
   ToolRun h = rndctl(farm_, {"hosts", "--json"});
-  nlohmann::json hosts = nlohmann::json::parse(h.out);
-  EXPECT_EQ(hosts[0]["alive"], true) << h.out;
+  EXPECT_EQ(nlohmann::json::parse(h.out)[0]["alive"], true) << h.out;
 }
 
 // Input the reader would not take back is refused before anything is written.
 TEST_F(RndctlTest, RefusedInputLeavesBothFilesByteIdentical) {
   ASSERT_EQ(rndctl(farm_, submit("spin", "1-4")).status, 0);
-  std::string jobs = farm_.read("Render_Job_Control");
-  std::string devs = farm_.read("Render_Resource_Control");
+  std::string jobs = farm_.read("Render_Job_Control"), devs = farm_.read("Render_Resource_Control");
   const std::vector<std::vector<std::string>> refused = {
       submit("two words", "1-4"),
       submit("spin2", "4-1"),
@@ -144,13 +126,7 @@ TEST_F(RndctlTest, TheWatchViewDrawsAndQuitsCleanlyInTmux) {
                     " -l '" + farm_.dir() + "' watch --interval 100; echo WATCH_ENDED; sleep 30\"";
   ASSERT_EQ(system(cmd.c_str()), 0);
   auto pane = [&] {
-    std::string out;
-    FILE* p = popen(("tmux capture-pane -p -t " + session).c_str(), "r");
-    char buf[4096];
-    size_t n;
-    while (p != nullptr && (n = fread(buf, 1, sizeof buf, p)) > 0) out.append(buf, n);
-    if (p != nullptr) pclose(p);
-    return out;
+    return run_program({"tmux", "capture-pane", "-p", "-t", session}, farm_.path("../pane")).out;
   };
   bool drawn = wait_for([&] { return pane().find("spin") != std::string::npos; }, 30);
   std::string seen = pane();
@@ -179,14 +155,14 @@ class RndctlFarmTest : public ::testing::Test {
   void make_farm(const std::vector<std::string>& names, int frames, double sleep) {
     std::vector<ResourceSpec> resources;
     for (size_t i = 0; i < names.size(); ++i)
-      resources.push_back({names[i], static_cast<int>(i) + 1, 1, 1, "AVAILABLE", ""});
-    JobSpec job;
-    job.end = static_cast<float>(frames);
-    job.opts = "sleep=" + std::to_string(sleep) + " stamp=" + stamps_;
-    job.hosts = names;
-    job.executable = "stamp_render";
+      resources.push_back({names[i], static_cast<int>(i) + 1, 1, 1});
     farm_.write("Render_Resource_Control", resource_file(resources));
-    farm_.write("Render_Job_Control", job_file({job}, scene_));
+    farm_.write("Render_Job_Control",
+                job_file({{.end = static_cast<float>(frames),
+                           .opts = "sleep=" + std::to_string(sleep) + " stamp=" + stamps_,
+                           .hosts = names,
+                           .executable = "stamp_render"}},
+                         scene_));
     for (const auto& h : names) ASSERT_TRUE(hosts_.start(h)) << h;
   }
   std::vector<Stamp> stamps() const { return read_stamps(stamps_); }
@@ -198,14 +174,8 @@ class RndctlFarmTest : public ::testing::Test {
       if (daemon == nullptr) return false;
       kill(daemon->pid, SIGSTOP);
       bool holds = false;
-      DIR* d = opendir(farm_.dir().c_str());
-      while (const struct dirent* e = d != nullptr ? readdir(d) : nullptr) {
-        std::string n = e->d_name;
-        if (n.size() > 5 && n.compare(n.size() - 5, 5, ".lock") == 0 &&
-            access(farm_.path(n + "/" + host).c_str(), F_OK) == 0)
-          holds = true;
-      }
-      if (d != nullptr) closedir(d);
+      for (const std::string& n : dir_names(farm_.dir()))
+        holds |= n.ends_with(".lock") && access(farm_.path(n + "/" + host).c_str(), F_OK) == 0;
       if (!holds) {
         hosts_.power_cut(host);
         return true;
@@ -255,9 +225,8 @@ TEST_F(RndctlFarmTest, AHostLockStopsNewWorkOnThatHostAtOnce) {
   EXPECT_LE(late, 1);
   ToolRun h = rndctl(farm_, {"hosts", "--json"});
   ASSERT_EQ(h.status, 0) << h.out;
-  nlohmann::json hosts = nlohmann::json::parse(h.out);
-  EXPECT_EQ(hosts[1]["lock"], "LOCKED");
-  EXPECT_EQ(hosts[1]["locked_now"], true);
+  EXPECT_EQ(nlohmann::json::parse(h.out)[1]["lock"], "LOCKED");
+  EXPECT_EQ(nlohmann::json::parse(h.out)[1]["locked_now"], true);
 }
 
 TEST_F(RndctlFarmTest, CheckPutsADeadHostsTasksBackForTheOthers) {
@@ -266,8 +235,7 @@ TEST_F(RndctlFarmTest, CheckPutsADeadHostsTasksBackForTheOthers) {
   ASSERT_TRUE(power_cut_between_locks("deadB"));
   ToolRun h = rndctl(farm_, {"hosts", "--json"});
   ASSERT_EQ(h.status, 0) << h.out;
-  nlohmann::json hosts = nlohmann::json::parse(h.out);
-  EXPECT_EQ(hosts[0]["alive"], true) << h.out;
+  EXPECT_EQ(nlohmann::json::parse(h.out)[0]["alive"], true) << h.out;
   ToolRun r = rndctl(farm_, {"check", "--json"});
   ASSERT_EQ(r.status, 0) << r.out;
   EXPECT_EQ(nlohmann::json::parse(r.out)["jobs_put_back"], 1) << r.out;
@@ -323,8 +291,7 @@ TEST_F(RndctlFarmTest, RestartRendersEveryFrameExactlyOnceOnTwoHosts) {
   }
   for (int f = 1; f <= kFrames; ++f) EXPECT_EQ(again[f], 1) << "frame " << f;
   EXPECT_EQ(again.size(), static_cast<size_t>(kFrames));
-  EXPECT_GT(by_host["againA"], 0);
-  EXPECT_GT(by_host["againB"], 0);
+  EXPECT_TRUE(by_host["againA"] > 0 && by_host["againB"] > 0);
 }
 
 }  // namespace

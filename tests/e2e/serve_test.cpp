@@ -15,6 +15,7 @@
 #include <regex>
 #include <thread>
 
+#include "tests/support/test_support.h"
 #include "tests/e2e/render_farm.h"
 
 namespace {
@@ -131,7 +132,7 @@ class ServeTest : public ::testing::Test {
     jobs.insert(at, "\t/*<script>alert(1)</script>*/\n");
     farm_.write("Render_Job_Control", jobs);
     // This host's daemon is gone: a pid file naming an ended process.
-    write_pid_file(farm_.path(host_ + ".pid"), dead_pid());
+    write_pid_file(farm_.path(host_ + ".pid"), exited_pid());
   }
   Farm farm_;
   std::string host_;

@@ -1,10 +1,15 @@
 #include "tests/support/test_support.h"
 
+#include <dirent.h>
+#include <fcntl.h>
 #include <ftw.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <fstream>
 #include <sstream>
 
@@ -44,11 +49,81 @@ std::string read_text_file(const std::string& path) {
   return s.str();
 }
 
+pid_t exited_pid() {
+  pid_t child = fork();
+  if (child == 0) _exit(0);
+  waitpid(child, nullptr, 0);
+  return child;
+}
+
+std::vector<std::string> dir_names(const std::string& dir) {
+  std::vector<std::string> names;
+  if (DIR* d = opendir(dir.c_str())) {
+    while (struct dirent* e = readdir(d)) {
+      if (strcmp(e->d_name, ".") != 0 && strcmp(e->d_name, "..") != 0) names.push_back(e->d_name);
+    }
+    closedir(d);
+  }
+  std::sort(names.begin(), names.end());
+  return names;
+}
+
+std::vector<RaceChild> race_children(int n, int (*body)(int i, void* ctx), void* ctx) {
+  int go[2];
+  if (pipe(go) != 0) return {};
+  std::vector<pid_t> children;
+  for (int i = 0; i < n; i++) {
+    pid_t child = fork();
+    if (child == 0) {
+      rndctl.pid = getpid();
+      close(go[1]);
+      char byte;
+      if (read(go[0], &byte, 1) != 0) _exit(100);  // released by the close below
+      int result = body(i, ctx);
+      fflush(nullptr);
+      _exit(result);
+    }
+    children.push_back(child);
+  }
+  close(go[0]);
+  close(go[1]);
+  std::vector<RaceChild> raced;
+  for (pid_t child : children) {
+    int status = -1;
+    waitpid(child, &status, 0);
+    raced.push_back({child, status});
+  }
+  return raced;
+}
+
+Ran run_program(std::vector<std::string> args, const std::string& scratch, const std::string& cwd) {
+  std::string out_path = scratch + ".out", err_path = scratch + ".err";
+  std::vector<char*> argv;
+  for (std::string& a : args) argv.push_back(a.data());
+  argv.push_back(nullptr);
+  pid_t pid = fork();
+  if (pid == 0) {
+    int out = open(out_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    int err = open(err_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    if (out < 0 || err < 0 || (!cwd.empty() && chdir(cwd.c_str()) != 0)) _exit(127);
+    dup2(out, 1);
+    dup2(err, 2);
+    execvp(argv[0], argv.data());
+    _exit(127);
+  }
+  Ran r;
+  waitpid(pid, &r.status, 0);
+  r.out = read_text_file(out_path);
+  r.err = read_text_file(err_path);
+  unlink(out_path.c_str());
+  unlink(err_path.c_str());
+  return r;
+}
+
 void remove_tree(const std::string& path) {
   nftw(
-      path.c_str(),
-      [](const char* p, const struct stat*, int, struct FTW*) { return ::remove(p); }, 16,
-      FTW_DEPTH | FTW_PHYS);
+      path.c_str(), [](const char* p, const struct stat*, int, struct FTW*) { return ::remove(p); },
+      16, FTW_DEPTH | FTW_PHYS);
 }
 
 void ControlDirTest::SetUp() {

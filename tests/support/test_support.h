@@ -2,8 +2,10 @@
 #pragma once
 
 #include <gtest/gtest.h>
+#include <sys/wait.h>
 
 #include <string>
+#include <vector>
 
 #include "Utility/rndctl/rndctl.h"
 
@@ -15,6 +17,27 @@ void rndctl_reset();
 bool write_text_file(const std::string& path, const std::string& content);
 /// The whole content of `path`, or "" when it cannot be read.
 std::string read_text_file(const std::string& path);
+/// The pid of a child that has already exited and been reaped.
+pid_t exited_pid();
+/// The sorted names in `dir`, without "." and "..".
+std::vector<std::string> dir_names(const std::string& dir);
+/// Forks `n` children that each run `body(i)` and _exit with its result,
+/// all released at once; returns their pids and wait statuses.
+struct RaceChild {
+  pid_t pid;
+  int status;
+};
+std::vector<RaceChild> race_children(int n, int (*body)(int i, void* ctx), void* ctx);
+/// How a program run by run_program ended, and what it wrote.
+struct Ran {
+  int status = -1;  // as waitpid reports it
+  std::string out, err;
+  int code() const { return WIFEXITED(status) ? WEXITSTATUS(status) : -1; }
+};
+/// Runs `args` (a path, or a name found through PATH) in `cwd` (unless
+/// empty), its stdout and stderr caught in files beside `scratch`.
+Ran run_program(std::vector<std::string> args, const std::string& scratch,
+                const std::string& cwd = "");
 /// Removes a directory tree (for cleanup; errors are ignored).
 void remove_tree(const std::string& path);
 
