@@ -252,7 +252,8 @@ After wait_for_reload(Loop* loop) {
       wrt_logfile("Exiting due to self check failure");
       return After::kExit;
     }
-    rj_heartbeat();
+    // A failed touch leaves an older heartbeat; the next wake-up tries again.
+    (void)rj_heartbeat();
     // A touch is work announced: straight to the reload.  Only the alarm
     // and the other signals count as the idle wake-ups they always were.
     if (wake == Wake::kTouched) return After::kReload;

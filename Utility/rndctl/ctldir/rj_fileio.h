@@ -1,19 +1,8 @@
-#pragma once
-
-#include <sys/types.h>
-
-#include <cstdint>
-#include <cstdio>
-#include <ctime>
-
-#include "Utility/rndctl/ctldir/rj_paths.h"
-
-/// Locked file operations (rj_fileio, rj_lockdir).
-///
-/// Mutual exclusion and atomic rewrites of the shared files.  Every shared
-/// file has a fixed index (FILE_JOBS ..., rj_paths.h) and a lock directory
-/// "NAME.lock" beside it that holds one holder file, named after the
-/// holder's host and containing "%d\n" with its pid.
+/// Locked file operations: mutual exclusion and atomic rewrites of the
+/// shared files of the control directory (rj_fileio, rj_lockdir).  Every
+/// shared file has a fixed index (FILE_JOBS ..., rj_paths.h) and a lock
+/// directory "NAME.lock" beside it that holds one holder file, named after
+/// the holder's host and containing "%d\n" with its pid.
 ///
 /// Calling order.  A read:
 ///   { FileopLock lock(i);                waits until the lock is this process's
@@ -49,6 +38,16 @@
 /// which nobody reads.
 ///
 /// Nothing here is safe inside a signal handler.
+#pragma once
+
+#include <sys/types.h>
+
+#include <cstdint>
+#include <cstdio>
+#include <ctime>
+
+#include "Utility/rndctl/ctldir/rj_paths.h"
+
 /// Builds the path table and opens the access log (see above); returns 1.
 int init_fileop();
 /// take non-zero: waits (backing off, see fileop_poll_seconds) until the lock
@@ -57,17 +56,23 @@ int init_fileop();
 /// this host and this pid) and leaves anyone else's alone; returns 1.
 /// 0 only for a bad index or when the paths cannot be built.
 [[nodiscard]] int lock_fileop(int index, int take);
-/// Opens file `index` for reading, creating it empty when absent.
-FILE* read_fileop(int index);
+/// Opens file `index` for reading, creating it empty when absent.  Returns
+/// the stream (closed by close_fileop), or null for a bad index or a file
+/// that cannot be opened or made (reported).
+[[nodiscard]] FILE* read_fileop(int index);
 /// Opens file `index` for a rewrite (creating it empty when absent): reads
 /// give the file as it was; writes go to the new contents, from the start of
 /// the file (right after the open or after rewind_fileop).  The stream has
-/// no descriptor (fileno is -1).
-FILE* update_fileop(int index);
+/// no descriptor (fileno is -1).  Returns the stream (closed by
+/// close_and_truncate_fileop), or null for a bad index or a file that cannot
+/// be read or made (reported).
+[[nodiscard]] FILE* update_fileop(int index);
 /// Rewinds the open stream: an update stream then writes from the start.
+/// Nothing when file `index` has no open stream.
 void rewind_fileop(int index);
 /// Closes the stream; an update stream that was written keeps the old bytes
-/// past the written ones (nothing is cut).  0 ok, -1 failed and reported.
+/// past the written ones (nothing is cut).  0 ok (also when no stream is
+/// open), -1 failed and reported.
 [[nodiscard]] int close_fileop(int index);
 /// Closes the stream; the new contents of an update stream end at the
 /// stream's position and replace the file atomically (see above); a stream
@@ -76,7 +81,8 @@ void rewind_fileop(int index);
 /// temporary is gone, and the path with the system's reason was reported to
 /// the user and the trace.
 [[nodiscard]] int close_and_truncate_fileop(int index);
-/// The path of shared file `index` ("%s/%s"), building the table when needed.
+/// The path of shared file `index` ("%s/%s"), building the table when needed;
+/// null for a bad index or when the paths cannot be built.
 const char* fileop_path(int index);
 /// The path of the lock directory of file `index` ("%s/%s.lock"), likewise.
 const char* fileop_lock_path(int index);

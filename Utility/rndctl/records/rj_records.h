@@ -4,6 +4,15 @@
 /// records, and each record is freed only by its delete operation (Job_del,
 /// Dev_del).  The list order is part of the behaviour: writers print in list
 /// order and lookups return the first match.
+///
+/// A record's `index` is its identity in the files (names are labels and
+/// need not be unique); a freed record reads index -1 until its memory is
+/// reused, so a stale pointer reads as dead.  `lock_pid` is the pid of the
+/// editor that has the record open (0: nobody), a claim the field checks
+/// drop when that editor is gone, not a file lock.
+///
+/// Control block: these are plain types; the lists hang from `rndctl.jobs`
+/// and `rndctl.devs`, kept by rj_job and rj_dev.
 #pragma once
 
 #include "Utility/rndctl/base/rj_control.h"
@@ -61,8 +70,8 @@ struct Job {
   int deleted = 0;  // deletion mark: the next write of the job file drops it
   int del_when_done = 0;
   int save_out = 0;
-  int ctrl = RUN_AVAILABLE;
-  int runs[RJ_WEEK_SCAN] = {};
+  int ctrl = RUN_AVAILABLE;     // run state (RUN_...)
+  int runs[RJ_WEEK_SCAN] = {};  // week grid of run slots, used when ctrl is SCHEDULE
 };
 
 // Resource ("dev") record: one render host as the queue sees it (rj_dev).
@@ -74,12 +83,12 @@ struct Dev {
   Text host_name;
   Text comment;
   Text remote_location;
-  int status = LOCK_SCHEDULE;
-  void* listitem = nullptr;  // editor's list entry; non-owning
+  int status = LOCK_SCHEDULE;  // lock state (LOCK_...)
+  void* listitem = nullptr;    // editor's list entry; non-owning
   int word1 = 0;
   int max_frames = 4;
   int num_processors = 0;
-  int locks[RJ_WEEK_SCAN] = {};
+  int locks[RJ_WEEK_SCAN] = {};  // week grid of lock slots, used when status is SCHEDULE
   int words[2] = {0, 0};
   int lock_pid = 0;
   int word2 = 0;
@@ -93,8 +102,8 @@ struct Dev {
 struct RndDevList {  // hangs from a job: a resource the job may use
   RndDevList* next = nullptr;
   RndDevList* prev = nullptr;
-  Dev* dev = nullptr;  // non-owning
-  int picked = 0;
+  Dev* dev = nullptr;            // non-owning
+  int picked = 0;                // an editor's selection mark
   RndJobList* mirror = nullptr;  // the matching entry of dev->jobs; non-owning
 };
 struct RndJobList {  // hangs from a resource: a job that names it

@@ -1,20 +1,46 @@
 /// Running-task entries: this daemon's list of the pieces it renders
 /// (rndctl.tasks), and the rules by which an entry and the task file agree.
+/// An entry ties a task record (which it owns) to its job, the render
+/// process working on it here (pid), that render's log stream and output.
+///
+/// Calling order: an entry is made (Task_add) when this host takes a piece
+/// from Render_Tasks, and freed (TASK_free, after Task_let_go when a render
+/// may still run) when the piece ends or is lost.  After every wait the
+/// service loop calls Task_judge_exits before it judges the entries
+/// (UpdateRunningTasks, rj_status).  Inside a locked cycle on the task file,
+/// each entry is settled against its file record (Task_owns, Task_settle)
+/// and kills and wake-ups are left to a TaskAfterLock run after the lock is
+/// released.  A task group that was rebuilt in the file retires this host's
+/// entries of its job (Task_group_rebuilt, Task_retire_job).
+///
+/// Control block: writes `tasks` (the list head) and `running` (one off per
+/// judged exit); the first Task_add sets RJC_records_hook so that a reload
+/// moves each entry's job and resource pointers to the fresh records (or to
+/// null); reads `host` (this host's renders and pid file) and `jobs`,
+/// `devs` through that hook.  Entries' `job` pointers do not own.
 #pragma once
 
 #include <vector>
 
 #include "Utility/rndctl/tasks/rj_taskrec.h"
 
+/// Appends an entry for `rec` of `job` to rndctl.tasks; the entry takes
+/// ownership of `rec` (TASK_free frees it) and `rec->task` points back.
+/// Returns the entry, or null when out of memory (`rec` still the caller's).
 TASK* Task_add(Job* job, TaskRec* rec);
+/// Unlinks and frees an entry with its record, closes its stream and forgets
+/// its file names (the files stay: Task_let_go or Task_drop_stream removes
+/// them).  Does not kill its render.  Null: nothing.
 void TASK_free(TASK* entry);
+/// The entry whose render has process `pid`, or null (also for pid 0).
 TASK* Task_by_pid(int pid);
 /// Judges every exit the SIGCHLD handler recorded (RJ_take_exit): counts the
 /// child off `rndctl.running`, drops it from the render registry, touches
 /// this host's pid file, and when an entry renders that pid sets its `pid`
-/// to 0 and its `waitstatus` to the exit code (a signal's number for a
-/// killed render, 1 for anything else).  The service loop calls it after
-/// each wait.  Returns the number of exits judged.
+/// to 0 and its `waitstatus`: 0 for a clean exit, the exit code of a render
+/// that exited, the signal's number of one that was killed, 1 for anything
+/// else.  The service loop calls it after each wait.  Returns the number of
+/// exits judged (entries or not).
 int Task_judge_exits();
 
 /// Who may write a record of Render_Tasks.  Another host or an editor may put
@@ -70,10 +96,15 @@ void Task_drop_stream(TASK* entry);
 [[nodiscard]] bool Task_group_rebuilt(const Job* job, const TaskGroup* group);
 /// The highest next_task_id this host's entries of `job` have seen (0: none).
 int Task_seen_next_id(const Job* job);
+/// Raises each entry of `job` to the group's next_task_id (null: nothing).
 void Task_note_group(const Job* job, const TaskGroup* group);
+/// Lets go of and frees every entry of `job` (kills left to `after`, or at
+/// once when it is null).
 void Task_retire_job(const Job* job, TaskAfterLock* after);
+/// Marks every entry of `job` for Task_retire_marked.
 void Task_mark_rebuilt(const Job* job);
-/// Returns the number of entries dropped.
+/// Lets go of (killing at once) and frees every marked entry.  Returns the
+/// number of entries dropped.
 int Task_retire_marked();
 /// Reads the task file (under its lock) and drops every entry of those of
 /// `jobs` whose group there was rebuilt or is gone; returns how many entries
