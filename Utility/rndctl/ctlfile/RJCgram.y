@@ -45,7 +45,6 @@
 #include "Utility/rndctl/records/rj_schedule.h"
 
 void RJC_lex_begin();
-void RJC_lex_from_bytes(const char* text, size_t length);
 void RJC_lex_end();
 static const char* message_file();
 
@@ -425,12 +424,13 @@ int RJC_parse_string(const char* text, size_t length, const char* file_name) {
   const char* saved_file = RJCreadfile;
   FILE* saved_in = RJCin;
   RJCreadfile = file_name;
-  // The scanner reads the bytes where they are; an empty text reads as an
-  // empty file.
-  RJCin = nullptr;
-  RJC_lex_from_bytes(text, length);
+  FILE* stream = nullptr;
+  // fmemopen refuses an empty buffer; an empty text reads as no stream.
+  if (text != nullptr && length > 0) stream = fmemopen(const_cast<char*>(text), length, "r");
+  RJCin = stream;
   int result = RJCparse();
   RJC_lex_end();
+  if (stream != nullptr) fclose(stream);
   RJCin = saved_in;
   RJCreadfile = saved_file;
   return result;
