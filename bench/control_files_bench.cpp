@@ -91,15 +91,17 @@ bool write_file(const std::string& path, void (*writer)(FILE*)) {
   return fclose(fp) == 0;
 }
 
+// As a daemon reloads: the whole file read into memory, then parsed there.
 bool parse_file(const std::string& path, const char* name) {
+  static std::string bytes;
   FILE* fp = fopen(path.c_str(), "r");
   if (fp == nullptr) return false;
-  RJCin = fp;
-  RJCreadfile = name;
-  int result = RJCparse();
+  bytes.clear();
+  char buf[1 << 16];
+  size_t n;
+  while ((n = fread(buf, 1, sizeof buf, fp)) > 0) bytes.append(buf, n);
   fclose(fp);
-  RJCin = nullptr;
-  return result == 0;
+  return RJC_parse_string(bytes.data(), bytes.size(), name) == 0;
 }
 
 off_t size_of(const std::string& path) {
