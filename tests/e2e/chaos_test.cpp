@@ -120,8 +120,10 @@ bool excused(const std::vector<Stamp>& stamps, const std::vector<Event>& events,
         seen_end = thaw;
     }
     for (const Event& e : events) {
+      // A render forked just before the kill stamps its start a moment after.
+      const long long spawn_slack = 100000000;
       if ((e.fault == Fault::kKillDaemon || e.fault == Fault::kPowerCut) && e.target == s.host &&
-          s.start_ns <= e.at_ns && seen_end >= e.at_ns - window)
+          s.start_ns <= e.at_ns + spawn_slack && seen_end >= e.at_ns - window)
         return true;
     }
   }
