@@ -4,7 +4,6 @@
 #include <unistd.h>
 
 #include <climits>
-#include <cstdio>
 #include <cstdlib>
 #include <ctime>
 #include <initializer_list>
@@ -19,8 +18,10 @@ namespace {
 // Monday 2024-01-01 09:00 UTC.
 time_t monday_0900() { return 1704099600; }
 
-/// The task file text of the one job "scene.sdl" with `n` records.
-std::string scene(int n, const std::string& records) {
+/// The task file of the one job "scene.sdl" holding the records `rows` (see rec_lines).
+std::string scene(const std::string& rows) {
+  int n = 0;
+  std::string records = rec_lines(rows, &n);
   return group_line("scene.sdl", 1, n, n) + records;
 }
 
@@ -63,9 +64,8 @@ class SelectTest : public ControlDirTest {
     job->status.set("pending");
     job->priority = priority;
     job->animate = 1;
-    job->frames[0] = 1;
+    job->frames[0] = job->frames[2] = 1;
     job->frames[1] = 10;
-    job->frames[2] = 1;
     for (Dev* d : hosts) RndDevList_add(job, d);
     return job;
   }
@@ -79,9 +79,8 @@ class SelectTest : public ControlDirTest {
   }
 
   static TASK* entry_of(Job* job, int id) {
-    for (TASK* e = rndctl.tasks; e != nullptr; e = e->next) {
+    for (TASK* e = rndctl.tasks; e != nullptr; e = e->next)
       if (e->job == job && e->rec != nullptr && e->rec->id == id) return e;
-    }
     return nullptr;
   }
 
@@ -89,14 +88,12 @@ class SelectTest : public ControlDirTest {
   Dev *here_ = nullptr, *there_ = nullptr;
 };
 
-// --- Cutting a host-sized piece ---------------------------------------------
-
 struct CutCase {
   const char* label;
   int max_frames;
   float end, by;
   int animate;
-  float first_end, rest;  // the started piece 1..first_end; the pending rest from `rest`, 0: none
+  const char* after;  // the records of the task file afterwards
   int max_frames_after;
 };
 
@@ -112,21 +109,20 @@ TEST_P(Cutting, FirstPickCutsTheHostsShareOffTheJob) {
   TASK* picked = Task_get();
   ASSERT_NE(picked, nullptr);
   EXPECT_EQ(picked->rec->status, TASK_STARTED);
-  const int n = c.rest != 0 ? 2 : 1;
-  EXPECT_EQ(tasks(),
-            scene(n, rec_line(0, 1, c.first_end, 1, 1, 0, "STARTED") +
-                         (n == 2 ? rec_line(1, c.rest, c.end, c.rest, 0, 0, "PENDING") : "")));
+  EXPECT_EQ(tasks(), scene(c.after));
   EXPECT_EQ(here_->max_frames, c.max_frames_after);
 }
 
-INSTANTIATE_TEST_SUITE_P(Ranges, Cutting,
-                         testing::Values(CutCase{"three_of_ten", 3, 10, 1, 1, 3, 4, 3},
-                                         CutCase{"zero_means_one", 0, 10, 1, 1, 1, 2, 1},
-                                         CutCase{"by_two", 3, 10, 2, 1, 5, 7, 3},
-                                         CutCase{"fewer_steps_than_max", 3, 3, 1, 1, 3, 0, 3},
-                                         CutCase{"still_image_never_cut", 3, 10, 1, 0, 10, 0, 3},
-                                         CutCase{"zero_step_never_cut", 3, 10, 0, 1, 10, 0, 3}),
-                         Label());
+INSTANTIATE_TEST_SUITE_P(
+    Ranges, Cutting,
+    testing::Values(
+        CutCase{"three_of_ten", 3, 10, 1, 1, "0 1 3 1 1 0 STARTED, 1 4 10 4 0 0 PENDING", 3},
+        CutCase{"zero_means_one", 0, 10, 1, 1, "0 1 1 1 1 0 STARTED, 1 2 10 2 0 0 PENDING", 1},
+        CutCase{"by_two", 3, 10, 2, 1, "0 1 5 1 1 0 STARTED, 1 7 10 7 0 0 PENDING", 3},
+        CutCase{"fewer_steps_than_max", 3, 3, 1, 1, "0 1 3 1 1 0 STARTED", 3},
+        CutCase{"still_image_never_cut", 3, 10, 1, 0, "0 1 10 1 1 0 STARTED", 3},
+        CutCase{"zero_step_never_cut", 3, 10, 0, 1, "0 1 10 1 1 0 STARTED", 3}),
+    Label());
 
 TEST_F(SelectTest, EachTaskOnTheHostTakesAProcessSlot) {
   here_->num_processors = 2;
@@ -138,13 +134,11 @@ TEST_F(SelectTest, EachTaskOnTheHostTakesAProcessSlot) {
   // Two tasks of one job fill both processors: nothing more.
   EXPECT_EQ(Task_get(), nullptr);
   EXPECT_EQ(Dev_processes_available(here_), 0);
-  EXPECT_EQ(tasks(),
-            scene(3, rec_line(0, 1, 3, 1, 1, 0, "STARTED") + rec_line(1, 4, 6, 4, 1, 0, "STARTED") +
-                         rec_line(2, 7, 10, 7, 0, 0, "PENDING")));
+  EXPECT_EQ(tasks(), scene("0 1 3 1 1 0 STARTED, 1 4 6 4 1 0 STARTED, 2 7 10 7 0 0 PENDING"));
   // The running-task list mirrors the file.
   EXPECT_EQ(count_entries(), 3);
-  EXPECT_EQ(entry_of(job, 0), first);
-  EXPECT_EQ(entry_of(job, 1), second);
+  EXPECT_EQ((std::vector<TASK*>{entry_of(job, 0), entry_of(job, 1)}),
+            (std::vector<TASK*>{first, second}));
 
   // A host that never set its processors runs one task.
   there_->num_processors = 0;
@@ -152,14 +146,11 @@ TEST_F(SelectTest, EachTaskOnTheHostTakesAProcessSlot) {
   EXPECT_EQ(there_->num_processors, 1);
 }
 
-// --- Which job ---------------------------------------------------------------
-
 struct PriorityCase {
   const char* label;
   int running;
-  // One job each, in job list order.  Their first tasks go on the front of
-  // the task groups, so the groups run the other way: "first" below means
-  // last in this list.
+  // One job each, in job list order.  Their first tasks go on the front of the task groups, so
+  // the groups run the other way: "first" below means last in this list.
   std::vector<int> priorities;
   int chosen;  // position in this list, -1 for none
 };
@@ -169,20 +160,15 @@ class Priority : public SelectTest, public testing::WithParamInterface<PriorityC
 TEST_P(Priority, ChoosesTheJob) {
   const PriorityCase& c = GetParam();
   std::vector<Job*> jobs;
-  for (size_t i = 0; i < c.priorities.size(); ++i) {
-    std::string name = "job" + std::to_string(i) + ".sdl";
-    jobs.push_back(make_job(static_cast<int>(i) + 1, name.c_str(), c.priorities[i], {here_}));
-  }
+  for (size_t i = 0; i < c.priorities.size(); ++i)
+    jobs.push_back(make_job(static_cast<int>(i) + 1, ("job" + std::to_string(i) + ".sdl").c_str(),
+                            c.priorities[i], {here_}));
   rndctl.running = c.running;
   TASK* picked = Task_get();
-  if (c.chosen < 0) {
-    EXPECT_EQ(picked, nullptr);
-    // The jobs' first tasks are in the file all the same, waiting.
-    EXPECT_EQ(count_entries(), static_cast<int>(jobs.size()));
-  } else {
-    ASSERT_NE(picked, nullptr);
-    EXPECT_EQ(picked->job, jobs[static_cast<size_t>(c.chosen)]);
-  }
+  EXPECT_EQ(picked != nullptr ? picked->job : nullptr,
+            c.chosen < 0 ? nullptr : jobs[static_cast<size_t>(c.chosen)]);
+  // None picked, the jobs' first tasks are in the file all the same, waiting.
+  EXPECT_TRUE(c.chosen >= 0 || count_entries() == static_cast<int>(jobs.size())) << count_entries();
 }
 
 INSTANTIATE_TEST_SUITE_P(Jobs, Priority,
@@ -204,14 +190,12 @@ TEST_F(SelectTest, JobsThisHostMayNotRenderAreLeftAlone) {
   EXPECT_EQ(isa_job_using_host("testhost", nohosts), 0);
 }
 
-// --- Failed tasks -------------------------------------------------------------
-
 struct FailCase {
   const char* label;
   float current;
   int retries;
-  std::string file;
-  int status;  // of the failed task's entry afterwards
+  const char* file;  // its records afterwards
+  int status;        // of the failed task's entry afterwards
 };
 
 class PutBack : public SelectTest, public testing::WithParamInterface<FailCase> {};
@@ -227,34 +211,27 @@ TEST_P(PutBack, FailedTaskGoesBackOrIsCutWhereItStopped) {
   failed->rec->retries = c.retries;
 
   EXPECT_EQ(Split_first_splittable_failed_tasks(), nullptr);
-  EXPECT_EQ(tasks(), c.file);
+  EXPECT_EQ(tasks(), scene(c.file));
   EXPECT_EQ(failed->rec->status, c.status);
-  if (c.status == TASK_FINISHED) {
-    // The remainder is a fresh task: any host, this one included, takes it.
-    TASK* again = Task_get();
-    EXPECT_TRUE(again != nullptr && again == entry_of(job, 1));
-  } else {
-    EXPECT_EQ(count_entries(), 1);
-  }
+  // A remainder cut off is a fresh task: any host, this one included, takes it.
+  TASK* again = c.status == TASK_FINISHED ? Task_get() : nullptr;
+  EXPECT_EQ(again != nullptr && again == entry_of(job, 1), c.status == TASK_FINISHED);
+  EXPECT_TRUE(c.status == TASK_FINISHED || count_entries() == 1) << count_entries();
 }
 
 INSTANTIATE_TEST_SUITE_P(
     Failures, PutBack,
-    testing::Values(FailCase{"after_progress", 5, 0,
-                             scene(2, rec_line(0, 1, 4, 4, 1, 1, "FINISHED") +
-                                          rec_line(1, 5, 10, 5, 0, 0, "PENDING")),
+    testing::Values(FailCase{"after_progress", 5, 0, "0 1 4 4 1 1 FINISHED, 1 5 10 5 0 0 PENDING",
                              TASK_FINISHED},
-                    FailCase{"no_progress", 1, 0, scene(1, rec_line(0, 1, 10, 1, 1, 1, "PENDING")),
-                             TASK_PENDING},
-                    FailCase{"tenth_failure", 5, 10,
-                             scene(1, rec_line(0, 1, 10, 1, 1, 0, "STARTED")), TASK_FAILED}),
+                    FailCase{"no_progress", 1, 0, "0 1 10 1 1 1 PENDING", TASK_PENDING},
+                    FailCase{"tenth_failure", 5, 10, "0 1 10 1 1 0 STARTED", TASK_FAILED}),
     Label());
 
 struct RetryCase {
   const char* label;
-  int failed_on;  // resource index the task failed on
+  const char* failed_on;  // resource index the task failed on
   bool other_host_listed;
-  bool taken;
+  const char* after;  // the record afterwards
 };
 
 class Retry : public SelectTest, public testing::WithParamInterface<RetryCase> {};
@@ -264,48 +241,40 @@ TEST_P(Retry, TaskThatFailedHereWaitsOnlyWhenAnotherHostCanTakeIt) {
   Job* job = c.other_host_listed ? make_job(1, "scene.sdl", 0, {here_, there_})
                                  : make_job(1, "scene.sdl", 0, {here_});
   job->status.set("started");
-  write_file("Render_Tasks", scene(1, rec_line(0, 1, 3, 1, c.failed_on, 2, "PENDING")));
+  write_file("Render_Tasks", scene(std::string("0 1 3 1 ") + c.failed_on + " 2 PENDING"));
   TASK* picked = Task_get();
-  EXPECT_EQ(picked != nullptr, c.taken);
-  EXPECT_EQ(tasks(), scene(1, rec_line(0, 1, 3, 1, c.taken ? 1 : c.failed_on, 2,
-                                       c.taken ? "STARTED" : "PENDING")));
+  EXPECT_EQ(tasks(), scene(c.after));
+  EXPECT_EQ(picked != nullptr, std::string(c.after).ends_with("STARTED"));
 }
 
-INSTANTIATE_TEST_SUITE_P(Hosts, Retry,
-                         testing::Values(RetryCase{"failed_here_other_host_waits", 1, true, false},
-                                         RetryCase{"failed_here_only_host_retries", 1, false, true},
-                                         RetryCase{"failed_elsewhere", 2, true, true}),
-                         Label());
-
-// --- The mirror of the file -------------------------------------------------------
+INSTANTIATE_TEST_SUITE_P(
+    Hosts, Retry,
+    testing::Values(RetryCase{"failed_here_other_host_waits", "1", true, "0 1 3 1 1 2 PENDING"},
+                    RetryCase{"failed_here_only_host_retries", "1", false, "0 1 3 1 1 2 STARTED"},
+                    RetryCase{"failed_elsewhere", "2", true, "0 1 3 1 1 2 STARTED"}),
+    Label());
 
 TEST_F(SelectTest, EntriesFollowTheFileAndThisHostKeepsItsOwnStatus) {
   Job* job = make_job(1, "scene.sdl", 0, {here_, there_});
   job->status.set("started");
-  write_file("Render_Tasks", scene(2, rec_line(0, 1, 3, 1, 2, 0, "STARTED") +
-                                          rec_line(1, 4, 10, 4, 0, 0, "PENDING")));
+  write_file("Render_Tasks", scene("0 1 3 1 2 0 STARTED, 1 4 10 4 0 0 PENDING"));
   TASK* mine = Task_get();
-  ASSERT_NE(mine, nullptr);
-  EXPECT_EQ(mine->rec->id, 1);
+  ASSERT_TRUE(mine != nullptr && mine->rec->id == 1);
   TASK* theirs = entry_of(job, 0);
   ASSERT_NE(theirs, nullptr);
 
   // Meanwhile: the other host finished, this one got its process going.
   mine->rec->status = TASK_RUNNING;
-  write_file("Render_Tasks", scene(3, rec_line(0, 1, 3, 3, 2, 0, "FINISHED") +
-                                          rec_line(1, 4, 6, 4, 1, 0, "STARTED") +
-                                          rec_line(2, 7, 10, 7, 0, 0, "PENDING")));
+  write_file("Render_Tasks",
+             scene("0 1 3 3 2 0 FINISHED, 1 4 6 4 1 0 STARTED, 2 7 10 7 0 0 PENDING"));
   rndctl.running = 1;  // only priority 0 jobs, as this one is
   TASK* next = Task_get();
-  ASSERT_NE(next, nullptr);
-  EXPECT_EQ(next->rec->id, 2);
+  ASSERT_TRUE(next != nullptr && next->rec->id == 2);
   EXPECT_EQ(entry_of(job, 0), theirs);
   EXPECT_EQ(theirs->rec->status, TASK_FINISHED);
   EXPECT_FLOAT_EQ(theirs->rec->current, 3);
-  EXPECT_EQ(tasks(), scene(4, rec_line(0, 1, 3, 3, 2, 0, "FINISHED") +
-                                  rec_line(1, 4, 6, 4, 1, 0, "RUNNING") +
-                                  rec_line(2, 7, 9, 7, 1, 0, "STARTED") +
-                                  rec_line(3, 10, 10, 10, 0, 0, "PENDING")));
+  EXPECT_EQ(tasks(), scene("0 1 3 3 2 0 FINISHED, 1 4 6 4 1 0 RUNNING, 2 7 9 7 1 0 STARTED, "
+                           "3 10 10 10 0 0 PENDING"));
 
   // The job's group leaves the file: its entries go too.
   write_file("Render_Tasks", "");
@@ -318,11 +287,11 @@ TEST_F(SelectTest, EntriesFollowTheFileAndThisHostKeepsItsOwnStatus) {
 // this host's, and never takes a record of a rebuilt group for its own.
 struct OwnerCase {
   const char* label;
-  std::string file;  // the group as another host or an editor left it
+  const char* file;  // the group's records as another host or an editor left them
   int status;        // of the entry of id 0 afterwards
   bool kept;         // the entry is still this daemon's piece
   int entries;
-  std::string after;  // the file afterwards ("": unchanged)
+  const char* after;  // the records afterwards ("": unchanged)
 };
 
 class Owner : public SelectTest, public testing::WithParamInterface<OwnerCase> {};
@@ -334,9 +303,9 @@ TEST_P(Owner, NextSelectionWritesOnlyWhatThisHostStillOwns) {
   ASSERT_TRUE(mine != nullptr && mine->rec->id == 0 && mine->taken);
   mine->rec->status = TASK_RUNNING;
   rndctl.running = 1;  // a job of priority 1 is not started now: nothing new is picked
-  write_file("Render_Tasks", c.file);
+  write_file("Render_Tasks", scene(c.file));
   EXPECT_EQ(Task_get(), nullptr);
-  EXPECT_EQ(tasks(), c.after.empty() ? c.file : c.after);
+  EXPECT_EQ(tasks(), scene(*c.after != '\0' ? c.after : c.file));
   EXPECT_EQ(count_entries(), c.entries);
   TASK* e = entry_of(job, 0);
   ASSERT_NE(e, nullptr);
@@ -346,33 +315,18 @@ TEST_P(Owner, NextSelectionWritesOnlyWhatThisHostStillOwns) {
 
 INSTANTIATE_TEST_SUITE_P(
     Owners, Owner,
-    testing::Values(OwnerCase{"still_ours",
-                              scene(2, rec_line(0, 1, 3, 1, 1, 0, "STARTED") +
-                                           rec_line(1, 4, 10, 4, 0, 0, "PENDING")),
-                              TASK_RUNNING, true, 2,
-                              scene(2, rec_line(0, 1, 3, 1, 1, 0, "RUNNING") +
-                                           rec_line(1, 4, 10, 4, 0, 0, "PENDING"))},
-                    OwnerCase{"put_back",
-                              scene(2, rec_line(0, 1, 3, 1, 1, 0, "PENDING") +
-                                           rec_line(1, 4, 10, 4, 0, 0, "PENDING")),
-                              TASK_PENDING, false, 2, ""},
-                    OwnerCase{"taken_by_another_host",
-                              scene(2, rec_line(0, 1, 3, 1, 2, 0, "RUNNING") +
-                                           rec_line(1, 4, 10, 4, 0, 0, "PENDING")),
-                              TASK_RUNNING, false, 2, ""},
-                    OwnerCase{"rebuilt_from_id_0", scene(1, rec_line(0, 1, 10, 1, 0, 0, "PENDING")),
-                              TASK_PENDING, false, 1, ""},
-                    OwnerCase{"lost_elsewhere_and_left_by_an_earlier_daemon",
-                              scene(3, rec_line(0, 1, 3, 1, 2, 0, "FINISHED") +
-                                           rec_line(1, 4, 6, 4, 1, 0, "RUNNING") +
-                                           rec_line(2, 7, 10, 7, 0, 0, "PENDING")),
-                              TASK_FINISHED, false, 3,
-                              scene(3, rec_line(0, 1, 3, 1, 2, 0, "FINISHED") +
-                                           rec_line(1, 4, 6, 4, 1, 0, "PENDING") +
-                                           rec_line(2, 7, 10, 7, 0, 0, "PENDING"))}),
+    testing::Values(
+        OwnerCase{"still_ours", "0 1 3 1 1 0 STARTED, 1 4 10 4 0 0 PENDING", TASK_RUNNING, true, 2,
+                  "0 1 3 1 1 0 RUNNING, 1 4 10 4 0 0 PENDING"},
+        OwnerCase{"put_back", "0 1 3 1 1 0 PENDING, 1 4 10 4 0 0 PENDING", TASK_PENDING, false, 2,
+                  ""},
+        OwnerCase{"taken_by_another_host", "0 1 3 1 2 0 RUNNING, 1 4 10 4 0 0 PENDING",
+                  TASK_RUNNING, false, 2, ""},
+        OwnerCase{"rebuilt_from_id_0", "0 1 10 1 0 0 PENDING", TASK_PENDING, false, 1, ""},
+        OwnerCase{"lost_elsewhere_and_left_by_an_earlier_daemon",
+                  "0 1 3 1 2 0 FINISHED, 1 4 6 4 1 0 RUNNING, 2 7 10 7 0 0 PENDING", TASK_FINISHED,
+                  false, 3, "0 1 3 1 2 0 FINISHED, 1 4 6 4 1 0 PENDING, 2 7 10 7 0 0 PENDING"}),
     Label());
-
-// --- The service loop's call -------------------------------------------------------
 
 TEST_F(SelectTest, LockedHostPicksNothingAndSleepsUntilTheLockEnds) {
   make_job(1, "scene.sdl", 0, {here_});
