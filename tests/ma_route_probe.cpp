@@ -1,7 +1,6 @@
-// A program linked like the daemon, with the process allocator routed into
-// the checking allocator.  It exercises every entry point the C and C++
-// libraries may use, from several threads and across a fork, and exits 0
-// when all held; run by ctest in normal and in debug mode.
+// A program linked like the daemon, with the process allocator routed into the checking
+// allocator: every C and C++ entry point, from several threads and across a fork; exits 0 when
+// all held.  Run by ctest in normal and in debug mode.
 #include <malloc.h>
 #include <stdio.h>
 #include <stdlib.h>
@@ -16,19 +15,16 @@
 
 #include "Shared/memory/MA_rtns.h"
 
-namespace {
+static int failures = 0;
 
-int failures = 0;
-
-void expect(bool ok, const char* what) {
-  if (ok) return;
-  fprintf(stderr, "FAILED: %s\n", what);
-  ++failures;
+static void expect(bool ok, const char* what) {
+  if (!ok) fprintf(stderr, "FAILED: %s\n", what);
+  failures += !ok;
 }
 
-bool aligned(const void* p, size_t to) { return reinterpret_cast<uintptr_t>(p) % to == 0; }
+static bool aligned(const void* p, size_t to) { return reinterpret_cast<uintptr_t>(p) % to == 0; }
 
-void entry_points() {
+int main() {
   // Routed: a 100-byte malloc is a 128-byte bucket block (or exact in debug mode).
   char* p = static_cast<char*>(malloc(100));
   expect(p != nullptr && aligned(p, 16), "malloc");
@@ -37,34 +33,24 @@ void entry_points() {
   p = static_cast<char*>(realloc(p, 5000));
   expect(p != nullptr && p[99] == 'p', "realloc keeps the bytes");
   free(p);
-
-  auto* z = static_cast<unsigned char*>(calloc(1000, 3));
-  bool zero = z != nullptr;
-  for (int i = 0; zero && i < 3000; ++i) zero = z[i] == 0;
-  expect(zero, "calloc zeroes");
+  char* z = static_cast<char*>(calloc(1000, 3));
+  expect(z != nullptr && std::string(z, 3000) == std::string(3000, '\0'), "calloc zeroes");
   free(z);
   volatile size_t huge = SIZE_MAX / 2;  // keeps the compiler from refusing the call itself
   expect(calloc(huge, 3) == nullptr, "calloc overflow");
 
   for (size_t align : {32, 64, 4096}) {
-    void* a = aligned_alloc(align, 3 * align);
-    void* m = memalign(align, 10);
-    void* q = nullptr;
+    void *a = aligned_alloc(align, 3 * align), *m = memalign(align, 10), *q = nullptr;
     expect(posix_memalign(&q, align, 1) == 0, "posix_memalign");
-    expect(a && m && q && aligned(a, align) && aligned(m, align) && aligned(q, align),
+    expect(a && m && q && aligned(a, align) && aligned(m, align) && aligned(q, align) &&
+               malloc_usable_size(a) >= 3 * align,
            "aligned entry points");
-    expect(malloc_usable_size(a) >= 3 * align, "usable size of an aligned block");
     memset(a, 1, 3 * align);
-    a = realloc(a, 100000);
-    free(a);
-    free(m);
-    free(q);
+    for (void* f : {realloc(a, 100000), m, q}) free(f);
   }
-  void* v = valloc(10);
-  void* pv = pvalloc(10);
+  void *v = valloc(10), *pv = pvalloc(10);
   expect(aligned(v, 4096) && aligned(pv, 4096) && malloc_usable_size(pv) >= 4096, "valloc");
-  free(v);
-  free(pv);
+  for (void* f : {v, pv, static_cast<void*>(nullptr)}) free(f);
 
   // Beyond the last bucket: served, by a mapping of its own.
   size_t big = size_t{300} << 20;
@@ -74,7 +60,6 @@ void entry_points() {
   b = static_cast<char*>(realloc(b, big * 2));
   expect(b != nullptr && b[0] == 1, "large realloc");
   free(b);
-  free(nullptr);
 
   // The C++ and C libraries go through the same entry points.
   std::vector<std::string> words;
@@ -83,11 +68,8 @@ void entry_points() {
   expect(d != nullptr && strcmp(d, "routed") == 0, "strdup");
   free(d);
   FILE* fp = tmpfile();
-  expect(fp != nullptr && fprintf(fp, "%s\n", "line") == 5, "stdio");
-  if (fp != nullptr) fclose(fp);
-}
+  expect(fp != nullptr && fprintf(fp, "%s\n", "line") == 5 && fclose(fp) == 0, "stdio");
 
-void threads() {
   std::vector<std::thread> pool;
   for (int t = 0; t < 4; ++t)
     pool.emplace_back([t] {
@@ -97,31 +79,14 @@ void threads() {
         if (held.size() > 50) held.erase(held.begin() + i % 50);
       }
       for (const auto& v : held)
-        for (int x : v)
-          if (x != t) abort();
+        if (v != std::vector<int>(v.size(), t)) abort();
     });
   for (std::thread& t : pool) t.join();
-}
 
-void fork_child() {
   pid_t pid = fork();
-  if (pid == 0) {
-    void* p = malloc(64);
-    free(p);
-    _exit(p != nullptr ? 0 : 1);
-  }
-  int status = 0;
-  expect(
-      pid > 0 && waitpid(pid, &status, 0) == pid && WIFEXITED(status) && WEXITSTATUS(status) == 0,
-      "allocation in a forked child");
-}
-
-}  // namespace
-
-int main() {
-  entry_points();
-  threads();
-  fork_child();
+  if (pid == 0) _exit(malloc(64) != nullptr ? 0 : 1);  // allocation in a forked child
+  int st = 0;
+  expect(pid > 0 && waitpid(pid, &st, 0) == pid && WIFEXITED(st) && WEXITSTATUS(st) == 0, "fork");
   MA_allcheck(__LINE__, "tests/ma_route_probe");
   if (failures == 0) printf("routed allocator: all entry points held\n");
   return failures == 0 ? 0 : 1;

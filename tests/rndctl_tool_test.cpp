@@ -1,89 +1,60 @@
-// The command-line tool's pure parts: what it accepts from a user before
-// anything is written, and how it draws.
+// The command-line tool's pure parts: what it accepts before anything is written, how it draws.
 #if defined(RNDCTL_TOOL)
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
 #include <cstdio>
 #include <cstdlib>
-#include <functional>
 #include <nlohmann/json.hpp>
 #include <sstream>
 #include <string>
 #include <vector>
 
 #include "tests/support/test_support.h"
+#include "tests/support/text_records.h"
 #include "tools/rndctl/editor_side.h"
 #include "tools/rndctl/tables.h"
 
 namespace {
 
-struct FramesCase {
-  const char* text;
-  bool ok;
-  float start, end, by;
-};
-class FramesTest : public ::testing::TestWithParam<FramesCase> {};
+using nlohmann::json;
 
-TEST_P(FramesTest, ParsesOrRefuses) {
-  const FramesCase& c = GetParam();
+// What a frame range or a schedule block parses to, "refused" or "refused, no reason".
+std::string frames(const char* text) {
   CtlFrames f;
   std::string why;
-  ASSERT_EQ(Ctl_parse_frames(c.text, &f, &why), c.ok) << c.text << ": " << why;
-  if (!c.ok) {
-    EXPECT_FALSE(why.empty());
-    return;
-  }
-  EXPECT_EQ(f.start, c.start);
-  EXPECT_EQ(f.end, c.end);
-  EXPECT_EQ(f.by, c.by);
+  char buf[64];
+  if (!Ctl_parse_frames(text, &f, &why)) return why.empty() ? "refused, no reason" : "refused";
+  snprintf(buf, sizeof buf, "%g-%g:%g", f.start, f.end, f.by);
+  return buf;
 }
-
-INSTANTIATE_TEST_SUITE_P(
-    Ranges, FramesTest,
-    ::testing::Values(FramesCase{"1-10", true, 1, 10, 1}, FramesCase{"1-10:2", true, 1, 10, 2},
-                      FramesCase{"-5--1", true, -5, -1, 1}, FramesCase{"3-3", true, 3, 3, 1},
-                      FramesCase{"1.5-2.5:0.5", true, 1.5f, 2.5f, 0.5f},
-                      FramesCase{"10-1", false, 0, 0, 0}, FramesCase{"1-10:0", false, 0, 0, 0},
-                      FramesCase{"1-10:-1", false, 0, 0, 0}, FramesCase{"1", false, 0, 0, 0},
-                      FramesCase{"a-b", false, 0, 0, 0}, FramesCase{"1-10x", false, 0, 0, 0},
-                      FramesCase{"", false, 0, 0, 0}));
-
-struct BlockCase {
-  const char* text;
-  bool ok;
-  int start, end;
-  const char* first;
-  const char* last;
-};
-class BlockTest : public ::testing::TestWithParam<BlockCase> {};
-
-TEST_P(BlockTest, ParsesOrRefuses) {
-  const BlockCase& c = GetParam();
+std::string block(const char* text) {
   CtlBlock b;
   std::string why;
-  ASSERT_EQ(Ctl_parse_block(c.text, &b, &why), c.ok) << c.text << ": " << why;
-  if (!c.ok) return;
-  EXPECT_EQ(b.start, c.start);
-  EXPECT_EQ(b.end, c.end);
-  EXPECT_EQ(b.first_day, c.first);
-  EXPECT_EQ(b.last_day, c.last);
+  if (!Ctl_parse_block(text, &b, &why)) return "refused";
+  return std::to_string(b.start) + "-" + std::to_string(b.end) + " " + b.first_day + "-" +
+         b.last_day;
 }
 
-INSTANTIATE_TEST_SUITE_P(
-    Schedules, BlockTest,
-    ::testing::Values(BlockCase{"800-1700 Monday-Friday", true, 800, 1700, "monday", "friday"},
-                      BlockCase{"2200-600 sat", true, 2200, 600, "saturday", "saturday"},
-                      BlockCase{"0-2400 Sun", true, 0, 2400, "sunday", "sunday"},
-                      BlockCase{"830-1700 Mon", true, 830, 1700, "monday", "monday"},
-                      BlockCase{"815-1700 Mon", false, 0, 0, "", ""},  // off the half hours
-                      BlockCase{"800-2500 Mon", false, 0, 0, "", ""},  // past the day
-                      BlockCase{"2400-100 Mon", false, 0, 0, "", ""},  // 2400 only ends
-                      BlockCase{"800-800 Mon", false, 0, 0, "", ""},   // empty
-                      BlockCase{"800-1700 Friday-Monday", false, 0, 0, "", ""},
-                      BlockCase{"800-1700 SUN", false, 0, 0, "", ""},  // the queue's names only
-                      BlockCase{"800-1700", false, 0, 0, "", ""},
-                      BlockCase{"8am-5pm Mon", false, 0, 0, "", ""}));
+TEST(RndctlInput, FramesAndSchedulesParseOrAreRefused) {
+  const std::vector<std::pair<const char*, const char*>> ranges = {
+      {"1-10", "1-10:1"},    {"1-10:2", "1-10:2"},           {"-5--1", "-5--1:1"},
+      {"3-3", "3-3:1"},      {"1.5-2.5:0.5", "1.5-2.5:0.5"}, {"10-1", "refused"},
+      {"1-10:0", "refused"}, {"1-10:-1", "refused"},         {"1", "refused"},
+      {"a-b", "refused"},    {"1-10x", "refused"},           {"", "refused"}};
+  for (const auto& [text, want] : ranges) EXPECT_EQ(frames(text), want) << text;
+  const std::vector<std::pair<const char*, const char*>> blocks = {
+      {"800-1700 Monday-Friday", "800-1700 monday-friday"},
+      {"2200-600 sat", "2200-600 saturday-saturday"},
+      {"0-2400 Sun", "0-2400 sunday-sunday"},
+      {"830-1700 Mon", "830-1700 monday-monday"}};
+  for (const auto& [text, want] : blocks) EXPECT_EQ(block(text), want) << text;
+  // Off the half hours, past the day, 2400 only ends, empty, backwards, not the queue's day
+  // names, no days, not the queue's times.
+  for (const char* bad : {"815-1700 Mon", "800-2500 Mon", "2400-100 Mon", "800-800 Mon",
+                          "800-1700 Friday-Monday", "800-1700 SUN", "800-1700", "8am-5pm Mon"})
+    EXPECT_EQ(block(bad), "refused") << bad;
+}
 
 // A span over midnight is split, and Saturday night runs into Sunday.
 TEST(RndctlSchedule, ASpanOverMidnightFillsTheNightsAndMorningsAfter) {
@@ -104,18 +75,16 @@ TEST(RndctlInput, RefusesWhatTheReaderCannotCarry) {
   for (const char* bad : {"two words", "12", "status", "runs", "-x", "a\"b", ""})
     EXPECT_FALSE(Ctl_word_ok(bad, &why)) << bad;
   EXPECT_TRUE(Ctl_string_ok("/a path/with blanks", &why));
-  EXPECT_FALSE(Ctl_string_ok("a\"b", &why));
-  EXPECT_FALSE(Ctl_string_ok("a\nb", &why));
-  EXPECT_FALSE(Ctl_string_ok(std::string(RJC_STRING_LIMIT + 1, 'x'), &why));
+  for (const std::string& bad :
+       {std::string("a\"b"), std::string("a\nb"), std::string(RJC_STRING_LIMIT + 1, 'x')})
+    EXPECT_FALSE(Ctl_string_ok(bad, &why)) << bad;
   EXPECT_EQ(Ctl_split("a,,b,", ','), (std::vector<std::string>{"a", "b"}));
 }
 
 TEST(RndctlOutput, BarsAndCutsKeepTheirWidth) {
-  EXPECT_EQ(Out_bar(0.0, 7), "[.....]");
-  EXPECT_EQ(Out_bar(0.5, 12), "[#####.....]");
-  EXPECT_EQ(Out_bar(2.0, 7), "[#####]");
-  EXPECT_EQ(Out_fit("abcdef", 4), "abc~");
-  EXPECT_EQ(Out_fit("abc", 4), "abc");
+  EXPECT_EQ((std::vector<std::string>{Out_bar(0.0, 7), Out_bar(0.5, 12), Out_bar(2.0, 7),
+                                      Out_fit("abcdef", 4), Out_fit("abc", 4)}),
+            (std::vector<std::string>{"[.....]", "[#####.....]", "[#####]", "abc~", "abc"}));
 }
 
 // The tables a user reads, on a farm of three hosts and three jobs: one part
@@ -141,52 +110,39 @@ class RndctlTables : public ControlDirTest {
     std::istringstream lines(got);
     for (std::string line; std::getline(lines, line);) EXPECT_LE(line.size(), 80u) << line;
   }
-  static std::string printed(const std::function<void(FILE*)>& print) {
-    char* buf = nullptr;
-    size_t size = 0;
-    FILE* fp = open_memstream(&buf, &size);
-    print(fp);
-    fclose(fp);
-    std::string text(buf, size);
-    free(buf);
-    return text;
-  }
   std::string golden_;
   CtlTasks tasks_;
 };
 
 TEST_F(RndctlTables, JobAndHostTablesMatchTheirGoldenText) {
-  expect_golden("jobs.txt", printed([](FILE* fp) { Out_jobs_table(fp, false); }));
-  expect_golden("hosts.txt", printed([&](FILE* fp) { Out_hosts_table(fp, tasks_, false); }));
+  expect_golden("jobs.txt", text_records::written([](FILE* fp) { Out_jobs_table(fp, false); }));
+  expect_golden("hosts.txt",
+                text_records::written([&](FILE* fp) { Out_hosts_table(fp, tasks_, false); }));
   // Colour only when asked for, and then without shifting the columns.
-  std::string coloured = printed([](FILE* fp) { Out_jobs_table(fp, true); });
+  std::string coloured = text_records::written([](FILE* fp) { Out_jobs_table(fp, true); });
   EXPECT_NE(coloured.find("\033[32mfinished  \033[0m"), std::string::npos) << coloured;
 }
 
 TEST_F(RndctlTables, JsonReadsBackWithEveryField) {
-  nlohmann::json jobs = nlohmann::json::parse(Out_jobs_json(&tasks_).dump(2));
-  ASSERT_EQ(jobs.size(), 3u);
-  EXPECT_EQ(jobs[0]["name"], "shot_010");
-  EXPECT_EQ(jobs[0]["state"], "45.00%");
-  EXPECT_EQ(jobs[0]["hosts"], nlohmann::json({"render02", "render01"}));
-  EXPECT_EQ(jobs[0]["frames"], nlohmann::json({1.0, 120.0, 1.0}));
-  EXPECT_EQ(jobs[0]["doneframes"], 54);
-  ASSERT_EQ(jobs[0]["tasks"].size(), 2u);
-  EXPECT_EQ(jobs[0]["tasks"][0]["status"], "RUNNING");
-  EXPECT_EQ(jobs[0]["tasks"][0]["host"], "render01");
-  EXPECT_EQ(jobs[1]["name"], "a_very_long_job_name_indeed");  // never cut
-  EXPECT_EQ(jobs[1]["run"], "PAUSED");
-  EXPECT_EQ(jobs[2]["hosts"].size(), 3u);
-
-  nlohmann::json hosts = nlohmann::json::parse(Out_hosts_json(tasks_).dump(2));
-  ASSERT_EQ(hosts.size(), 3u);
-  EXPECT_EQ(hosts[0]["alive"], true);
-  EXPECT_EQ(hosts[0]["renders"], "shot_010:1-4");
-  EXPECT_EQ(hosts[1]["host"], "render02.farm");
-  EXPECT_EQ(hosts[1]["lock"], "LOCKED");
-  EXPECT_EQ(hosts[1]["alive"], false);
-  EXPECT_EQ(hosts[2]["lock"], "SCHEDULE");
-  EXPECT_EQ(hosts[2]["locked_now"], true);  // its schedule covers the whole week
+  json got = json::parse(
+      json{{"jobs", Out_jobs_json(&tasks_)}, {"hosts", Out_hosts_json(tasks_)}}.dump(2));
+  ASSERT_EQ(json({got["jobs"].size(), got["hosts"].size(), got["jobs"][0]["tasks"].size()}),
+            json({3, 3, 2}));
+  // A pointer into the answer, then the JSON there.  Long names are never cut; a schedule
+  // covering the whole week is locked now.
+  for (std::string row :
+       {R"(/jobs/0/name "shot_010")", R"(/jobs/0/state "45.00%")",
+        R"(/jobs/0/hosts ["render02","render01"])", R"(/jobs/0/frames [1.0,120.0,1.0])",
+        R"(/jobs/0/doneframes 54)", R"(/jobs/0/tasks/0/status "RUNNING")",
+        R"(/jobs/0/tasks/0/host "render01")", R"(/jobs/1/name "a_very_long_job_name_indeed")",
+        R"(/jobs/1/run "PAUSED")",
+        R"(/jobs/2/hosts ["render01","render02","nightshift_workstation"])",
+        R"(/hosts/0/alive true)", R"(/hosts/0/renders "shot_010:1-4")",
+        R"(/hosts/1/host "render02.farm")", R"(/hosts/1/lock "LOCKED")", R"(/hosts/1/alive false)",
+        R"(/hosts/2/lock "SCHEDULE")", R"(/hosts/2/locked_now true)"}) {
+    size_t at = row.find(' ');
+    EXPECT_EQ(got[json::json_pointer(row.substr(0, at))], json::parse(row.substr(at + 1))) << row;
+  }
 }
 
 }  // namespace
