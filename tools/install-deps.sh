@@ -20,18 +20,19 @@ have_cmd sshfs || need+=(sshfs)
 have_pkg libgtest-dev || need+=(libgtest-dev)
 have_pkg libgmock-dev || need+=(libgmock-dev)
 have_pkg libbenchmark-dev || need+=(libbenchmark-dev)
-# The real renderers the wrappers drive (large: only on request; CI asks).
+# The queue command-line tool: options, JSON output, its status page server.
+have_pkg libcli11-dev || need+=(libcli11-dev)
+have_pkg nlohmann-json3-dev || need+=(nlohmann-json3-dev)
+have_pkg libcpp-httplib-dev || need+=(libcpp-httplib-dev)
+# What only the tests drive (large: asked for by `make test`, not by the
+# demo): the real renderers behind the wrappers, the terminal the tool's
+# live view is tested in, the browser its status page is tested in.
 if [ "${RJ_WITH_RENDERERS:-0}" = 1 ]; then
   have_cmd blender || need+=(blender)
   have_cmd povray || need+=(povray)
+  have_cmd tmux || need+=(tmux)
+  have_cmd chromium || need+=(chromium)
 fi
-# The queue command-line tool: options, JSON output, and its terminal view's test.
-have_pkg libcli11-dev || need+=(libcli11-dev)
-have_pkg nlohmann-json3-dev || need+=(nlohmann-json3-dev)
-have_cmd tmux || need+=(tmux)
-# Its status page server, and the browser its page test loads it in.
-have_pkg libcpp-httplib-dev || need+=(libcpp-httplib-dev)
-have_cmd chromium || need+=(chromium)
 if [ "${RJ_NEED_CLANG:-0}" = 1 ]; then
   have_cmd clang++ || need+=(clang)
   have_pkg libclang-rt-dev || have_pkg libclang-rt-14-dev || need+=(libclang-rt-dev)
