@@ -1,4 +1,8 @@
 // Job and resource records: their names and state words.
+#include <fcntl.h>
+#include <sys/stat.h>
+
+#include <algorithm>
 #include <cstdlib>
 #include <string>
 #include <vector>
@@ -47,4 +51,54 @@ TEST(StateWords, DecodeCaseSensitively) {
     EXPECT_EQ(Job_get_runstate(w.word), w.run);
     EXPECT_EQ(Dev_get_lockstate(w.word), w.lock);
   }
+}
+
+TEST_F(RecordsTest, NewWorkWakesOnlyOtherHostsWithAFreeProcessor) {
+  // Hosts: a (1 processor, rendering: full), b (2 processors, one render),
+  // c (one full resource and one free), d (idle), and this host.
+  struct DevSpec {
+    const char* name;
+    const char* host;
+    int procs;
+  } const specs[] = {{"a1", "a", 1}, {"b1", "b", 2}, {"c1", "c", 1},
+                     {"c2", "c", 1}, {"d1", "d", 1}, {"me", "testhost", 1}};
+  Job* job = Job_new(nullptr, nullptr, "shot", 1);
+  std::vector<Dev*> devs;
+  for (const DevSpec& s : specs) {
+    Dev* dev = Dev_new(nullptr, nullptr, s.name, 0);
+    dev->host_name.set(s.host);
+    dev->num_processors = s.procs;
+    RndDevList_add(job, dev);
+    devs.push_back(dev);
+    write_file(std::string(s.host) + ".pid", "1\n");
+  }
+  TaskRec recs[5];
+  const int status[] = {TASK_RUNNING, TASK_STARTED, TASK_RUNNING, TASK_FAILED, TASK_STARTED};
+  Dev* const on[] = {devs[0], devs[1], devs[2], devs[4], devs[5]};
+  TaskGroup group;
+  group.job = job;
+  for (int i = 0; i < 5; ++i) {
+    recs[i].status = status[i];
+    recs[i].dev = on[i];
+    recs[i].next = i + 1 < 5 ? &recs[i + 1] : nullptr;
+  }
+  group.tasks = &recs[0];
+  std::vector<const Dev*> full = Task_full_devs(&group);
+  std::sort(full.begin(), full.end(),
+            [](const Dev* x, const Dev* y) { return x->index < y->index; });
+  EXPECT_EQ(full, (std::vector<const Dev*>{devs[0], devs[2], devs[5]}));
+
+  std::vector<int64_t> before;
+  for (const char* h : {"a", "b", "c", "d", "testhost"}) {
+    struct timespec old[2] = {{1000, 0}, {1000, 0}};
+    ASSERT_EQ(utimensat(AT_FDCWD, path(std::string(h) + ".pid").c_str(), old, 0), 0);
+    before.push_back(daemon_updatetime_get(h));
+  }
+  Job_wake_other_hosts(job, &full);
+  std::string woken;
+  int i = 0;
+  for (const char* h : {"a", "b", "c", "d", "testhost"}) {
+    if (daemon_updatetime_get(h) != before[static_cast<size_t>(i++)]) woken += h;
+  }
+  EXPECT_EQ(woken, "bcd");
 }

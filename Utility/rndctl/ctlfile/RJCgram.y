@@ -95,7 +95,7 @@ void lock_block(int t1, int t2, const char* word1, const char* word2) {
 }
 
 void begin_job(const char* name, int index) {
-  cur_job = Add_a_job(nullptr, name, index);
+  cur_job = Add_a_job_as_read(name, index);
   if (cur_job == nullptr) return;
   // Only what the file says stands: the defaults a new record starts with
   // (and, for a record read before, its old values) are dropped for these.

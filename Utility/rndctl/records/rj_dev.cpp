@@ -3,6 +3,7 @@
 // field checks that drop locks of dead editors.
 #include "Utility/rndctl/records/rj_dev.h"
 
+#include <algorithm>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -237,15 +238,18 @@ bool rj_dev_on_host(const Dev* dev, const char* host) {
 
 bool rj_dev_is_this_host(const Dev* dev) { return rj_dev_on_host(dev, rndctl.host.c_str()); }
 
-void Job_wake_other_hosts(const Job* job) {
+void Job_wake_other_hosts(const Job* job, const std::vector<const Dev*>* full) {
   if (job == nullptr) return;
+  std::vector<const char*> woken;  // several resources may stand for one host
   for (const RndDevList* e = job->resources; e != nullptr; e = e->next) {
     const Dev* dev = e->dev;
     if (dev == nullptr || dev->host_name.none() || rj_dev_is_this_host(dev)) continue;
-    bool seen = false;  // several resources may stand for one host
-    for (const RndDevList* f = job->resources; f != e && !seen; f = f->next) {
-      seen = f->dev != nullptr && f->dev->host_name.is(dev->host_name.c_str());
-    }
-    if (!seen) daemon_updatetime_set(dev->host_name.c_str());
+    if (full != nullptr && std::find(full->begin(), full->end(), dev) != full->end()) continue;
+    const char* host = dev->host_name.c_str();
+    if (std::any_of(woken.begin(), woken.end(),
+                    [host](const char* w) { return strcmp(w, host) == 0; }))
+      continue;
+    woken.push_back(host);
+    daemon_updatetime_set(host);
   }
 }

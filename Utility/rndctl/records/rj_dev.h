@@ -17,6 +17,8 @@
 /// not a file lock.
 #pragma once
 
+#include <vector>
+
 #include "Utility/rndctl/records/rj_records.h"
 
 /// Makes a resource and links it in before `before` (null: at the end).
@@ -71,4 +73,6 @@ bool rj_dev_is_this_host(const Dev* dev);
 /// of every other host in the job's host list, once each, so that an idle
 /// daemon there takes it without waiting for its check interval.  A failed
 /// touch only costs that host its early wake-up; nothing is returned.
-void Job_wake_other_hosts(const Job* job);
+/// Resources in `full` (non-owning; null for none) are passed over: a host
+/// is touched only for a resource of the job that may take work now.
+void Job_wake_other_hosts(const Job* job, const std::vector<const Dev*>* full = nullptr);

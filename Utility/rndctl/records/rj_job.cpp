@@ -43,7 +43,9 @@ void clear_listitem_backlink(void* item, const void* record) {
 
 }  // namespace
 
-Job* Job_new(Job* before, void* listitem, const char* path, int index) {
+namespace {
+
+Job* job_make(Job* before, void* listitem, const char* path, int index, bool defaults) {
   Job* job = MA_new<Job>(kJobTag, kUnit);
   if (job == nullptr) return nullptr;
 
@@ -55,10 +57,12 @@ Job* Job_new(Job* before, void* listitem, const char* path, int index) {
   job->status.set("none");
   job->priority = 0;
   job->index = index != 0 ? index : RJCget_next_index(FILE_JOB_INDEX);
-  job->sdl.set(path);
   job->use_sdl_paths = 1;
-  job->pix.set("./pix_file");
-  job->matte.set("./matte_file");
+  if (defaults) {
+    job->sdl.set(path);
+    job->pix.set("./pix_file");
+    job->matte.set("./matte_file");
+  }
 
   if (before != nullptr) {
     job->next = before;
@@ -83,6 +87,20 @@ Job* Job_new(Job* before, void* listitem, const char* path, int index) {
   }
   recindex_add(rndctl.job_index, job->index, job);
   return job;
+}
+
+}  // namespace
+
+Job* Job_new(Job* before, void* listitem, const char* path, int index) {
+  return job_make(before, listitem, path, index, true);
+}
+
+Job* Add_a_job_as_read(const char* name, int index) {
+  if (index != 0) {
+    Job* found = Job_by_index(index);
+    if (found != nullptr) return found;
+  }
+  return job_make(nullptr, nullptr, name, index, false);
 }
 
 Job* Add_a_job(void* listitem, const char* path, int index) {

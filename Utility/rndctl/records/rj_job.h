@@ -28,6 +28,11 @@ Job* Job_new(Job* before, void* listitem, const char* path, int index);
 /// keeps the first.  Add_a_job with index 0 always makes a new job.  Null
 /// only when out of memory.
 Job* Add_a_job(void* listitem, const char* path, int index);
+/// For the reader: Add_a_job(nullptr, name, index), except that a job made
+/// new has none of the default texts (scene, pix, matte): a record read from
+/// a file holds only what the file says, and making texts only to drop them
+/// costs a reload of a large queue dearly.
+Job* Add_a_job_as_read(const char* name, int index);
 Job* Insert_a_job(Job* before, void* listitem, const char* path, int index);
 /// The first job in list order with that editor list entry (resp. name,
 /// index), or null.  Names need not be unique: the index is the identity.

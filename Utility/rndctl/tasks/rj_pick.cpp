@@ -182,16 +182,28 @@ TaskRec* insert_task(TaskGroup** groups, Job* job, float start, float end, int s
   return rec;
 }
 
+namespace {
+
+bool any_free_slot(PickView& view) {
+  for (Dev* dev = rndctl.devs; dev != nullptr; dev = dev->next) {
+    if (dev_on_this_host(dev) && view.free_slots(dev) > 0) return true;
+  }
+  return false;
+}
+
+}  // namespace
+
+bool Task_host_has_free_slot() {
+  PickView view;
+  return any_free_slot(view);
+}
+
 TaskRec* extract_pending_task(TaskGroup** groups) {
   if (groups == nullptr) return nullptr;
   PickView view;
   // With every process slot of this host taken, no group can win, and
   // trying them one after the other costs a walk of the list per group.
-  bool any_slot = false;
-  for (Dev* dev = rndctl.devs; dev != nullptr && !any_slot; dev = dev->next) {
-    any_slot = dev_on_this_host(dev) && view.free_slots(dev) > 0;
-  }
-  if (!any_slot) {
+  if (!any_free_slot(view)) {
     dbgpnt("No task to extract - no dev found\n");
     return nullptr;
   }

@@ -60,3 +60,7 @@ void split_a_task(TaskGroup* group, TaskRec* rec);
 /// records of rndctl.tasks STARTED or RUNNING on it, never below 0.  0 for a
 /// null resource.
 int Dev_processes_available(Dev* dev);
+/// Whether one of this host's resources has a processor that this host's
+/// running-task entries leave free (what a pick would find before it looks
+/// at the task file).  False for a host without a resource.
+[[nodiscard]] bool Task_host_has_free_slot();

@@ -49,6 +49,7 @@ bool held(const TaskRec* rec) { return rec->status == TASK_STARTED || rec->statu
 template <class Pick>
 int put_back_cycle(Pick pick) {
   std::vector<Job*> touched;
+  std::vector<const Dev*> full;
   int count = 0;
   (void)Task_file_rewrite([&](TaskGroup** groups) {  // a failure is reported there
     for (TaskGroup* g = *groups; g != nullptr; g = g->next) {
@@ -62,9 +63,10 @@ int put_back_cycle(Pick pick) {
         }
       }
     }
+    if (count > 0) full = Task_full_devs(*groups);
     return count > 0;
   });
-  for (Job* j : touched) Job_wake_other_hosts(j);
+  for (Job* j : touched) Job_wake_other_hosts(j, &full);
   return count;
 }
 

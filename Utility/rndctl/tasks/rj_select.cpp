@@ -246,6 +246,12 @@ TASK* GetaPendingTask() {
   }
   dbgpnt("No lock for this host \"%s\"\n", host);
   dbgpnt("-------------------------SCHEDULE CHECK end\n");
+  // A host rendering on every processor has nothing to take: it looks again
+  // when a render ends, and the task file's lock stays free for the others.
+  if (!Task_host_has_free_slot()) {
+    dbgpnt("no free processor on this host\n");
+    return nullptr;
+  }
 
   TASK* entry = Get_a_task();
   if (entry == nullptr) {
@@ -431,6 +437,7 @@ TASK* Task_get() {
   const int written = Task_file_rewrite([&](TaskGroup** groups) {
     opened = true;
     chosen = select_cycle(groups, &after);
+    after.note_full(*groups);
     return true;
   });
   if (!opened) {
@@ -514,6 +521,7 @@ TaskRec* Task_split_and_insert(TaskRec* rec) {
       entry->taken = 0;  // given back
       Task_note_group(job, group);
       after.wake(job);
+      after.note_full(*groups);
     }
     return true;
   });

@@ -89,11 +89,32 @@ void TaskAfterLock::wake(Job* job) {
   }
 }
 
+void TaskAfterLock::note_full(const TaskGroup* groups) {
+  if (!wakes.empty()) full = Task_full_devs(groups);
+}
+
 void TaskAfterLock::run() {
   for (int pid : kills) kill_here(pid);
   kills.clear();
-  for (Job* job : wakes) Job_wake_other_hosts(job);
+  for (Job* job : wakes) Job_wake_other_hosts(job, &full);
   wakes.clear();
+  full.clear();
+}
+
+std::vector<const Dev*> Task_full_devs(const TaskGroup* groups) {
+  std::unordered_map<const Dev*, int> busy;
+  for (const TaskGroup* g = groups; g != nullptr; g = g->next) {
+    for (const TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
+      if (rec->dev != nullptr && (rec->status == TASK_STARTED || rec->status == TASK_RUNNING)) {
+        ++busy[rec->dev];
+      }
+    }
+  }
+  std::vector<const Dev*> full;
+  for (const auto& [dev, n] : busy) {
+    if (n >= std::max(1, dev->num_processors)) full.push_back(dev);
+  }
+  return full;
 }
 
 void Task_drop_stream(TASK* entry) {

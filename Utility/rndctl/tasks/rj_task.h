@@ -60,12 +60,23 @@ int Task_judge_exits();
 /// kills of this host's renders and wake-ups of other hosts.
 struct TaskAfterLock {
   std::vector<int> kills;
-  std::vector<Job*> wakes;  // non-owning; each job once
+  std::vector<Job*> wakes;       // non-owning; each job once
+  std::vector<const Dev*> full;  // non-owning; resources with no free processor
   void kill_later(int pid);
   void wake(Job* job);
+  /// Before the lock goes, when there are wake-ups: notes the resources the
+  /// file shows rendering on every processor (Task_full_devs), which the
+  /// wake-ups pass over.
+  void note_full(const TaskGroup* groups);
   /// Kills, then wakes.  Call only without the task file's lock.
   void run();
 };
+
+/// The resources that records of `groups` show STARTED or RUNNING on as
+/// many times as they have processors (at least 1).  Such a host has nothing
+/// to take now and looks for work itself when one of its renders ends, so
+/// waking it would only make it read the files for nothing.
+std::vector<const Dev*> Task_full_devs(const TaskGroup* groups);
 
 /// Settles this host's entry against the file record of the same task.
 /// Ours (Task_owns): the file takes the entry's status and 1 is returned.

@@ -123,6 +123,7 @@ void Task_file_update(Job* job) {
     if (job != nullptr && !job_seen && !job_is_over(job) && Task_group_rebuilt(job, nullptr)) {
       Task_mark_rebuilt(job);
     }
+    after.note_full(groups);
     return true;
   });
   after.run();
@@ -132,6 +133,7 @@ void Task_file_update(Job* job) {
 int Task_file_check(Job* job) {
   dbgpnt("\nTask_file_check-----------------------------\n");
   int set_back = 0;
+  std::vector<const Dev*> full;
   (void)Task_file_rewrite([&](TaskGroup** groups) {  // reported there
     TaskGroup* g = TaskGroup_by_job(*groups, job);
     if (g != nullptr) {
@@ -146,9 +148,10 @@ int Task_file_check(Job* job) {
         }
       }
     }
+    if (set_back) full = Task_full_devs(*groups);
     return true;
   });
-  if (set_back) Job_wake_other_hosts(job);
+  if (set_back) Job_wake_other_hosts(job, &full);
   dbgpnt("Task_file_check-------------------------DONE\n");
   return set_back;
 }
