@@ -127,6 +127,10 @@ void* MA_malloc(size_t size, int line, const char* unit, int /*flag: always 1, n
   MaTag* tag = bk.free_head[0];
   if (__builtin_expect(tag != nullptr, 1)) {
     bk.free_head[0] = tag->next_free;
+    // Blocks freed in a burst (a reload drops ten thousand records) lie
+    // scattered on the list, and following it is a cache miss a request.
+    // The next request's block is fetched now, while the caller works.
+    if (tag->next_free != nullptr) __builtin_prefetch(tag->next_free);
   } else {
     tag = ma_fresh(b, 0);
     if (tag == nullptr) {
