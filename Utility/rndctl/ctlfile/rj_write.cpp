@@ -14,6 +14,7 @@
 #include <cmath>
 #include <cstdio>
 #include <cstring>
+#include <memory>
 #include <new>
 #include <string>
 
@@ -46,25 +47,38 @@ const char* const kResourceKeywords[] = {"host_name",  "remote_location", "statu
                                          "max_frames", "num_processors",  "locks",
                                          "default_dev"};
 
+// Word characters only and no number: what the word rule of the lexer takes
+// whole.  A run of digits, points and minus signs that starts with a digit
+// is a number however long (the number rules win a tie).  Returns its
+// length, or 0 when it is not one: one walk serves both the test and the
+// copy.
+size_t plain_word_length(const char* text) {
+  const auto* p = reinterpret_cast<const unsigned char*>(text);
+  if (p == nullptr || !word_start(p[0])) return 0;
+  const unsigned char* start = p;
+  bool numeric = p[0] >= '0' && p[0] <= '9';
+  for (; *p != '\0'; ++p) {
+    if (!word_char(*p)) return 0;
+    if (!((*p >= '0' && *p <= '9') || *p == '.' || *p == '-')) numeric = false;
+  }
+  return numeric ? 0 : static_cast<size_t>(p - start);
+}
+
+// Whether a word of `length` characters is a keyword of the section; the
+// length sorts out nearly every name at once.
 template <size_t N>
-bool listed(const char* const (&table)[N], const char* text) {
+bool listed_n(const char* const (&table)[N], const char* text, size_t length) {
   for (const char* keyword : table)
-    if (keyword[0] == text[0] && strcmp(keyword, text) == 0) return true;
+    if (keyword[0] == text[0] && strlen(keyword) == length && memcmp(keyword, text, length) == 0)
+      return true;
   return false;
 }
 
-// Word characters only and no number: what the word rule of the lexer takes
-// whole.  A run of digits, points and minus signs that starts with a digit
-// is a number however long (the number rules win a tie).
-bool plain_word(const char* text) {
-  const auto* p = reinterpret_cast<const unsigned char*>(text);
-  if (p == nullptr || !word_start(p[0])) return false;
-  bool numeric = p[0] >= '0' && p[0] <= '9';
-  for (; *p != '\0'; ++p) {
-    if (!word_char(*p)) return false;
-    if (!((*p >= '0' && *p <= '9') || *p == '.' || *p == '-')) numeric = false;
-  }
-  return !numeric;
+bool is_keyword(const char* text, size_t length, int section) {
+  if (listed_n(kEveryKeyword, text, length)) return true;
+  if (section == RJC_JOB_SECTION) return listed_n(kJobKeywords, text, length);
+  if (section == RJC_RESOURCE_SECTION) return listed_n(kResourceKeywords, text, length);
+  return listed_n(kJobKeywords, text, length) || listed_n(kResourceKeywords, text, length);
 }
 
 bool label_char_ok(unsigned char c) { return c > ' ' && c != 0x7f; }
@@ -72,11 +86,8 @@ bool label_char_ok(unsigned char c) { return c > ' ' && c != 0x7f; }
 }  // namespace
 
 bool RJC_is_word(const char* text, int section) {
-  if (!plain_word(text)) return false;
-  if (listed(kEveryKeyword, text)) return false;
-  if (section == RJC_JOB_SECTION) return !listed(kJobKeywords, text);
-  if (section == RJC_RESOURCE_SECTION) return !listed(kResourceKeywords, text);
-  return !listed(kJobKeywords, text) && !listed(kResourceKeywords, text);
+  size_t length = plain_word_length(text);
+  return length != 0 && !is_keyword(text, length, section);
 }
 
 std::string RJC_string_form(const char* text) {
@@ -101,7 +112,7 @@ std::string RJC_comment_form(const char* text) {
 
 std::string RJC_name_form(const char* text) {
   if (text == nullptr) return std::string();
-  return plain_word(text) ? std::string(text) : RJC_string_form(text);
+  return plain_word_length(text) != 0 ? std::string(text) : RJC_string_form(text);
 }
 
 bool RJC_label_needs_form(const char* text) {
@@ -121,8 +132,6 @@ std::string RJC_label_form(const char* text) {
 
 namespace {
 
-const char* truth(int flag) { return flag != 0 ? "TRUE" : "FALSE"; }
-
 // The text of a file is put together here and handed to the stream in one
 // piece: a file of ten thousand jobs is some hundred thousand lines, and one
 // formatted stream call per line costs more than everything else together,
@@ -132,20 +141,23 @@ const char* truth(int flag) { return flag != 0 ? "TRUE" : "FALSE"; }
 // as "%d" would; the rare general float goes through snprintf.
 class Out {
  public:
-  explicit Out(FILE* fp) : fp_(fp), text_(room()) { text_.clear(); }
+  explicit Out(FILE* fp) : fp_(fp), room_(room()) {}
   Out(const Out&) = delete;
   Out& operator=(const Out&) = delete;
   ~Out() { flush(); }
 
   Out& s(const char* text) { return n(text, strlen(text)); }
-  Out& n(const char* text, size_t length) {
-    if (length > text_.capacity() - text_.size() && !grow(length)) {
+  // Called for every piece of every line: kept inline, so that a literal's
+  // copy is a few moves.
+  [[gnu::always_inline]] Out& n(const char* text, size_t length) {
+    if (__builtin_expect(length > room_.size - used_, 0) && !grow(length)) {
       // No room to be had: what is gathered goes out now, this piece with it.
       flush();
       fwrite(text, 1, length, fp_);
       return *this;
     }
-    text_.append(text, length);
+    memcpy(room_.text.get() + used_, text, length);
+    used_ += length;
     return *this;
   }
   template <size_t N>
@@ -171,6 +183,10 @@ class Out {
     return n(text, std::min(static_cast<size_t>(length), sizeof text - 1));
   }
   Out& str(const std::string& text) { return n(text.data(), text.size()); }
+  Out& truth(int flag) {
+    if (flag != 0) return lit("TRUE");
+    return lit("FALSE");
+  }
 
   /// A quoted string.  Nearly every text is taken as it is; only the rare
   /// one with a quote or beyond the limit is copied.
@@ -194,37 +210,51 @@ class Out {
   /// A text that is a word only once its quotes are gone is written bare,
   /// so that the next write of what is read back writes the same.
   Out& name(const char* text, int section) {
-    if (RJC_is_word(text, section)) return s(text);
-    if (plain_word(text)) return quoted(text);  // a keyword: no quote to drop
+    size_t length = plain_word_length(text);
+    if (length != 0) {
+      if (!is_keyword(text, length, section)) return n(text, length);
+      return quoted(text);  // a keyword: no quote to drop
+    }
     std::string form = RJC_string_form(text);
     if (RJC_is_word(form.c_str(), section)) return str(form);
     return quoted(form.c_str());
   }
 
   void flush() {
-    if (!text_.empty()) fwrite(text_.data(), 1, text_.size(), fp_);
-    text_.clear();
+    if (used_ != 0) fwrite(room_.text.get(), 1, used_, fp_);
+    used_ = 0;
   }
 
  private:
-  // One writer runs at a time: the two files are written one after the
-  // other, never one inside the other.
+  // The room is kept from one write to the next.  One writer runs at a
+  // time: the two files are written one after the other, never one inside
+  // the other.
+  struct Room {
+    std::unique_ptr<char[]> text;
+    size_t size = 0;
+  };
+
   bool grow(size_t length) {
+    const size_t size = std::max(used_ + length, 2 * room_.size + 65536);
     try {
-      text_.reserve(std::max(text_.size() + length, 2 * text_.capacity()));
+      auto bigger = std::make_unique_for_overwrite<char[]>(size);
+      if (used_ != 0) memcpy(bigger.get(), room_.text.get(), used_);
+      room_.text = std::move(bigger);
+      room_.size = size;
       return true;
     } catch (const std::bad_alloc&) {
       return false;
     }
   }
 
-  static std::string& room() {
-    static std::string text;
-    return text;
+  static Room& room() {
+    static Room shared;
+    return shared;
   }
 
   FILE* fp_;  // not owned
-  std::string& text_;
+  Room& room_;
+  size_t used_ = 0;
 };
 
 // Writes `keyword` and the blocks of a week grid, or nothing when no half
@@ -287,8 +317,8 @@ void write_job(Out& out, const Job* job) {
   if (job->sdl) out.lit("\tsdl \t\t= ").quoted(job->sdl.c_str()).lit(";\n");
   if (job->pix) out.lit("\tpix \t\t= ").quoted(job->pix.c_str()).lit(";\n");
   if (job->matte) out.lit("\tmatte \t\t= ").quoted(job->matte.c_str()).lit(";\n");
-  out.lit("\tuse_sdl_paths = ").s(truth(job->use_sdl_paths)).lit(";\n\toutput_mask = ");
-  out.s(truth(job->output_mask)).lit(";\n");
+  out.lit("\tuse_sdl_paths = ").truth(job->use_sdl_paths).lit(";\n\toutput_mask = ");
+  out.truth(job->output_mask).lit(";\n");
 
   // A still job carries none of the animation group, its run state
   // included: a paused still job comes back from a rewrite unpaused.
