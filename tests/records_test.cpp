@@ -83,7 +83,7 @@ TEST_F(RecordsTest, NewWorkWakesOnlyOtherHostsWithAFreeProcessor) {
     recs[i].next = i + 1 < 5 ? &recs[i + 1] : nullptr;
   }
   group.tasks = &recs[0];
-  std::vector<const Dev*> full = Task_full_devs(&group);
+  std::vector<const Dev*> full = Task_full_devs(&group, {job});
   std::sort(full.begin(), full.end(),
             [](const Dev* x, const Dev* y) { return x->index < y->index; });
   EXPECT_EQ(full, (std::vector<const Dev*>{devs[0], devs[2], devs[5]}));

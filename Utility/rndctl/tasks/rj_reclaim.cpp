@@ -63,7 +63,7 @@ int put_back_cycle(Pick pick) {
         }
       }
     }
-    if (count > 0) full = Task_full_devs(*groups);
+    if (count > 0) full = Task_full_devs(*groups, touched);
     return count > 0;
   });
   for (Job* j : touched) Job_wake_other_hosts(j, &full);

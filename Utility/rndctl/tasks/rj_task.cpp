@@ -90,7 +90,7 @@ void TaskAfterLock::wake(Job* job) {
 }
 
 void TaskAfterLock::note_full(const TaskGroup* groups) {
-  if (!wakes.empty()) full = Task_full_devs(groups);
+  if (!wakes.empty()) full = Task_full_devs(groups, wakes);
 }
 
 void TaskAfterLock::run() {
@@ -101,18 +101,30 @@ void TaskAfterLock::run() {
   full.clear();
 }
 
-std::vector<const Dev*> Task_full_devs(const TaskGroup* groups) {
-  std::unordered_map<const Dev*, int> busy;
-  for (const TaskGroup* g = groups; g != nullptr; g = g->next) {
-    for (const TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
-      if (rec->dev != nullptr && (rec->status == TASK_STARTED || rec->status == TASK_RUNNING)) {
-        ++busy[rec->dev];
+std::vector<const Dev*> Task_full_devs(const TaskGroup* groups, const std::vector<Job*>& jobs) {
+  // Only the resources of the jobs to be woken are counted: a walk of a
+  // large file with a hash look-up a record would cost more than the cycle
+  // it follows.
+  std::vector<const Dev*> devs;
+  for (const Job* job : jobs) {
+    for (const RndDevList* e = job != nullptr ? job->resources : nullptr; e != nullptr;
+         e = e->next) {
+      if (e->dev != nullptr && std::find(devs.begin(), devs.end(), e->dev) == devs.end()) {
+        devs.push_back(e->dev);
       }
     }
   }
+  std::vector<int> busy(devs.size(), 0);
+  for (const TaskGroup* g = groups; g != nullptr && !devs.empty(); g = g->next) {
+    for (const TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
+      if (rec->status != TASK_STARTED && rec->status != TASK_RUNNING) continue;
+      auto at = std::find(devs.begin(), devs.end(), rec->dev);
+      if (at != devs.end()) ++busy[static_cast<size_t>(at - devs.begin())];
+    }
+  }
   std::vector<const Dev*> full;
-  for (const auto& [dev, n] : busy) {
-    if (n >= std::max(1, dev->num_processors)) full.push_back(dev);
+  for (size_t i = 0; i < devs.size(); ++i) {
+    if (busy[i] >= std::max(1, devs[i]->num_processors)) full.push_back(devs[i]);
   }
   return full;
 }

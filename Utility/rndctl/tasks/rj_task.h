@@ -72,11 +72,12 @@ struct TaskAfterLock {
   void run();
 };
 
-/// The resources that records of `groups` show STARTED or RUNNING on as
-/// many times as they have processors (at least 1).  Such a host has nothing
-/// to take now and looks for work itself when one of its renders ends, so
-/// waking it would only make it read the files for nothing.
-std::vector<const Dev*> Task_full_devs(const TaskGroup* groups);
+/// Of the resources that `jobs` name, those that records of `groups` show
+/// STARTED or RUNNING on as many times as they have processors (at least 1).
+/// Such a host has nothing to take now and looks for work itself when one of
+/// its renders ends, so waking it would only make it read the files for
+/// nothing.
+std::vector<const Dev*> Task_full_devs(const TaskGroup* groups, const std::vector<Job*>& jobs);
 
 /// Settles this host's entry against the file record of the same task.
 /// Ours (Task_owns): the file takes the entry's status and 1 is returned.

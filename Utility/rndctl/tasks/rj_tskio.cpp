@@ -148,7 +148,7 @@ int Task_file_check(Job* job) {
         }
       }
     }
-    if (set_back) full = Task_full_devs(*groups);
+    if (set_back) full = Task_full_devs(*groups, {job});
     return true;
   });
   if (set_back) Job_wake_other_hosts(job, &full);
