@@ -18,22 +18,7 @@ void rndctl_reset() {
   while (rndctl.jobs != nullptr) Job_del(rndctl.jobs);
   while (rndctl.devs != nullptr) Dev_del(rndctl.devs);
   fileop_reset();
-  rndctl.current_job = nullptr;
-  rndctl.current_dev = nullptr;
-  rndctl.job_index.slots.clear();
-  rndctl.dev_index.slots.clear();
-  rndctl.location.reset();
-  rndctl.user.reset();
-  rndctl.host.reset();
-  rndctl.install.reset();
-  rndctl.last_update = 0;
-  rndctl.pid = 0;
-  rndctl.running = 0;
-  rndctl.interval_min = 0;
-  rndctl.interval_sec = 0;
-  rndctl.signal_seen = 0;
-  rndctl.out_counter = 0;
-  rndctl.stream_counter = 0;
+  rndctl = RndCtl{};
 }
 
 bool write_text_file(const std::string& path, const std::string& content) {
@@ -97,7 +82,7 @@ std::vector<RaceChild> race_children(int n, int (*body)(int i, void* ctx), void*
 }
 
 Ran run_program(std::vector<std::string> args, const std::string& scratch, const std::string& cwd) {
-  std::string out_path = scratch + ".out", err_path = scratch + ".err";
+  const std::string out_path = scratch + ".out", err_path = scratch + ".err";
   std::vector<char*> argv;
   for (std::string& a : args) argv.push_back(a.data());
   argv.push_back(nullptr);
@@ -113,8 +98,7 @@ Ran run_program(std::vector<std::string> args, const std::string& scratch, const
   }
   Ran r;
   waitpid(pid, &r.status, 0);
-  r.out = read_text_file(out_path);
-  r.err = read_text_file(err_path);
+  std::tie(r.out, r.err) = std::pair(read_text_file(out_path), read_text_file(err_path));
   unlink(out_path.c_str());
   unlink(err_path.c_str());
   return r;
