@@ -118,8 +118,7 @@ TEST_F(SelectTest, EachTaskOnTheHostTakesAProcessSlot) {
   EXPECT_EQ(Dev_processes_available(here_), 0);
   EXPECT_EQ(tasks(), scene("0 1 3 1 1 0 STARTED, 1 4 6 4 1 0 STARTED, 2 7 10 7 0 0 PENDING"));
   // The running-task list mirrors the file.
-  EXPECT_EQ(count_entries(), 3);
-  EXPECT_TRUE(entry_of(job, 0) == first && entry_of(job, 1) == second);
+  EXPECT_TRUE(count_entries() == 3 && entry_of(job, 0) == first && entry_of(job, 1) == second);
 
   // A host that never set its processors runs one task.
   there_->num_processors = 0;
@@ -128,10 +127,9 @@ TEST_F(SelectTest, EachTaskOnTheHostTakesAProcessSlot) {
 
 struct PriorityCase {
   const char* label;
-  int running;
+  int running, chosen;  // chosen: a position in the list below, -1 for none
   // One job each, in job list order; their groups run the other way: "first" means last here.
   std::vector<int> priorities;
-  int chosen;  // position in this list, -1 for none
 };
 
 class Priority : public SelectTest, public testing::WithParamInterface<PriorityCase> {};
@@ -151,10 +149,10 @@ TEST_P(Priority, ChoosesTheJob) {
 }
 
 INSTANTIATE_TEST_SUITE_P(Jobs, Priority,
-                         testing::Values(PriorityCase{"lowest_number_wins", 0, {5, 1, 3}, 1},
-                                         PriorityCase{"tie_goes_to_the_first", 0, {2, 2}, 1},
-                                         PriorityCase{"busy_takes_priority_0", 1, {0, 0, 1}, 1},
-                                         PriorityCase{"busy_host_leaves_the_rest", 1, {1, 2}, -1}),
+                         testing::Values(PriorityCase{"lowest_number_wins", 0, 1, {5, 1, 3}},
+                                         PriorityCase{"tie_goes_to_the_first", 0, 1, {2, 2}},
+                                         PriorityCase{"busy_takes_priority_0", 1, 1, {0, 0, 1}},
+                                         PriorityCase{"busy_host_leaves_the_rest", 1, -1, {1, 2}}),
                          Label);
 
 TEST_F(SelectTest, JobsThisHostMayNotRenderAreLeftAlone) {
@@ -170,9 +168,8 @@ TEST_F(SelectTest, JobsThisHostMayNotRenderAreLeftAlone) {
 struct FailCase {
   const char* label;
   float current;
-  int retries;
-  const char* file;  // its records afterwards
-  int status;        // of the failed task's entry afterwards
+  int retries, status;  // status: of the failed task's entry afterwards
+  const char* file;     // its records afterwards
 };
 
 class PutBack : public SelectTest, public testing::WithParamInterface<FailCase> {};
@@ -187,8 +184,7 @@ TEST_P(PutBack, FailedTaskGoesBackOrIsCutWhereItStopped) {
       std::tuple(TASK_FAILED, c.current, c.retries);
 
   EXPECT_EQ(Split_first_splittable_failed_tasks(), nullptr);
-  EXPECT_EQ(tasks(), scene(c.file));
-  EXPECT_EQ(failed->rec->status, c.status);
+  EXPECT_EQ(std::pair(tasks(), failed->rec->status), std::pair(scene(c.file), c.status));
   // A remainder cut off is a fresh task: any host, this one included, takes it.
   TASK* again = c.status == TASK_FINISHED ? Task_get() : nullptr;
   EXPECT_EQ(again != nullptr && again == entry_of(job, 1), c.status == TASK_FINISHED);
@@ -197,10 +193,10 @@ TEST_P(PutBack, FailedTaskGoesBackOrIsCutWhereItStopped) {
 
 INSTANTIATE_TEST_SUITE_P(
     Failures, PutBack,
-    testing::Values(FailCase{"after_progress", 5, 0, "0 1 4 4 1 1 FINISHED, 1 5 10 5 0 0 PENDING",
-                             TASK_FINISHED},
-                    FailCase{"no_progress", 1, 0, "0 1 10 1 1 1 PENDING", TASK_PENDING},
-                    FailCase{"tenth_failure", 5, 10, "0 1 10 1 1 0 STARTED", TASK_FAILED}),
+    testing::Values(FailCase{"after_progress", 5, 0, TASK_FINISHED,
+                             "0 1 4 4 1 1 FINISHED, 1 5 10 5 0 0 PENDING"},
+                    FailCase{"no_progress", 1, 0, TASK_PENDING, "0 1 10 1 1 1 PENDING"},
+                    FailCase{"tenth_failure", 5, 10, TASK_FAILED, "0 1 10 1 1 0 STARTED"}),
     Label);
 
 struct RetryCase {
@@ -312,8 +308,7 @@ TEST_F(SelectTest, LockedHostPicksNothingAndSleepsUntilTheLockEnds) {
     EXPECT_EQ(GetaPendingTask(), nullptr);
     unsigned left = alarm(0), want = state == LOCK_LOCKED ? 1800 : 3 * 3600;
     EXPECT_TRUE(left <= want && left + 2 >= want) << left;
-    EXPECT_EQ(tasks(), "");
-    EXPECT_EQ(rndctl.tasks, nullptr);
+    EXPECT_TRUE(tasks().empty() && rndctl.tasks == nullptr);
   }
 }
 
@@ -336,8 +331,8 @@ TEST_F(SelectTest, PickedTaskGetsAnEmptyStreamFileThatALinkCannotRedirect) {
 
   rndctl.stream_counter = INT_MAX;
   TASK* third = GetaPendingTask();
-  EXPECT_EQ(rndctl.stream_counter, 0);
-  EXPECT_NE(third != nullptr ? third->stream : nullptr, nullptr);
+  EXPECT_EQ(std::pair(rndctl.stream_counter, third != nullptr && third->stream != nullptr),
+            std::pair(0, true));
 }
 
 }  // namespace
