@@ -2,8 +2,6 @@
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <cstdio>
 #include <filesystem>
@@ -24,8 +22,8 @@ class StatusTest : public TaskFixture {
     // The tests reap their own render stand-ins, not an earlier test's handler.
     signal(SIGCHLD, SIG_DFL);
   }
-  /// An entry whose stream reads the file "stream", with `text` in it, and
-  /// whose output is the file "out", with `out` in it.
+  /// An entry whose stream reads "stream", holding `text`, and whose output is "out", holding
+  /// `out`.
   TASK* entry_with_stream(float start, float end, const char* text = "", const char* out = "") {
     TASK* entry = add_entry(job_, dev_, start, end, TASK_RUNNING);
     write_file("stream", text);
@@ -35,15 +33,6 @@ class StatusTest : public TaskFixture {
     entry->out_path.set(path("out").c_str());
     return entry;
   }
-  static void expect_killed(int pid) {
-    int status = wait_for(pid);
-    EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL) << status;
-  }
-  static std::vector<int> statuses(std::initializer_list<TASK*> entries) {
-    std::vector<int> out;
-    for (TASK* e : entries) out.push_back(e->rec->status);
-    return out;
-  }
   static Dev* other_host() {
     Dev* other = Dev_new(nullptr, nullptr, "render2", 2);
     other->host_name.set("otherhost");
@@ -51,10 +40,9 @@ class StatusTest : public TaskFixture {
   }
 };
 
-// The last progress line sets the frame and the percentage: the stream, the
-// step, the job's extension (0: none; else from 100 by 10), the task's
-// frames, whether it changed, the frame and progress then, and the output.
-// Frame 3 of 1..10 in progress: current is that frame, not the next.
+// The last progress line sets the frame and the percentage: the stream, the step, the job's
+// extension (0: none; else from 100 by 10), the task's frames, whether it changed, the frame and
+// progress then, and the output.  Frame 3 of 1..10 in progress: current is that frame.
 TEST_F(StatusTest, LastProgressLineSetsFrameAndPercentage) {
   using Row = std::tuple<const char*, float, int, float, float, int, float, float, const char*>;
   // clang-format off
@@ -116,8 +104,9 @@ TEST_F(StatusTest, OnlyThisHostsOwnRendersChangeState) {
   write_task_file();
   EXPECT_EQ(std::pair(ISA_task_running(theirs), ISA_task_running(waiting)), std::pair(1, 0));
   EXPECT_EQ(UpdateRunningTasks(), 1);
-  EXPECT_EQ(statuses({mine, theirs, waiting, inherited}),
-            (std::vector<int>{TASK_RUNNING, TASK_STARTED, TASK_STARTED, TASK_RUNNING}));
+  EXPECT_EQ(std::tuple(mine->rec->status, theirs->rec->status, waiting->rec->status,
+                       inherited->rec->status),
+            std::tuple(TASK_RUNNING, TASK_STARTED, TASK_STARTED, TASK_RUNNING));
   mine->pid = 0;  // no process to be killed by the fixture's cleanup
 }
 
@@ -132,12 +121,11 @@ TEST_F(StatusTest, AbortedJobStopsThisHostsTasksAndOthersPendingOnes) {
   running->pid = pid;
   write_task_file();
   EXPECT_EQ(UpdateRunningTasks(), 1);  // the other host's STARTED task
-  expect_killed(pid);
-  EXPECT_EQ(statuses({running, pending, started}),
-            (std::vector<int>{TASK_ABORTED, TASK_ABORTED, TASK_STARTED}));
+  EXPECT_EQ(wait_for(pid), SIGKILL);   // the wait status of a kill
+  EXPECT_EQ(std::tuple(running->rec->status, pending->rec->status, started->rec->status),
+            std::tuple(TASK_ABORTED, TASK_ABORTED, TASK_STARTED));
   EXPECT_TRUE(running->pid == 0 && running->stream == nullptr && running->stream_path.none() &&
-              running->output.none());
-  EXPECT_FALSE(exists(path("stream")));
+              running->output.none() && !exists(path("stream")));
 }
 
 struct EndCase {
@@ -152,8 +140,7 @@ TEST_P(EndOfProcess, ExitValueDecidesAndOutputGoesUnlessKept) {
   const EndCase& c = GetParam();
   job_->save_out = c.save_out;
   TASK* entry = entry_with_stream(1, 10, "", "rendering\n");
-  entry->rec->current = 4;
-  entry->waitstatus = c.waitstatus;  // reaped: pid 0
+  std::tie(entry->rec->current, entry->waitstatus) = std::pair(4.0f, c.waitstatus);  // reaped
   write_task_file();
   TaskRec* rec = entry->rec;
   EXPECT_EQ(UpdateRunningTasks(), 0);
@@ -176,9 +163,9 @@ TEST_F(StatusTest, RenderOfADeletedJobIsKilledAndEndedOnceReaped) {
   entry->pid = pid;
   entry->job = nullptr;  // the reload found the job gone
   UpdateRunningTasks();
-  expect_killed(pid);
-  ASSERT_EQ(rndctl.tasks, entry);  // still there until reaped
-  entry->pid = 0;                  // as the reaping side leaves it
+  EXPECT_EQ(wait_for(pid), SIGKILL);  // the wait status of a kill
+  ASSERT_EQ(rndctl.tasks, entry);     // still there until reaped
+  entry->pid = 0;                     // as the reaping side leaves it
   UpdateRunningTasks();
   EXPECT_TRUE(rndctl.tasks == nullptr && !exists(path("stream")) && !exists(path("out")));
   EXPECT_EQ(read_file("TSKSTAT/testhost"), "");
@@ -221,9 +208,8 @@ TEST_F(StatusTest, ErrorReasonPilesUpInTheComment) {
   }
 }
 
-// One task of frames i*2+1 .. i*2+2 for each status.  Frames 1-2 finished
-// and frame 3 under way count 3 of 4 frames; half of a task spread over the
-// job's 4 frames adds 12.5.
+// One task of frames i*2+1 .. i*2+2 for each status.  Frames 1-2 finished and frame 3 under way
+// count 3 of 4 frames; half of a task spread over the job's 4 frames adds 12.5.
 TEST_F(StatusTest, TasksDecideTheJobsStatusText) {
   // clang-format off
   for (auto [statuses, job_status, ctrl, expected] : {
