@@ -95,16 +95,15 @@ TEST_F(ReclaimTest, AnotherHostsTaskIsPutBackOnlyWhenItsHeartbeatIsOldAndItsDaem
       {30, false, false}, {-1, false, false}, {3600, true, false}, {3600, false, true}};
   for (auto [age, alive, put_back] : cases) {
     write_file("Render_Tasks", held);
-    unlink(path("TSKSTAT/farhost").c_str());
-    unlink(path("farhost.pid").c_str());
+    for (const char* file : {"TSKSTAT/farhost", "farhost.pid"}) unlink(path(file).c_str());
     if (age >= 0) write_file("TSKSTAT/farhost", "");
     if (age >= 0) set_age("TSKSTAT/farhost", age, now);
     if (alive) write_file("farhost.pid", pid_bytes(getpid()));
     EXPECT_EQ(Task_reclaim_dead_hosts(now), put_back ? 1 : 0) << age << alive;
     EXPECT_EQ(read_file("Render_Tasks").find("STARTED") == std::string::npos, put_back) << age;
   }
-  std::string access = read_file("Render_Access");
-  const std::string line = "put back task 0 of \"" + name + "\" from host farhost: ";
+  const std::string access = read_file("Render_Access"),
+                    line = "put back task 0 of \"" + name + "\" from host farhost: ";
   EXPECT_NE(access.find(line), std::string::npos) << access;
   EXPECT_EQ(access.find(line), access.rfind(line)) << access;
   EXPECT_NE(access.find("no heartbeat for 3600 seconds"), std::string::npos) << access;
