@@ -97,12 +97,9 @@ TEST_F(ControlFileTest, WriterDropsDeletedJobsAndNamelessResources) {
   RndDevList_add(gone, named);
   gone->deleted = last->deleted = 1;
 
-  const std::string devs = written_devs();
-  EXPECT_THAT(devs, HasSubstr("alpha 1 {\n"));
-  EXPECT_THAT(devs, Not(HasSubstr(" 2 {\n")));
-  const std::string jobs = written_jobs();
-  EXPECT_THAT(jobs, HasSubstr("first.sdl 11 {\n"));
-  EXPECT_THAT(jobs, Not(AnyOf(HasSubstr("gone.sdl"), HasSubstr("last.sdl"))));
+  EXPECT_THAT(written_devs(), AllOf(HasSubstr("alpha 1 {\n"), Not(HasSubstr(" 2 {\n"))));
+  EXPECT_THAT(written_jobs(), AllOf(HasSubstr("first.sdl 11 {\n"),
+                                    Not(AnyOf(HasSubstr("gone.sdl"), HasSubstr("last.sdl")))));
   // Gone from memory too, and from the resource's list of jobs.
   EXPECT_EQ(std::tuple(rndctl.jobs, first->next, Job_by_index(12), named->jobs),
             std::tuple(first, nullptr, nullptr, nullptr));
@@ -172,9 +169,7 @@ TEST_F(ControlFileTest, NullStreamReadsNothingNotStandardInput) {
 // A file the grammar cannot read ends the process with three messages; with
 // the process kept alive, the parse is abandoned.
 struct BadFile {
-  const char* name;
-  const char* file;
-  const char* text;
+  const char *name, *file, *text;
   int line;
 };
 
@@ -206,8 +201,7 @@ INSTANTIATE_TEST_SUITE_P(Files, SyntaxErrorTest, testing::Values(
 // clang-format on
 
 TEST_F(ControlFileTest, LexicalErrorExitsWithMinusOne) {
-  RJCreadfile = "Render_Job_Control";
-  RJCcurrent_lineno = 7;
+  std::tie(RJCreadfile, RJCcurrent_lineno) = std::pair("Render_Job_Control", 7);
   EXPECT_EXIT((dup2(STDERR_FILENO, STDOUT_FILENO), RJClexerror("@")), testing::ExitedWithCode(255),
               "LEX: UNKNOWN TOKEN in line 7 of \"Render_Job_Control\" file \\(@\\)");
   RJCreadfile = nullptr;
