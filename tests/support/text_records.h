@@ -60,16 +60,10 @@ inline void swap_lists(RndCtl& a, RndCtl& b) {
   std::swap(a.dev_name_index, b.dev_name_index);
 }
 
-inline std::string after_slash(const std::string& text) {
-  size_t slash = text.rfind('/');
-  return slash == std::string::npos ? text : text.substr(slash + 1);
-}
-
-/// Builds a resource, a second plain resource, a job holding the texts in
-/// every string field and a job without a name, and checks the property.
-/// `texts` is used round-robin (empty: every field ""); the lists must be
-/// empty, and are empty again afterwards.  Returns "" when it holds, else
-/// what went wrong.
+/// Builds a resource, a second plain resource, a job holding the texts in every string field and
+/// a job without a name, and checks the property.  `texts` is used round-robin (empty: every
+/// field ""); the lists must be empty, and are empty again afterwards.  Returns "" when it
+/// holds, else what went wrong.
 inline std::string check(const std::vector<std::string>& texts) {
   size_t next = 0;
   auto t = [&]() -> std::string {
@@ -97,9 +91,8 @@ inline std::string check(const std::vector<std::string>& texts) {
                     user = held[5], exe = held[7];
   std::tie(job->animate, job->frames[0], job->frames[1], job->frames[2]) = std::tuple(1, 1, 10, 1);
   for (int i = 0; i < 2; ++i) RndPathList_add(job, t().c_str());
-  RndDevList_add(job, odd);
-  RndDevList_add(job, plain);
-  RndDevList_add(nameless, plain);
+  for (auto [on, dev] : {std::pair{job, odd}, {job, plain}, {nameless, plain}})
+    RndDevList_add(on, dev);
 
   const std::string devs_text = written(Resource_control_write_dev);
   const std::string jobs_text = written(Job_control_write_dev);
@@ -109,7 +102,7 @@ inline std::string check(const std::vector<std::string>& texts) {
   odd->host_name.set(RJC_name_form(host.c_str()).c_str());
   odd->remote_location.set(RJC_string_form(location.c_str()).c_str());
   odd->comment.reset();  // a resource comment is written, never read
-  job->name.set(RJC_name_form(after_slash(name).c_str()).c_str());
+  job->name.set(RJC_name_form(name.substr(name.rfind('/') + 1).c_str()).c_str());
   job->comment.set(RJC_comment_form(comment.c_str()).c_str());
   job->user.set(RJC_name_form(user.c_str()).c_str());
   job->executable.set(RJC_name_form(exe.c_str()).c_str());
