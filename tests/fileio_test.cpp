@@ -7,26 +7,26 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <cstdio>
 #include <string>
 #include <vector>
 
 #include "Utility/rndctl/ctldir/rj_paths.h"
 #include "Utility/rndctl/ctldir/rj_pidfile.h"
+#include "gmock/gmock.h"
 #include "tests/support/test_support.h"
 
 namespace {
 
 using Names = std::vector<std::string>;
+using testing::HasSubstr;
 
 mode_t mode_of(const std::string& p) {
   struct stat st;
   return stat(p.c_str(), &st) == 0 ? st.st_mode & 07777 : 0;
 }
 
-// Planted locks are made at kLockMade and the fake clocks count from it, so no
-// test sleeps.  A waiter that never breaks the lock gets an absurd age and
-// fails on it instead of hanging.
+// Planted locks are made at kLockMade and the fake clocks count from it, so no test sleeps.
+// A waiter that never breaks the lock gets an absurd age and fails on it instead of hanging.
 constexpr time_t kLockMade = 1000000000;
 constexpr int64_t kSecond = 1000000000;
 time_t fake_server = 0;
@@ -47,8 +47,7 @@ class FileopTest : public ControlDirTest {
     fileop_sleep = fake_sleep;
     fileop_monotonic_ns = [] { return fake_mono; };
     fileop_server_clock = [] { return fake_server; };
-    fake_server = kLockMade;
-    fake_mono = 0;
+    std::tie(fake_server, fake_mono) = std::tuple(kLockMade, 0);
     pauses.clear();
   }
   void TearDown() override {
@@ -57,11 +56,10 @@ class FileopTest : public ControlDirTest {
     debug_fileacc = 0;
     ControlDirTest::TearDown();
   }
-  std::string lock_dir(int index) const {
-    return path(std::string(control_names[index]) + ".lock");
-  }
-  // A lock made at kLockMade (its age is its access time), with a holder file
-  // when `holder` is set.
+  std::string lock_dir(int i) const { return path(control_names[i] + std::string(".lock")); }
+  /// What this host's holder file in the lock of `index` holds.
+  std::string holder(int index) const { return read_text_file(lock_dir(index) + "/testhost"); }
+  // A lock made at kLockMade (its age is its access time), with a holder file if `holder`.
   void plant_lock(int index, const char* holder, const std::string& content) {
     std::string lock = lock_dir(index);
     ASSERT_EQ(mkdir(lock.c_str(), 0777), 0);
@@ -72,31 +70,27 @@ class FileopTest : public ControlDirTest {
   // The control directory but for the access log and the clock file.
   Names entries() const {
     Names names = dir_names(dir_);
-    std::erase_if(
-        names, [](const std::string& n) { return n == "Render_Access" || n == ".clock.testhost"; });
+    std::erase_if(names, [](auto& n) { return n == "Render_Access" || n == ".clock.testhost"; });
     return names;
   }
 
+  const std::string my_pid = std::to_string(getpid()) + "\n";  // a holder file of this process
   const std::tuple<unsigned, void (*)(int64_t), int64_t (*)(), time_t (*)()> saved_{
       fileop_poll_seconds, fileop_sleep, fileop_monotonic_ns, fileop_server_clock};
 };
 
 TEST_F(FileopTest, FreeLockHoldsHostFileWithPidAndReleaseRemovesBoth) {
   ASSERT_EQ(lock_fileop(FILE_TASKS, 1), 1);
-  EXPECT_EQ(read_text_file(lock_dir(FILE_TASKS) + "/testhost"), std::to_string(getpid()) + "\n");
-  EXPECT_EQ(mode_of(lock_dir(FILE_TASKS)), 0777u);
   // The holder is renamed in: nothing else is left beside the lock.
-  EXPECT_EQ(entries(), Names{"Render_Tasks.lock"});
-  EXPECT_TRUE(pauses.empty());
-  EXPECT_EQ(std::string(fileop_path(FILE_TASKS)), path("Render_Tasks"));
+  EXPECT_EQ(std::tuple(holder(FILE_TASKS), mode_of(lock_dir(FILE_TASKS)), entries(), pauses.size(),
+                       std::string(fileop_path(FILE_TASKS))),
+            std::tuple(my_pid, 0777u, Names{"Render_Tasks.lock"}, 0u, path("Render_Tasks")));
   EXPECT_EQ(read_file("Render_Access"), "\n\n *** Start of new process entries ***\n\n");
   // Reading a missing file makes it, empty.
   FILE* fp = read_fileop(FILE_TASKS);
-  EXPECT_TRUE(fp != nullptr && fgetc(fp) == EOF);
-  EXPECT_EQ(close_fileop(FILE_TASKS), 0);
-  EXPECT_EQ(read_file("Render_Tasks"), "");
+  EXPECT_TRUE(fp != nullptr && fgetc(fp) == EOF && close_fileop(FILE_TASKS) == 0);
 
-  long before = fileop_hold_stats(FILE_TASKS).count;
+  const long before = fileop_hold_stats(FILE_TASKS).count;
   fake_mono += 3 * kSecond / 1000;
   ASSERT_EQ(lock_fileop(FILE_TASKS, 0), 1);
   EXPECT_EQ(entries(), Names{"Render_Tasks"});
@@ -122,29 +116,20 @@ TEST_P(BusyLockTest, WaiterBreaksItOnlyWhenItsHolderIsGone) {
   ASSERT_EQ(init_fileop(), 1);
   testing::internal::CaptureStderr();
   ASSERT_EQ(lock_fileop(FILE_RESOURCES, 1), 1);
-  std::string err = testing::internal::GetCapturedStderr();
-  long age = static_cast<long>(fake_server - kLockMade);
-  if (c.broken_at_age == 0) {
-    EXPECT_TRUE(pauses.empty()) << age;
-  } else {
-    // Respected until then, taken within one (at most 5 s) pause after, and
-    // in the retry mode other tools look for.
-    EXPECT_GE(age, c.broken_at_age);
-    EXPECT_LE(age, c.broken_at_age + 5);
-    EXPECT_EQ(mode_of(lock_dir(FILE_RESOURCES)), 0664u);
-  }
-  EXPECT_EQ(dir_names(lock_dir(FILE_RESOURCES)), Names{"testhost"});
-  EXPECT_EQ(read_text_file(lock_dir(FILE_RESOURCES) + "/testhost"),
-            std::to_string(getpid()) + "\n");
-  EXPECT_NE(read_file("Render_Access").find(c.log_line), std::string::npos)
-      << read_file("Render_Access");
-  if (c.broken_at_age == 181) {
-    std::string message = std::to_string(age) + " second timed out on \"" + c.holder + "\" in \"" +
-                          lock_dir(FILE_RESOURCES) + "\" removed";
+  const std::string err = testing::internal::GetCapturedStderr(), log = read_file("Render_Access");
+  // Respected until then, taken within one (at most 5 s) pause after, and in the retry mode
+  // other tools look for.
+  const long age = static_cast<long>(fake_server - kLockMade), at = c.broken_at_age;
+  EXPECT_TRUE(at == 0 ? pauses.empty() : age >= at && age <= at + 5) << age;
+  EXPECT_TRUE(at == 0 || mode_of(lock_dir(FILE_RESOURCES)) == 0664u);
+  EXPECT_EQ(std::pair(dir_names(lock_dir(FILE_RESOURCES)), holder(FILE_RESOURCES)),
+            std::pair(Names{"testhost"}, my_pid));
+  EXPECT_THAT(log, HasSubstr(c.log_line));
+  if (at == 181) {
+    const std::string message = std::to_string(age) + " second timed out on \"" + c.holder +
+                                "\" in \"" + lock_dir(FILE_RESOURCES) + "\" removed";
     EXPECT_EQ(err, message + "\n");
-    // The access log names the host that broke it.
-    EXPECT_NE(read_file("Render_Access").find("* " + message + " --  testhost:"),
-              std::string::npos);
+    EXPECT_THAT(log, HasSubstr("* " + message + " --  testhost:"));  // names who broke it
   }
   ASSERT_EQ(lock_fileop(FILE_RESOURCES, 0), 1);
   EXPECT_EQ(entries(), Names{});
@@ -169,8 +154,7 @@ TEST_F(FileopTest, WaitersRacingAtAStaleLockBreakItOnceAndTakeItInTurn) {
   fake_server = kLockMade + 200;
   // Real, short pauses: the children really wait.
   std::tie(std::ignore, fileop_sleep, fileop_monotonic_ns, std::ignore) = saved_;
-  fileop_poll_seconds = 1;
-  debug_fileacc = 1;
+  fileop_poll_seconds = debug_fileacc = 1;
   ASSERT_EQ(init_fileop(), 1);
   static std::string inside;
   inside = path("inside");
@@ -182,14 +166,12 @@ TEST_F(FileopTest, WaitersRacingAtAStaleLockBreakItOnceAndTakeItInTurn) {
     close(fd);
     usleep(2000);
     unlink(inside.c_str());
-    if (lock_fileop(FILE_TASKS, 0) != 1) return 6;
-    return 0;
+    return lock_fileop(FILE_TASKS, 0) != 1 ? 6 : 0;
   };
   for (RaceChild c : race_children(4, waiter, nullptr)) EXPECT_EQ(c.status, 0);
-  std::string log = read_file("Render_Access");
-  size_t breaks = 0;
-  for (size_t at = 0; (at = log.find("second timed out", at)) != std::string::npos; at++) breaks++;
-  EXPECT_EQ(breaks, 1u) << log;
+  const std::string log = read_file("Render_Access");
+  const size_t broken = log.find("second timed out");  // once
+  EXPECT_TRUE(broken != std::string::npos && broken == log.rfind("second timed out")) << log;
   EXPECT_EQ(entries(), Names{});
 }
 
@@ -197,22 +179,20 @@ TEST_F(FileopTest, ReleaseRemovesOnlyLocksThisProcessHolds) {
   // Another holder's lock, by host or by pid, stays on release.
   plant_lock(FILE_JOBS, "otherhost", "1\n");
   plant_lock(FILE_RESOURCES, "testhost", "1\n");
-  ASSERT_EQ(lock_fileop(FILE_JOBS, 0), 1);
-  ASSERT_EQ(lock_fileop(FILE_RESOURCES, 0), 1);
-  ASSERT_EQ(lock_fileop(FILE_TASKS, 1), 1);
-  ASSERT_EQ(lock_fileop(FILE_DEV_INDEX, 1), 1);
-  ASSERT_EQ(lock_fileop(FILE_JOB_INDEX, 1), 1);
-  ASSERT_EQ(lock_fileop(FILE_JOB_INDEX, 0), 1);
+  const std::pair<int, int> steps[] = {{FILE_JOBS, 0},      {FILE_RESOURCES, 0},
+                                       {FILE_TASKS, 1},     {FILE_DEV_INDEX, 1},
+                                       {FILE_JOB_INDEX, 1}, {FILE_JOB_INDEX, 0}};
+  for (auto [index, take] : steps) ASSERT_EQ(lock_fileop(index, take), 1) << index << " " << take;
   // A syntax error ends the process; on its way out it lets go of its locks.
-  void (*saved_exit)(int) = RJC_fatal_exit;
-  RJC_fatal_exit = [](int) {};
+  void (*saved_exit)(int) = std::exchange(RJC_fatal_exit, [](int) {});
   testing::internal::CaptureStdout();
   RJC_parse_string("RenderJobControl {{{", 20, "Render_Job_Control");
   testing::internal::GetCapturedStdout();
   RJC_fatal_exit = saved_exit;
-  EXPECT_EQ(entries(), (Names{"Render_Job_Control.lock", "Render_Resource_Control.lock"}));
-  EXPECT_EQ(dir_names(lock_dir(FILE_JOBS)), Names{"otherhost"});
-  EXPECT_EQ(dir_names(lock_dir(FILE_RESOURCES)), Names{"testhost"});
+  EXPECT_EQ(
+      std::tuple(entries(), dir_names(lock_dir(FILE_JOBS)), dir_names(lock_dir(FILE_RESOURCES))),
+      std::tuple(Names{"Render_Job_Control.lock", "Render_Resource_Control.lock"},
+                 Names{"otherhost"}, Names{"testhost"}));
 }
 
 // One rewrite through each calling shape: the classic one (read, rewind,
@@ -221,21 +201,16 @@ TEST_F(FileopTest, ReleaseRemovesOnlyLocksThisProcessHolds) {
 enum class Shape { kRewind, kWriteAtOnce, kRewriteHelper };
 
 int rewrite(int index, Shape shape, const std::string& text) {
-  if (shape == Shape::kRewriteHelper) {
+  if (shape == Shape::kRewriteHelper)
     return fileop_rewrite(index, [&](FILE* in, FILE* out) {
-      while (fgetc(in) != EOF) {
-      }
+      while (fgetc(in) != EOF) continue;
       return fwrite(text.data(), 1, text.size(), out) == text.size();
     });
-  }
   FileopLock lock(index);
   FILE* fp = update_fileop(index);
   if (fp == nullptr) return -2;
-  if (shape == Shape::kRewind) {
-    while (fgetc(fp) != EOF) {
-    }
-    rewind_fileop(index);
-  }
+  while (shape == Shape::kRewind && fgetc(fp) != EOF) continue;
+  if (shape == Shape::kRewind) rewind_fileop(index);
   fwrite(text.data(), 1, text.size(), fp);
   return close_and_truncate_fileop(index);
 }
@@ -251,17 +226,15 @@ TEST_P(RewriteTest, UnchangedContentsLeaveTheFileAloneChangedOnesReplaceItWhole)
   ASSERT_EQ(stat(file.c_str(), &before), 0);
   EXPECT_EQ(rewrite(FILE_JOB_INDEX, GetParam(), old_text), 0);
   ASSERT_EQ(stat(file.c_str(), &after), 0);
-  EXPECT_EQ(after.st_ino, before.st_ino);
-  EXPECT_EQ(after.st_mtime, kLockMade);
+  EXPECT_EQ(std::pair(after.st_ino, after.st_mtime), std::pair(before.st_ino, kLockMade));
 
   // Shorter contents: nothing of the old tail stays, the mode is kept.
   ASSERT_EQ(chmod(file.c_str(), 0640), 0);
   EXPECT_EQ(rewrite(FILE_JOB_INDEX, GetParam(), "7\n"), GetParam() == Shape::kRewriteHelper);
-  EXPECT_EQ(read_file("Render_Job_next_index"), "7\n");
   ASSERT_EQ(stat(file.c_str(), &after), 0);
-  EXPECT_NE(after.st_ino, before.st_ino);
-  EXPECT_EQ(after.st_mode & 07777, 0640u);
-  EXPECT_EQ(entries(), Names{"Render_Job_next_index"});
+  EXPECT_EQ(std::tuple(read_file("Render_Job_next_index"), after.st_ino != before.st_ino,
+                       after.st_mode & 07777, entries()),
+            std::tuple("7\n", true, 0640u, Names{"Render_Job_next_index"}));
 }
 
 TEST_P(RewriteTest, AFailedWriteLeavesTheOldFileAndNoTemporary) {
@@ -283,11 +256,10 @@ TEST_P(RewriteTest, AFailedWriteLeavesTheOldFileAndNoTemporary) {
   std::string reported(512, '\0');
   reported.resize(std::max<ssize_t>(read(err[0], &reported[0], reported.size()), 0));
   close(err[0]);
-  EXPECT_EQ(read_file("Render_Tasks"), "old contents\n");
-  EXPECT_EQ(entries(), Names{"Render_Tasks"});
-  EXPECT_NE(reported.find("ERROR: failed to write " + path("Render_Tasks") + ": File too large"),
-            std::string::npos)
-      << reported;
+  EXPECT_EQ(std::pair(read_file("Render_Tasks"), entries()),
+            std::pair(std::string("old contents\n"), Names{"Render_Tasks"}));
+  EXPECT_THAT(reported,
+              HasSubstr("ERROR: failed to write " + path("Render_Tasks") + ": File too large"));
 }
 
 INSTANTIATE_TEST_SUITE_P(Shapes, RewriteTest,
@@ -299,12 +271,7 @@ TEST_F(FileopTest, OriginalUmaskSurvivesReinitialisation) {
   ASSERT_EQ(init_fileop(), 1);
   fileop_reset();
   ASSERT_EQ(init_fileop(), 1);
-  EXPECT_EQ(get_original_umask(), static_cast<mode_t>(022));
-  EXPECT_EQ(umask(0), static_cast<mode_t>(1));
-}
-
-void write_pid(const std::string& file, int32_t pid, size_t bytes = sizeof(int32_t)) {
-  ASSERT_TRUE(write_text_file(file, std::string(reinterpret_cast<const char*>(&pid), bytes)));
+  EXPECT_EQ(std::pair(get_original_umask(), umask(0)), std::pair(mode_t{022}, mode_t{1}));
 }
 
 // What start-up finds in the pid file (bytes of the pid of a process that
@@ -313,7 +280,7 @@ void write_pid(const std::string& file, int32_t pid, size_t bytes = sizeof(int32
 class PidfileClaimTest : public FileopTest, public testing::WithParamInterface<int> {};
 
 TEST_P(PidfileClaimTest, OfClaimersStartingAtOnceExactlyOneWins) {
-  if (GetParam() >= 0) write_pid(path("testhost.pid"), exited_pid(), GetParam());
+  if (GetParam() >= 0) write_file("testhost.pid", pid_bytes(exited_pid(), GetParam()));
   // Claimers stay alive until all have claimed, so a loser sees the winner alive.
   static int* claimed;
   claimed = static_cast<int*>(
@@ -331,10 +298,8 @@ TEST_P(PidfileClaimTest, OfClaimersStartingAtOnceExactlyOneWins) {
   munmap(claimed, sizeof(int));
   PidfileRead now = Pidfile_read("testhost");
   ASSERT_EQ(now.status, PIDFILE_OK);
-  for (RaceChild c : raced) {
-    EXPECT_TRUE(WIFEXITED(c.status)) << c.status;
-    EXPECT_EQ(WEXITSTATUS(c.status), c.pid == now.pid ? 0 : 1) << c.pid << " " << now.pid;
-  }
+  for (RaceChild c : raced)
+    EXPECT_EQ(c.status, c.pid == now.pid ? 0 : 256) << c.pid << " won: " << now.pid;
   EXPECT_EQ(entries(), Names{"testhost.pid"});
 }
 
@@ -344,10 +309,10 @@ TEST_F(FileopTest, SelfCheckPassesOnlyWhileThePidFileNamesThisProcess) {
   ASSERT_EQ(init_fileop(), 1);
   for (auto [pid, bytes, ok] :
        {std::tuple{rndctl.pid, 4, true}, {rndctl.pid + 1, 4, false}, {rndctl.pid, 3, false}}) {
-    write_pid(path("testhost.pid"), pid, bytes);
+    write_file("testhost.pid", pid_bytes(pid, bytes));
     EXPECT_EQ(Pidfile_self_check(), ok) << pid << " " << bytes;
   }
-  EXPECT_NE(read_file("Render_Access").find("* short pid file --  testhost:"), std::string::npos);
+  EXPECT_THAT(read_file("Render_Access"), HasSubstr("* short pid file --  testhost:"));
 }
 
 }  // namespace

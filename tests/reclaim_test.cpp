@@ -24,8 +24,7 @@ class ReclaimTest : public TaskFixture {
     far_->host_name.set("farhost");
   }
   void TearDown() override {
-    // Forgets whatever a test registered, in its own registry: the shared
-    // default one may list another test process's renders.
+    // Kills what the test registered, in its own registry: the default one lists other tests'.
     rj_render_kill_leftovers();
     unsetenv("DRCTMPDIR");
     unsetenv("ZARNO_RSH");
@@ -37,20 +36,11 @@ class ReclaimTest : public TaskFixture {
     struct timespec t[2] = {{now - seconds, 0}, {now - seconds, 0}};
     ASSERT_EQ(utimensat(AT_FDCWD, path(name).c_str(), t, 0), 0);
   }
-  // A child in its own process group that waits to be killed.
-  static pid_t sleeper() {
-    pid_t pid = fork();
-    if (pid == 0)
-      for (setpgid(0, 0);;) pause();
-    setpgid(pid, pid);
-    return pid;
-  }
+  // Whether `pid` ends by a signal within 5 seconds; killed and reaped either way.
   static bool killed(pid_t pid) {
-    int status = 0;
-    for (int i = 0; i < 500; ++i) {
-      if (waitpid(pid, &status, WNOHANG) == pid) return WIFSIGNALED(status);
-      usleep(10000);
-    }
+    int status = 0, tries = 0;
+    while (waitpid(pid, &status, WNOHANG) != pid && ++tries < 500) usleep(10000);
+    if (tries < 500) return WIFSIGNALED(status);
     kill(pid, SIGKILL);
     waitpid(pid, &status, 0);
     return false;
@@ -61,12 +51,9 @@ class ReclaimTest : public TaskFixture {
 // Nothing done goes back pending, whole, for any host; midway keeps the done
 // frames; at the last frame that frame stays pending.  Retries are kept.
 TEST_F(ReclaimTest, PutBackCutsAtTheFrameReached) {
-  // clang-format off
-  for (auto [current, expected] : {
-           std::pair<float, const char*>{1, "\t2\t 1.000000\t 6.000000\t 1.000000  0\t 3\tPENDING\n"},
-           {4, "\t2\t 1.000000\t 3.000000\t 3.000000  1\t 3\tFINISHED\n\t5\t 4.000000\t 6.000000\t 4.000000  0\t 3\tPENDING\n"},
-           {6, "\t2\t 1.000000\t 5.000000\t 5.000000  1\t 3\tFINISHED\n\t5\t 6.000000\t 6.000000\t 6.000000  0\t 3\tPENDING\n"}}) {
-    // clang-format on
+  for (auto [current, expected] : {std::pair<float, const char*>{1, "2 1 6 1 0 3 PENDING"},
+                                   {4, "2 1 3 3 1 3 FINISHED, 5 4 6 4 0 3 PENDING"},
+                                   {6, "2 1 5 5 1 3 FINISHED, 5 6 6 6 0 3 PENDING"}}) {
     TaskGroup* groups = TaskGroup_alloc(job_, 5);
     TaskRec* rec = TaskRec_alloc(groups, 1, 6, current, dev_, TASK_RUNNING, nullptr, 2);
     rec->retries = 3;
@@ -75,22 +62,21 @@ TEST_F(ReclaimTest, PutBackCutsAtTheFrameReached) {
     for (TaskRec* r = groups->tasks; r != nullptr; r = r->next)
       got += rec_line(r->id, r->start, r->end, r->current, r->dev ? r->dev->index : 0, r->retries,
                       GetTaskStatusStr(r->status));
-    EXPECT_EQ(got, expected) << current;
+    EXPECT_EQ(got, rec_lines(expected)) << current;
     TaskGroup_free_all(&groups);
   }
 }
 
 TEST_F(ReclaimTest, StartUpPutsBackOnlyThisHostsHeldTasks) {
   std::string name = job_->name.c_str();
-  write_file("Render_Tasks", group_line(name, 1, 4, 4) + rec_line(0, 1, 2, 1, 1, 0, "STARTED") +
-                                 rec_line(1, 3, 6, 5, 1, 1, "RUNNING") +
-                                 rec_line(2, 7, 8, 7, 2, 0, "RUNNING") +
-                                 rec_line(3, 9, 10, 9, 0, 0, "PENDING"));
+  write_file("Render_Tasks",
+             group_line(name, 1, 4, 4) + rec_lines("0 1 2 1 1 0 STARTED, 1 3 6 5 1 1 RUNNING, "
+                                                   "2 7 8 7 2 0 RUNNING, 3 9 10 9 0 0 PENDING"));
   EXPECT_EQ(Task_reclaim_this_host(), 2);
   EXPECT_EQ(read_file("Render_Tasks"),
-            group_line(name, 1, 5, 5) + rec_line(0, 1, 2, 1, 0, 0, "PENDING") +
-                rec_line(1, 3, 4, 4, 1, 1, "FINISHED") + rec_line(2, 7, 8, 7, 2, 0, "RUNNING") +
-                rec_line(3, 9, 10, 9, 0, 0, "PENDING") + rec_line(4, 5, 6, 5, 0, 1, "PENDING"));
+            group_line(name, 1, 5, 5) + rec_lines("0 1 2 1 0 0 PENDING, 1 3 4 4 1 1 FINISHED, "
+                                                  "2 7 8 7 2 0 RUNNING, 3 9 10 9 0 0 PENDING, "
+                                                  "4 5 6 5 0 1 PENDING"));
   EXPECT_EQ(access(path("Render_Tasks.lock").c_str(), F_OK), -1);
 }
 
@@ -101,26 +87,23 @@ TEST_F(ReclaimTest, AnotherHostsTaskIsPutBackOnlyWhenItsHeartbeatIsOldAndItsDaem
   chmod(path("fake_rsh").c_str(), 0755);
   setenv("ZARNO_RSH", path("fake_rsh").c_str(), 1);
   mkdir(path("TSKSTAT").c_str(), 0775);
-  std::string name = job_->name.c_str(),
-              held = group_line(name, 1, 1, 1) + rec_line(0, 1, 4, 1, 2, 0, "STARTED");
-  time_t now = time(nullptr);
-  int32_t me = getpid();
+  const std::string name = job_->name.c_str(),
+                    held = group_line(name, 1, 1, 1) + rec_line(0, 1, 4, 1, 2, 0, "STARTED");
+  const time_t now = time(nullptr);
   // Heartbeat age (-1: no heartbeat file), whether the daemon lives, whether put back.
-  for (auto [age, alive, put_back] : {std::tuple{30, false, false},
-                                      {-1, false, false},
-                                      {3600, true, false},
-                                      {3600, false, true}}) {
+  const std::tuple<int, bool, bool> cases[] = {
+      {30, false, false}, {-1, false, false}, {3600, true, false}, {3600, false, true}};
+  for (auto [age, alive, put_back] : cases) {
     write_file("Render_Tasks", held);
-    unlink(path("TSKSTAT/farhost").c_str());
-    unlink(path("farhost.pid").c_str());
+    for (const char* file : {"TSKSTAT/farhost", "farhost.pid"}) unlink(path(file).c_str());
     if (age >= 0) write_file("TSKSTAT/farhost", "");
     if (age >= 0) set_age("TSKSTAT/farhost", age, now);
-    if (alive) write_file("farhost.pid", std::string(reinterpret_cast<const char*>(&me), 4));
+    if (alive) write_file("farhost.pid", pid_bytes(getpid()));
     EXPECT_EQ(Task_reclaim_dead_hosts(now), put_back ? 1 : 0) << age << alive;
     EXPECT_EQ(read_file("Render_Tasks").find("STARTED") == std::string::npos, put_back) << age;
   }
-  std::string access = read_file("Render_Access");
-  const std::string line = "put back task 0 of \"" + name + "\" from host farhost: ";
+  const std::string access = read_file("Render_Access"),
+                    line = "put back task 0 of \"" + name + "\" from host farhost: ";
   EXPECT_NE(access.find(line), std::string::npos) << access;
   EXPECT_EQ(access.find(line), access.rfind(line)) << access;
   EXPECT_NE(access.find("no heartbeat for 3600 seconds"), std::string::npos) << access;
@@ -139,16 +122,13 @@ TEST_F(ReclaimTest, HeartbeatCreatesTheStatusFileAndKeepsItsLines) {
 TEST_F(ReclaimTest, RegistryKillsOnlyTheRendersItRecordedAndIgnoresAPlantedLink) {
   write_file("victim", "untouched");
   ASSERT_EQ(symlink(path("victim").c_str(), rj_render_registry_path()), 0);
-  pid_t render = sleeper();
-  pid_t other = sleeper();
-  rj_render_started(render);
-  rj_render_started(other);
+  const pid_t render = sleeper(), other = sleeper();
+  for (pid_t pid : {render, other}) rj_render_started(pid);
   const std::string both = read_text_file(rj_render_registry_path());
   rj_render_ended(other);
   EXPECT_EQ(read_file("victim"), "untouched");
   struct stat st;
-  ASSERT_EQ(lstat(rj_render_registry_path(), &st), 0);
-  EXPECT_TRUE(S_ISREG(st.st_mode));
+  EXPECT_TRUE(lstat(rj_render_registry_path(), &st) == 0 && S_ISREG(st.st_mode));
   EXPECT_EQ(std::count(both.begin(), both.end(), '\n'), 2) << both;
 
   // A line that names a live process under another start time: its pid was
@@ -171,10 +151,11 @@ TEST_F(ReclaimTest, RegistryKillsOnlyTheRendersItRecordedAndIgnoresAPlantedLink)
 
 TEST(UpdateTimeSettled, AWholeSecondStampWaitsForTheServersNextSecond) {
   const int64_t stamp = 1700000000 * int64_t{1000000000};
-  EXPECT_TRUE(rj_update_time_settled(stamp + 123, 1700000000));
-  EXPECT_FALSE(rj_update_time_settled(stamp, 1700000000));
-  EXPECT_TRUE(rj_update_time_settled(stamp, 1700000001));
-  EXPECT_TRUE(rj_update_time_settled(0, 1700000000));
+  for (auto [ns, server, settled] : {std::tuple{stamp + 123, 1700000000, true},
+                                     {stamp, 1700000000, false},
+                                     {stamp, 1700000001, true},
+                                     {int64_t{0}, 1700000000, true}})
+    EXPECT_EQ(rj_update_time_settled(ns, server), settled) << ns << " " << server;
 }
 
 }  // namespace

@@ -2,7 +2,6 @@
 // re-pointed at them, the state text settled, both files written back.
 #include <unistd.h>
 
-#include "Shared/memory/MA_rtns.h"
 #include "tests/support/test_support.h"
 
 namespace {
@@ -10,19 +9,16 @@ namespace {
 const char kResources[] =
     "RenderResourceControl\n"
     "testhost 1 {\n\tlock_pid \t= 0;\n\thost_name\t\t= testhost;\n\tmax_frames \t\t= 3;\n"
-    "\tnum_processors \t= 2;\n  default_dev     = 0;\n\t}\n\n"
-    "End\n";
+    "\tnum_processors \t= 2;\n  default_dev     = 0;\n\t}\n\nEnd\n";
 
-std::string jobs_file(const std::string& state, int minutes = 0, int seconds = 0,
-                      bool with_job = true) {
-  std::string text =
-      "RenderJobControl " + std::to_string(minutes) + " " + std::to_string(seconds) + "\n";
-  if (with_job) {
-    text += "shot 7 {\n\tstatus \t\t= \"" + state +
-            "\";\n\tpriority \t= 0;\n\tuse_sdl_paths = TRUE;\n\toutput_mask = FALSE;\n"
-            "\tresources\t= testhost;\n}\n\n";
-  }
-  return text + "End\n";
+/// The job file holding job 7 in `state` (none when `state` is null).
+std::string jobs_file(const char* state, int minutes = 0, int seconds = 0) {
+  return "RenderJobControl " + std::to_string(minutes) + " " + std::to_string(seconds) + "\n" +
+         (state == nullptr ? ""
+                           : "shot 7 {\n\tstatus \t\t= \"" + std::string(state) +
+                                 "\";\n\tpriority \t= 0;\n\tuse_sdl_paths = TRUE;\n"
+                                 "\toutput_mask = FALSE;\n\tresources\t= testhost;\n}\n\n") +
+         "End\n";
 }
 
 class ReloadTest : public ControlDirTest {
@@ -34,20 +30,16 @@ class ReloadTest : public ControlDirTest {
     ASSERT_NE(Job_by_index(7), nullptr);
   }
   std::string state_in_file() {
-    std::string text = read_file("Render_Job_Control");
-    size_t at = text.find("status \t\t= \"");
-    if (at == std::string::npos) return "(none)";
-    at += 12;
-    return text.substr(at, text.find('"', at) - at);
+    const std::string text = read_file("Render_Job_Control");
+    const size_t at = text.find("status \t\t= \"") + 12;
+    return at < 12 ? "(none)" : text.substr(at, text.find('"', at) - at);
   }
 };
 
 struct Case {
   const char* name;
   int editor;
-  const char* in_file;
-  const char* in_memory;
-  const char* expected;
+  const char *in_file, *in_memory, *expected;
 };
 
 class Reconcile : public ReloadTest, public ::testing::WithParamInterface<Case> {};
@@ -78,24 +70,19 @@ INSTANTIATE_TEST_SUITE_P(
 
 TEST_F(ReloadTest, RunningTaskEntriesFollowTheFreshRecordsOrLoseAVanishedJob) {
   load(jobs_file("started"));
-  Job* old_job = Job_by_index(7);
-  Dev* old_dev = Dev_by_index(1);
-  auto* rec = MA_new<TaskRec>(__LINE__, "tests/reload_test");
-  rec->dev = old_dev;
-  TASK* entry = Task_add(old_job, rec);
+  TASK* entry = Task_add(
+      Job_by_index(7), TaskRec_alloc(nullptr, 0, 0, 0, Dev_by_index(1), TASK_PENDING, nullptr, 0));
   ASSERT_NE(entry, nullptr);
 
   Update_from_demon(0);
-  EXPECT_NE(entry->job, nullptr);
-  EXPECT_EQ(entry->job, Job_by_index(7));
-  EXPECT_EQ(entry->rec->dev, Dev_by_index(1));
-  EXPECT_EQ(entry->rec->dev->index, 1);
+  ASSERT_NE(Job_by_index(7), nullptr);
+  EXPECT_EQ(std::tuple(entry->job, entry->rec->dev, entry->rec->dev->index),
+            std::tuple(Job_by_index(7), Dev_by_index(1), 1));
 
-  write_file("Render_Job_Control", jobs_file("", 0, 0, false));
+  write_file("Render_Job_Control", jobs_file(nullptr));
   Update_from_demon(0);
-  EXPECT_EQ(entry->job, nullptr);
-  EXPECT_EQ(Job_by_index(7), nullptr);
-  EXPECT_EQ(entry->rec->dev, Dev_by_index(1));
+  EXPECT_EQ(std::tuple(entry->job, Job_by_index(7), entry->rec->dev),
+            std::tuple(nullptr, nullptr, Dev_by_index(1)));
 }
 
 TEST_F(ReloadTest, TheJobFileHeaderSetsTheCheckIntervalAndTheUpdateTimeIsRecorded) {
@@ -104,9 +91,8 @@ TEST_F(ReloadTest, TheJobFileHeaderSetsTheCheckIntervalAndTheUpdateTimeIsRecorde
   write_file("Render_Job_Control", jobs_file("pending", 4, 5));
   daemon_updatetime_set("testhost");
   Update_from_demon(0);
-  EXPECT_EQ(rndctl.interval_min, 4u);
-  EXPECT_EQ(rndctl.interval_sec, 5u);
-  EXPECT_EQ(rndctl.last_update, daemon_updatetime_get("testhost"));
+  EXPECT_EQ(std::tuple(rndctl.interval_min, rndctl.interval_sec, rndctl.last_update),
+            std::tuple(4u, 5u, daemon_updatetime_get("testhost")));
   // Written back as read, and no lock left behind.
   EXPECT_EQ(read_file("Render_Job_Control").rfind("RenderJobControl 4 5\n", 0), 0u);
   EXPECT_NE(access(path("Render_Job_Control.lock").c_str(), F_OK), 0);
@@ -115,8 +101,7 @@ TEST_F(ReloadTest, TheJobFileHeaderSetsTheCheckIntervalAndTheUpdateTimeIsRecorde
 
 TEST_F(ReloadTest, AnEmptyOrMissingControlFileReadsAsNoRecords) {
   EXPECT_EQ(RJC_in(), 0);
-  EXPECT_EQ(rndctl.jobs, nullptr);
-  EXPECT_EQ(rndctl.devs, nullptr);
+  EXPECT_TRUE(rndctl.jobs == nullptr && rndctl.devs == nullptr);
   RJC_out();
   EXPECT_EQ(read_file("Render_Resource_Control"), "RenderResourceControl\nEnd\n");
   EXPECT_EQ(read_file("Render_Job_Control"), "RenderJobControl 0 0\nEnd\n");
@@ -126,8 +111,7 @@ TEST(FloatValue, LeadingNumberOrNothing) {
   float v = -1;
   EXPECT_EQ(get_fvalue("12.50% ", &v), 1);
   EXPECT_FLOAT_EQ(v, 12.5f);
-  EXPECT_EQ(get_fvalue("pending", &v), 0);
-  EXPECT_EQ(get_fvalue(nullptr, &v), 0);
+  EXPECT_EQ(std::pair(get_fvalue("pending", &v), get_fvalue(nullptr, &v)), std::pair(0, 0));
 }
 
 }  // namespace

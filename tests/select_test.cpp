@@ -5,7 +5,6 @@
 #include <climits>
 #include <cstdlib>
 #include <ctime>
-#include <initializer_list>
 #include <string>
 #include <vector>
 
@@ -38,8 +37,7 @@ class SelectTest : public ControlDirTest {
     ASSERT_TRUE(here_ && there_);
     here_->host_name.set("testhost");
     there_->host_name.set("otherhost");
-    here_->max_frames = 3;
-    here_->num_processors = 4;
+    std::tie(here_->max_frames, here_->num_processors) = std::pair(3, 4);
   }
   void TearDown() override {
     alarm(0);
@@ -54,11 +52,8 @@ class SelectTest : public ControlDirTest {
     Job* job = Add_a_job(nullptr, name, index);
     EXPECT_NE(job, nullptr);
     job->status.set("pending");
-    job->priority = priority;
-    job->animate = 1;
-    job->frames[0] = 1;
-    job->frames[1] = end;
-    job->frames[2] = by;
+    std::tie(job->priority, job->animate) = std::pair(priority, 1);
+    std::tie(job->frames[0], job->frames[1], job->frames[2]) = std::tuple(1.0f, end, by);
     for (Dev* d : hosts) RndDevList_add(job, d);
     return job;
   }
@@ -83,11 +78,9 @@ class SelectTest : public ControlDirTest {
 
 struct CutCase {
   const char* label;
-  int max_frames;
+  int max_frames, animate, max_frames_after;
   float end, by;
-  int animate;
   const char* after;  // the records of the task file afterwards
-  int max_frames_after;
 };
 
 class Cutting : public SelectTest, public testing::WithParamInterface<CutCase> {};
@@ -105,12 +98,12 @@ TEST_P(Cutting, FirstPickCutsTheHostsShareOffTheJob) {
 INSTANTIATE_TEST_SUITE_P(
     Ranges, Cutting,
     testing::Values(
-        CutCase{"three_of_ten", 3, 10, 1, 1, "0 1 3 1 1 0 STARTED, 1 4 10 4 0 0 PENDING", 3},
-        CutCase{"zero_means_one", 0, 10, 1, 1, "0 1 1 1 1 0 STARTED, 1 2 10 2 0 0 PENDING", 1},
-        CutCase{"by_two", 3, 10, 2, 1, "0 1 5 1 1 0 STARTED, 1 7 10 7 0 0 PENDING", 3},
-        CutCase{"fewer_steps_than_max", 3, 3, 1, 1, "0 1 3 1 1 0 STARTED", 3},
-        CutCase{"still_image_never_cut", 3, 10, 1, 0, "0 1 10 1 1 0 STARTED", 3},
-        CutCase{"zero_step_never_cut", 3, 10, 0, 1, "0 1 10 1 1 0 STARTED", 3}),
+        CutCase{"three_of_ten", 3, 1, 3, 10, 1, "0 1 3 1 1 0 STARTED, 1 4 10 4 0 0 PENDING"},
+        CutCase{"zero_means_one", 0, 1, 1, 10, 1, "0 1 1 1 1 0 STARTED, 1 2 10 2 0 0 PENDING"},
+        CutCase{"by_two", 3, 1, 3, 10, 2, "0 1 5 1 1 0 STARTED, 1 7 10 7 0 0 PENDING"},
+        CutCase{"fewer_steps_than_max", 3, 1, 3, 3, 1, "0 1 3 1 1 0 STARTED"},
+        CutCase{"still_image_never_cut", 3, 0, 3, 10, 1, "0 1 10 1 1 0 STARTED"},
+        CutCase{"zero_step_never_cut", 3, 1, 3, 10, 0, "0 1 10 1 1 0 STARTED"}),
     Label);
 
 TEST_F(SelectTest, EachTaskOnTheHostTakesAProcessSlot) {
@@ -125,21 +118,18 @@ TEST_F(SelectTest, EachTaskOnTheHostTakesAProcessSlot) {
   EXPECT_EQ(Dev_processes_available(here_), 0);
   EXPECT_EQ(tasks(), scene("0 1 3 1 1 0 STARTED, 1 4 6 4 1 0 STARTED, 2 7 10 7 0 0 PENDING"));
   // The running-task list mirrors the file.
-  EXPECT_EQ(count_entries(), 3);
-  EXPECT_TRUE(entry_of(job, 0) == first && entry_of(job, 1) == second);
+  EXPECT_TRUE(count_entries() == 3 && entry_of(job, 0) == first && entry_of(job, 1) == second);
 
   // A host that never set its processors runs one task.
   there_->num_processors = 0;
-  EXPECT_EQ(Dev_processes_available(there_), 1);
-  EXPECT_EQ(there_->num_processors, 1);
+  EXPECT_EQ(std::pair(Dev_processes_available(there_), there_->num_processors), std::pair(1, 1));
 }
 
 struct PriorityCase {
   const char* label;
-  int running;
+  int running, chosen;  // chosen: a position in the list below, -1 for none
   // One job each, in job list order; their groups run the other way: "first" means last here.
   std::vector<int> priorities;
-  int chosen;  // position in this list, -1 for none
 };
 
 class Priority : public SelectTest, public testing::WithParamInterface<PriorityCase> {};
@@ -159,10 +149,10 @@ TEST_P(Priority, ChoosesTheJob) {
 }
 
 INSTANTIATE_TEST_SUITE_P(Jobs, Priority,
-                         testing::Values(PriorityCase{"lowest_number_wins", 0, {5, 1, 3}, 1},
-                                         PriorityCase{"tie_goes_to_the_first", 0, {2, 2}, 1},
-                                         PriorityCase{"busy_takes_priority_0", 1, {0, 0, 1}, 1},
-                                         PriorityCase{"busy_host_leaves_the_rest", 1, {1, 2}, -1}),
+                         testing::Values(PriorityCase{"lowest_number_wins", 0, 1, {5, 1, 3}},
+                                         PriorityCase{"tie_goes_to_the_first", 0, 1, {2, 2}},
+                                         PriorityCase{"busy_takes_priority_0", 1, 1, {0, 0, 1}},
+                                         PriorityCase{"busy_host_leaves_the_rest", 1, -1, {1, 2}}),
                          Label);
 
 TEST_F(SelectTest, JobsThisHostMayNotRenderAreLeftAlone) {
@@ -178,9 +168,8 @@ TEST_F(SelectTest, JobsThisHostMayNotRenderAreLeftAlone) {
 struct FailCase {
   const char* label;
   float current;
-  int retries;
-  const char* file;  // its records afterwards
-  int status;        // of the failed task's entry afterwards
+  int retries, status;  // status: of the failed task's entry afterwards
+  const char* file;     // its records afterwards
 };
 
 class PutBack : public SelectTest, public testing::WithParamInterface<FailCase> {};
@@ -191,13 +180,11 @@ TEST_P(PutBack, FailedTaskGoesBackOrIsCutWhereItStopped) {
   Job* job = make_job(1, "scene.sdl", 0, {here_, there_});
   TASK* failed = Task_get();
   ASSERT_NE(failed, nullptr);
-  failed->rec->status = TASK_FAILED;
-  failed->rec->current = c.current;
-  failed->rec->retries = c.retries;
+  std::tie(failed->rec->status, failed->rec->current, failed->rec->retries) =
+      std::tuple(TASK_FAILED, c.current, c.retries);
 
   EXPECT_EQ(Split_first_splittable_failed_tasks(), nullptr);
-  EXPECT_EQ(tasks(), scene(c.file));
-  EXPECT_EQ(failed->rec->status, c.status);
+  EXPECT_EQ(std::pair(tasks(), failed->rec->status), std::pair(scene(c.file), c.status));
   // A remainder cut off is a fresh task: any host, this one included, takes it.
   TASK* again = c.status == TASK_FINISHED ? Task_get() : nullptr;
   EXPECT_EQ(again != nullptr && again == entry_of(job, 1), c.status == TASK_FINISHED);
@@ -206,10 +193,10 @@ TEST_P(PutBack, FailedTaskGoesBackOrIsCutWhereItStopped) {
 
 INSTANTIATE_TEST_SUITE_P(
     Failures, PutBack,
-    testing::Values(FailCase{"after_progress", 5, 0, "0 1 4 4 1 1 FINISHED, 1 5 10 5 0 0 PENDING",
-                             TASK_FINISHED},
-                    FailCase{"no_progress", 1, 0, "0 1 10 1 1 1 PENDING", TASK_PENDING},
-                    FailCase{"tenth_failure", 5, 10, "0 1 10 1 1 0 STARTED", TASK_FAILED}),
+    testing::Values(FailCase{"after_progress", 5, 0, TASK_FINISHED,
+                             "0 1 4 4 1 1 FINISHED, 1 5 10 5 0 0 PENDING"},
+                    FailCase{"no_progress", 1, 0, TASK_PENDING, "0 1 10 1 1 1 PENDING"},
+                    FailCase{"tenth_failure", 5, 10, TASK_FAILED, "0 1 10 1 1 0 STARTED"}),
     Label);
 
 struct RetryCase {
@@ -255,9 +242,8 @@ TEST_F(SelectTest, EntriesFollowTheFileAndThisHostKeepsItsOwnStatus) {
   rndctl.running = 1;  // only priority 0 jobs, as this one is
   TASK* next = Task_get();
   ASSERT_TRUE(next != nullptr && next->rec->id == 2);
-  EXPECT_EQ(entry_of(job, 0), theirs);
-  EXPECT_EQ(theirs->rec->status, TASK_FINISHED);
-  EXPECT_FLOAT_EQ(theirs->rec->current, 3);
+  EXPECT_EQ(std::tuple(entry_of(job, 0), theirs->rec->status, theirs->rec->current),
+            std::tuple(theirs, TASK_FINISHED, 3.0f));
   EXPECT_EQ(tasks(), scene("0 1 3 3 2 0 FINISHED, 1 4 6 4 1 0 RUNNING, 2 7 9 7 1 0 STARTED, "
                            "3 10 10 10 0 0 PENDING"));
 
@@ -322,8 +308,7 @@ TEST_F(SelectTest, LockedHostPicksNothingAndSleepsUntilTheLockEnds) {
     EXPECT_EQ(GetaPendingTask(), nullptr);
     unsigned left = alarm(0), want = state == LOCK_LOCKED ? 1800 : 3 * 3600;
     EXPECT_TRUE(left <= want && left + 2 >= want) << left;
-    EXPECT_EQ(tasks(), "");
-    EXPECT_EQ(rndctl.tasks, nullptr);
+    EXPECT_TRUE(tasks().empty() && rndctl.tasks == nullptr);
   }
 }
 
@@ -333,22 +318,21 @@ TEST_F(SelectTest, PickedTaskGetsAnEmptyStreamFileThatALinkCannotRedirect) {
   write_file("scene.sdl.render1.0", "old output");
   TASK* first = GetaPendingTask();
   ASSERT_NE(first, nullptr);
-  EXPECT_EQ(std::string(first->stream_path.c_str()), path("scene.sdl.render1.0"));
-  ASSERT_NE(first->stream, nullptr);
-  EXPECT_EQ(read_file("scene.sdl.render1.0"), "");
-  EXPECT_EQ(rndctl.stream_counter, 1);
+  EXPECT_EQ(std::tuple(std::string(first->stream_path.or_else("")), first->stream != nullptr,
+                       read_file("scene.sdl.render1.0"), rndctl.stream_counter),
+            std::tuple(path("scene.sdl.render1.0"), true, "", 1));
 
   write_file("victim", "keep");
   ASSERT_EQ(symlink(path("victim").c_str(), path("scene.sdl.render1.1").c_str()), 0);
   TASK* second = GetaPendingTask();
   ASSERT_NE(second, nullptr);
-  EXPECT_EQ(second->stream, nullptr);
-  EXPECT_EQ(read_file("victim"), "keep");
+  EXPECT_EQ(std::pair(second->stream == nullptr, read_file("victim")),
+            std::pair(true, std::string("keep")));
 
   rndctl.stream_counter = INT_MAX;
   TASK* third = GetaPendingTask();
-  EXPECT_EQ(rndctl.stream_counter, 0);
-  EXPECT_NE(third != nullptr ? third->stream : nullptr, nullptr);
+  EXPECT_EQ(std::pair(rndctl.stream_counter, third != nullptr && third->stream != nullptr),
+            std::pair(0, true));
 }
 
 }  // namespace

@@ -26,13 +26,10 @@ class SignalTest : public ControlDirTest {
     rndctl.tasks = nullptr;  // the entries below live on the stack
     ControlDirTest::TearDown();
   }
-  // A child that ends as `how` says; returns once it is a zombie.
+  // A child that exits with `how` (negative: killed by signal -how), once it is a zombie.
   pid_t ended_child(int how) {
     pid_t pid = fork();
-    if (pid == 0) {
-      if (how < 0) raise(-how);
-      _exit(how);
-    }
+    if (pid == 0) _exit(how < 0 ? raise(-how) : how);
     siginfo_t info;
     waitid(P_PID, pid, &info, WEXITED | WNOWAIT);
     return pid;
@@ -43,12 +40,10 @@ class SignalTest : public ControlDirTest {
 TEST_F(SignalTest, OneHandlerCallJudgesEveryChildThatEnded) {
   TASK entries[3];
   TaskRec recs[3];
-  int hows[3] = {0, 3, -SIGKILL};
+  const int hows[3] = {0, 3, -SIGKILL};
   for (int i = 0; i < 3; ++i) {
-    recs[i].id = i;
-    entries[i].rec = &recs[i];
+    std::tie(recs[i].id, entries[i].rec, entries[i].waitstatus) = std::tuple(i, &recs[i], 77);
     entries[i].pid = ended_child(hows[i]);
-    entries[i].waitstatus = 77;
     entries[i].next = i < 2 ? &entries[i + 1] : nullptr;
     entries[i].prev = i > 0 ? &entries[i - 1] : nullptr;
   }
@@ -60,22 +55,16 @@ TEST_F(SignalTest, OneHandlerCallJudgesEveryChildThatEnded) {
   EXPECT_EQ(rndctl.running, 4);  // the handler only records the exits
   EXPECT_EQ(Task_judge_exits(), 4);
 
-  EXPECT_EQ(rndctl.running, 0);
-  EXPECT_EQ(rndctl.signal_seen, 1);
-  EXPECT_EQ(last_signal, SIGCHLD);
-  int expected[3] = {0, 3, SIGKILL};
-  for (int i = 0; i < 3; ++i) {
-    EXPECT_EQ(entries[i].pid, 0) << i;
-    EXPECT_EQ(entries[i].waitstatus, expected[i]) << i;
-  }
+  EXPECT_EQ(std::tuple(rndctl.running, rndctl.signal_seen, last_signal), std::tuple(0, 1, SIGCHLD));
+  for (int i = 0; i < 3; ++i)  // what the judge keeps of an exit: its code or signal
+    EXPECT_EQ(std::pair(entries[i].pid, entries[i].waitstatus), std::pair(0, abs(hows[i]))) << i;
   EXPECT_EQ(waitpid(stranger, nullptr, WNOHANG), -1);  // no zombie left
 }
 
 TEST_F(SignalTest, AChildEndingTouchesTheHostUpdateTime) {
-  std::string pid_file = path("testhost.pid");
   write_file("testhost.pid", "abcd");
   struct timespec old_times[2] = {{1000, 0}, {1000, 0}};
-  ASSERT_EQ(utimensat(AT_FDCWD, pid_file.c_str(), old_times, 0), 0);
+  ASSERT_EQ(utimensat(AT_FDCWD, path("testhost.pid").c_str(), old_times, 0), 0);
   int64_t before = daemon_updatetime_get("testhost");
   ended_child(0);
   rndctl.running = 1;
@@ -85,39 +74,30 @@ TEST_F(SignalTest, AChildEndingTouchesTheHostUpdateTime) {
 }
 
 TEST_F(SignalTest, SignalsGoToLocalProcessesOnlyAndProbesTellLiveFromDead) {
-  pid_t sleeper = fork();
-  if (sleeper == 0) {
-    pause();
-    _exit(0);
-  }
+  const pid_t sleeping = sleeper();
   // A signal for another host is never sent, yet reported as sent.
-  EXPECT_EQ(RJ_signal("otherhost", sleeper, SIGKILL), 0);
-  EXPECT_EQ(waitpid(sleeper, nullptr, WNOHANG), 0);
+  EXPECT_EQ(RJ_signal("otherhost", sleeping, SIGKILL), 0);
+  EXPECT_EQ(waitpid(sleeping, nullptr, WNOHANG), 0);
 
-  EXPECT_EQ(RJ_signal(nullptr, 0, 0), 0);
-  EXPECT_EQ(RJ_signal("testhost", sleeper, 0), 0);
-  pid_t gone = ended_child(0);
-  waitpid(gone, nullptr, 0);
-  EXPECT_NE(RJ_signal("testhost", gone, 0), 0);
+  EXPECT_EQ(std::pair(RJ_signal(nullptr, 0, 0), RJ_signal("testhost", sleeping, 0)),
+            std::pair(0, 0));
+  EXPECT_NE(RJ_signal("testhost", exited_pid(), 0), 0);
 
-  EXPECT_EQ(RJ_signal("testhost", sleeper, SIGKILL), 0);
+  EXPECT_EQ(RJ_signal("testhost", sleeping, SIGKILL), 0);
   int status = 0;
-  ASSERT_EQ(waitpid(sleeper, &status, 0), sleeper);
+  ASSERT_EQ(waitpid(sleeping, &status, 0), sleeping);
   EXPECT_TRUE(WIFSIGNALED(status));
 }
 
 TEST_F(SignalTest, RemoteProbeRunsTheRemoteShellWithoutALocalShell) {
   // A stand-in remote shell: runs the command it was given locally.
-  std::string rsh = path("fake_rsh");
   write_file("fake_rsh", "#!/bin/sh\nshift; shift\nexec /bin/sh -c \"$1\"\n");
-  chmod(rsh.c_str(), 0755);
-  setenv("ZARNO_RSH", rsh.c_str(), 1);
+  chmod(path("fake_rsh").c_str(), 0755);
+  setenv("ZARNO_RSH", path("fake_rsh").c_str(), 1);
   EXPECT_EQ(RJ_signal("farhost", getpid(), 0), 0);
-  // A host name is one argument, never shell text.
-  std::string marker = path("owned");
-  std::string evil = "x;touch " + marker;
-  (void)RJ_signal(evil.c_str(), getpid(), 0);  // only what it must not do counts
-  EXPECT_NE(access(marker.c_str(), F_OK), 0);
+  // A host name is one argument, never shell text: only the call's side effect counts.
+  (void)RJ_signal(("x;touch " + path("owned")).c_str(), getpid(), 0);
+  EXPECT_NE(access(path("owned").c_str(), F_OK), 0);
   unsetenv("ZARNO_RSH");
 }
 
@@ -128,7 +108,7 @@ TEST_F(SignalTest, TimedPauseEndsAtItsLimitOrOnASignalThatCameWhileBlocked) {
   EXPECT_EQ(RJ_pause_for(20), 0);
   raise(SIGALRM);  // held: waits for the pause
   EXPECT_EQ(last_signal, 0);
-  EXPECT_EQ(RJ_pause_for(10000), 1);
+  EXPECT_EQ(RJ_pause_for(10000), 1);  // ends on the signal, long before its limit
   EXPECT_EQ(last_signal, SIGALRM);
   signal(SIGALRM, SIG_DFL);
 }

@@ -2,8 +2,6 @@
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <cstdio>
 #include <filesystem>
@@ -24,8 +22,8 @@ class StatusTest : public TaskFixture {
     // The tests reap their own render stand-ins, not an earlier test's handler.
     signal(SIGCHLD, SIG_DFL);
   }
-  /// An entry whose stream reads the file "stream", with `text` in it, and
-  /// whose output is the file "out", with `out` in it.
+  /// An entry whose stream reads "stream", holding `text`, and whose output is "out", holding
+  /// `out`.
   TASK* entry_with_stream(float start, float end, const char* text = "", const char* out = "") {
     TASK* entry = add_entry(job_, dev_, start, end, TASK_RUNNING);
     write_file("stream", text);
@@ -35,24 +33,6 @@ class StatusTest : public TaskFixture {
     entry->out_path.set(path("out").c_str());
     return entry;
   }
-  void append_stream(const std::string& text) {
-    std::ofstream(path("stream"), std::ios::app) << text;
-  }
-  /// The entry's render program: a child that waits to be killed.
-  static void give_sleeper(TASK* entry) {
-    entry->pid = fork();
-    if (entry->pid == 0)
-      for (;;) pause();
-  }
-  static void expect_killed(int pid) {
-    int status = wait_for(pid);
-    EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL) << status;
-  }
-  static std::vector<int> statuses(std::initializer_list<TASK*> entries) {
-    std::vector<int> out;
-    for (TASK* e : entries) out.push_back(e->rec->status);
-    return out;
-  }
   static Dev* other_host() {
     Dev* other = Dev_new(nullptr, nullptr, "render2", 2);
     other->host_name.set("otherhost");
@@ -60,10 +40,9 @@ class StatusTest : public TaskFixture {
   }
 };
 
-// The last progress line sets the frame and the percentage: the stream, the
-// step, the job's extension (0: none; else from 100 by 10), the task's
-// frames, whether it changed, the frame and progress then, and the output.
-// Frame 3 of 1..10 in progress: current is that frame, not the next.
+// The last progress line sets the frame and the percentage: the stream, the step, the job's
+// extension (0: none; else from 100 by 10), the task's frames, whether it changed, the frame and
+// progress then, and the output.  Frame 3 of 1..10 in progress: current is that frame.
 TEST_F(StatusTest, LastProgressLineSetsFrameAndPercentage) {
   using Row = std::tuple<const char*, float, int, float, float, int, float, float, const char*>;
   // clang-format off
@@ -84,12 +63,12 @@ TEST_F(StatusTest, LastProgressLineSetsFrameAndPercentage) {
     job_->extension = extension != 0 ? 291 : 0;
     std::tie(job_->ext_start, job_->ext_by) = std::tuple(100, 10);
     TASK* entry = entry_with_stream(start, end, stream);
-    EXPECT_EQ(set_image_percentage_done(entry), changed) << stream;
-    EXPECT_FLOAT_EQ(entry->rec->current, current) << stream;
-    EXPECT_NEAR(entry->progress, progress, 1e-3) << stream;
-    EXPECT_STREQ(entry->output.c_str(), output) << stream;
-    // Nothing new on the stream: nothing changes.
-    EXPECT_EQ(set_image_percentage_done(entry), 0) << stream;
+    SCOPED_TRACE(stream);
+    const int got = set_image_percentage_done(entry);
+    EXPECT_EQ(std::tuple(got, entry->rec->current, std::string(entry->output.or_else("-"))),
+              std::tuple(changed, current, std::string(output ? output : "-")));
+    EXPECT_NEAR(entry->progress, progress, 1e-3);
+    EXPECT_EQ(set_image_percentage_done(entry), 0);  // nothing new on the stream
   }
 }
 
@@ -97,7 +76,7 @@ TEST_F(StatusTest, HalfWrittenProgressLineWaitsForItsEnd) {
   TASK* entry = entry_with_stream(1, 10, "pix.0002 r 10 of 100\npix.0005 r 1");
   EXPECT_EQ(set_image_percentage_done(entry), 1);
   EXPECT_FLOAT_EQ(entry->rec->current, 2);
-  append_stream("0 of 100\n");
+  std::ofstream(path("stream"), std::ios::app) << "0 of 100\n";
   EXPECT_EQ(set_image_percentage_done(entry), 1);
   EXPECT_STREQ(entry->output.c_str(), "pix.0005");
 }
@@ -123,11 +102,11 @@ TEST_F(StatusTest, OnlyThisHostsOwnRendersChangeState) {
   inherited->taken = 0;
   mine->pid = 4242;  // any pid of 2 or more counts as a process
   write_task_file();
-  EXPECT_EQ(ISA_task_running(theirs), 1);
-  EXPECT_EQ(ISA_task_running(waiting), 0);
+  EXPECT_EQ(std::pair(ISA_task_running(theirs), ISA_task_running(waiting)), std::pair(1, 0));
   EXPECT_EQ(UpdateRunningTasks(), 1);
-  EXPECT_EQ(statuses({mine, theirs, waiting, inherited}),
-            (std::vector<int>{TASK_RUNNING, TASK_STARTED, TASK_STARTED, TASK_RUNNING}));
+  EXPECT_EQ(std::tuple(mine->rec->status, theirs->rec->status, waiting->rec->status,
+                       inherited->rec->status),
+            std::tuple(TASK_RUNNING, TASK_STARTED, TASK_STARTED, TASK_RUNNING));
   mine->pid = 0;  // no process to be killed by the fixture's cleanup
 }
 
@@ -138,16 +117,15 @@ TEST_F(StatusTest, AbortedJobStopsThisHostsTasksAndOthersPendingOnes) {
   running->output.set("pix.0001");
   TASK* pending = add_entry(job_, other, 4, 6, TASK_PENDING, 1);
   TASK* started = add_entry(job_, other, 7, 9, TASK_STARTED, 2);
-  give_sleeper(running);
-  int pid = running->pid;
+  const int pid = sleeper();
+  running->pid = pid;
   write_task_file();
   EXPECT_EQ(UpdateRunningTasks(), 1);  // the other host's STARTED task
-  expect_killed(pid);
-  EXPECT_EQ(statuses({running, pending, started}),
-            (std::vector<int>{TASK_ABORTED, TASK_ABORTED, TASK_STARTED}));
+  EXPECT_EQ(wait_for(pid), SIGKILL);   // the wait status of a kill
+  EXPECT_EQ(std::tuple(running->rec->status, pending->rec->status, started->rec->status),
+            std::tuple(TASK_ABORTED, TASK_ABORTED, TASK_STARTED));
   EXPECT_TRUE(running->pid == 0 && running->stream == nullptr && running->stream_path.none() &&
-              running->output.none());
-  EXPECT_FALSE(exists(path("stream")));
+              running->output.none() && !exists(path("stream")));
 }
 
 struct EndCase {
@@ -162,17 +140,14 @@ TEST_P(EndOfProcess, ExitValueDecidesAndOutputGoesUnlessKept) {
   const EndCase& c = GetParam();
   job_->save_out = c.save_out;
   TASK* entry = entry_with_stream(1, 10, "", "rendering\n");
-  entry->rec->current = 4;
-  entry->waitstatus = c.waitstatus;  // reaped: pid 0
+  std::tie(entry->rec->current, entry->waitstatus) = std::pair(4.0f, c.waitstatus);  // reaped
   write_task_file();
   TaskRec* rec = entry->rec;
-
   EXPECT_EQ(UpdateRunningTasks(), 0);
-  EXPECT_EQ(rec->status, c.status);
-  EXPECT_FLOAT_EQ(rec->current, c.status == TASK_FINISHED ? 10.0f : 4.0f);
-  EXPECT_EQ(exists(path("out")), c.out_kept);
-  EXPECT_TRUE(entry->out_path.none());
-  EXPECT_FALSE(exists(path("stream")));
+  EXPECT_EQ(
+      std::tuple(rec->status, rec->current, exists(path("out")), entry->out_path.none(),
+                 exists(path("stream"))),
+      std::tuple(c.status, c.status == TASK_FINISHED ? 10.0f : 4.0f, c.out_kept, true, false));
 }
 
 INSTANTIATE_TEST_SUITE_P(
@@ -184,17 +159,15 @@ INSTANTIATE_TEST_SUITE_P(
 
 TEST_F(StatusTest, RenderOfADeletedJobIsKilledAndEndedOnceReaped) {
   TASK* entry = entry_with_stream(1, 10, "", "rendering\n");
-  give_sleeper(entry);
-  int pid = entry->pid;
+  const int pid = sleeper();
+  entry->pid = pid;
   entry->job = nullptr;  // the reload found the job gone
   UpdateRunningTasks();
-  expect_killed(pid);
-  ASSERT_EQ(rndctl.tasks, entry);  // still there until reaped
-  entry->pid = 0;                  // as the reaping side leaves it
+  EXPECT_EQ(wait_for(pid), SIGKILL);  // the wait status of a kill
+  ASSERT_EQ(rndctl.tasks, entry);     // still there until reaped
+  entry->pid = 0;                     // as the reaping side leaves it
   UpdateRunningTasks();
-  EXPECT_EQ(rndctl.tasks, nullptr);
-  EXPECT_FALSE(exists(path("stream")));
-  EXPECT_FALSE(exists(path("out")));
+  EXPECT_TRUE(rndctl.tasks == nullptr && !exists(path("stream")) && !exists(path("out")));
   EXPECT_EQ(read_file("TSKSTAT/testhost"), "");
 }
 
@@ -205,9 +178,8 @@ TEST_F(StatusTest, FailedTaskOfThisHostsJobEndsInTheJobFileWithItsError) {
   RndDevList_add(job_, host_dev);
   RJC_out();
   TASK* entry = entry_with_stream(1, 10, "", "loading scene\nshader did not build\nexiting\n");
-  entry->rec->dev = host_dev;
-  entry->rec->retries = 10;  // no more retries: it stays failed
-  entry->waitstatus = 1;
+  // No more retries: it stays failed.
+  std::tie(entry->rec->dev, entry->rec->retries, entry->waitstatus) = std::tuple(host_dev, 10, 1);
   write_task_file();
 
   EXPECT_EQ(UpdateRunningTasks(), 0);
@@ -236,9 +208,8 @@ TEST_F(StatusTest, ErrorReasonPilesUpInTheComment) {
   }
 }
 
-// One task of frames i*2+1 .. i*2+2 for each status.  Frames 1-2 finished
-// and frame 3 under way count 3 of 4 frames; half of a task spread over the
-// job's 4 frames adds 12.5.
+// One task of frames i*2+1 .. i*2+2 for each status.  Frames 1-2 finished and frame 3 under way
+// count 3 of 4 frames; half of a task spread over the job's 4 frames adds 12.5.
 TEST_F(StatusTest, TasksDecideTheJobsStatusText) {
   // clang-format off
   for (auto [statuses, job_status, ctrl, expected] : {
@@ -253,9 +224,8 @@ TEST_F(StatusTest, TasksDecideTheJobsStatusText) {
     // clang-format on
     while (rndctl.tasks != nullptr) TASK_free(rndctl.tasks);
     job_->status.set(job_status);
-    job_->ctrl = ctrl;
-    job_->frames[1] = static_cast<float>(statuses.size() * 2);
-    job_->totalframes = static_cast<int>(statuses.size() * 2);
+    const int frames = static_cast<int>(statuses.size() * 2);
+    std::tie(job_->ctrl, job_->frames[1], job_->totalframes) = std::tuple(ctrl, frames, frames);
     for (size_t i = 0; i < statuses.size(); ++i) {
       TASK* entry = add_entry(job_, dev_, static_cast<float>(i * 2 + 1),
                               static_cast<float>(i * 2 + 2), statuses[i], static_cast<int>(i));
@@ -279,10 +249,8 @@ TEST_F(StatusTest, FinishedJobWritesItsLogAndClearsItsTasks) {
   add_entry(job_, nullptr, 6, 10, TASK_FINISHED, 1)->rec->retries = 2;
 
   UpdateJobState(job_);
-  EXPECT_STREQ(job_->status.c_str(), "finished");
-  EXPECT_EQ(job_->doneframes, 10);
-  EXPECT_EQ(rndctl.tasks, nullptr);
-  EXPECT_EQ(job_->deleted, 1);
+  EXPECT_EQ(std::tuple(job_->status.or_else(""), job_->doneframes, rndctl.tasks, job_->deleted),
+            std::tuple(std::string("finished"), 10, nullptr, 1));
   EXPECT_NE(daemon_updatetime_get("testhost"), before);
   const char* first_task = "\t0\t 1.000000 - 5.000000\t1 - 5\t render1\t FINISHED  0\n";
   EXPECT_EQ(read_file("JOBLOG/scene.sdl"),
@@ -293,9 +261,8 @@ TEST_F(StatusTest, FinishedJobWritesItsLogAndClearsItsTasks) {
   // Reopened, the log is read from its first task line.
   FILE* log = Logfile_open(job_);
   ASSERT_NE(log, nullptr);
-  char line[120];
-  ASSERT_NE(fgets(line, sizeof line, log), nullptr);
-  EXPECT_STREQ(line, first_task);
+  char line[120] = "";
+  EXPECT_STREQ(fgets(line, sizeof line, log), first_task);
   fclose(log);
 }
 

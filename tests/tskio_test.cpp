@@ -4,38 +4,17 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <cmath>
 #include <csignal>
-#include <cstdio>
-#include <cstdlib>
-#include <cstring>
 #include <string>
 #include <vector>
 
 #include "tests/support/task_text.h"
 #include "tests/support/test_support.h"
+#include "tests/support/text_records.h"
 
 namespace {
 
-std::string write_groups(TaskGroup* groups) {
-  char* buf = nullptr;
-  size_t len = 0;
-  FILE* out = open_memstream(&buf, &len);
-  EXPECT_EQ(Task_write(out, groups), 0);
-  fclose(out);
-  std::string s(buf, len);
-  free(buf);
-  return s;
-}
-
-TaskGroup* read_groups(const std::string& text) {
-  FILE* in = tmpfile();
-  fwrite(text.data(), 1, text.size(), in);
-  rewind(in);
-  TaskGroup* groups = Task_read(in);
-  fclose(in);
-  return groups;
-}
+using text_records::written_tasks;
 
 class TaskFileTest : public ControlDirTest {
  protected:
@@ -60,24 +39,17 @@ class TaskFileTest : public ControlDirTest {
 };
 
 TEST_F(TaskFileTest, WritesGroupsAndRecordsInTheFileFormat) {
-  TaskGroup* groups = nullptr;
+  // A group without records is not written at all.
+  TaskGroup* groups = TaskGroup_alloc(beta_, 7);
   insert_task(&groups, alpha_, 1, 3, TASK_STARTED);
   TaskRec* r = insert_task(&groups, alpha_, 4, 10, TASK_PENDING);
-  r->dev = there_;
-  r->retries = 3;
-  r->current = 6.5f;
-  // A group without records is not written at all.
-  TaskGroup* empty = TaskGroup_alloc(beta_, 7);
-  empty->next = groups;
-  groups = empty;
-  EXPECT_EQ(write_groups(groups),
+  std::tie(r->dev, r->retries, r->current) = std::tuple(there_, 3, 6.5f);
+  EXPECT_EQ(written_tasks(groups),
             "\nalpha.sdl\t 1\t 2\t 2\n"
             "\t0\t 1.000000\t 3.000000\t 1.000000  0\t 0\tSTARTED\n"
             "\t1\t 4.000000\t 10.000000\t 6.500000  2\t 3\tPENDING\n");
   TaskGroup_free_all(&groups);
 }
-
-// --- Reading damaged files: what the next rewrite keeps -----------------------
 
 struct ReadCase {
   const char* label;
@@ -87,54 +59,35 @@ struct ReadCase {
 class ReadDamaged : public TaskFileTest, public testing::WithParamInterface<ReadCase> {};
 
 TEST_P(ReadDamaged, KeepsWhatItUnderstood) {
-  TaskGroup* groups = read_groups(GetParam().input);
-  EXPECT_EQ(write_groups(groups), GetParam().output);
+  TaskGroup* groups = text_records::read_tasks(GetParam().input);
+  EXPECT_EQ(written_tasks(groups), GetParam().output);
   TaskGroup_free_all(&groups);
 }
 
-const std::string kAlpha = group_line("alpha.sdl", 1, 2, 2) +
-                           rec_line(0, 1, 3, 2, 1, 0, "STARTED") +
-                           rec_line(1, 4, 10, 4, 0, 0, "PENDING");
+const std::string kAlpha =
+    group_line("alpha.sdl", 1, 2, 2) + rec_lines("0 1 3 2 1 0 STARTED, 1 4 10 4 0 0 PENDING");
 const std::string kBetaRec = rec_line(0, 1, 5, 1, 2, 3, "FAILED");
 const std::string kBeta = group_line("beta.sdl", 2, 1, 1) + kBetaRec;
 // The same group claiming two records, and as the rewrite then writes it.
 const std::string kBetaOf2 = group_line("beta.sdl", 2, 2, 2) + kBetaRec;
 const std::string kBetaAs1 = group_line("beta.sdl", 2, 1, 2) + kBetaRec;
 
-INSTANTIATE_TEST_SUITE_P(
-    Files, ReadDamaged,
-    testing::Values(
-        // Each read puts the groups in reverse order.
-        ReadCase{"well_formed", kAlpha + kBeta, kBeta + kAlpha}, ReadCase{"empty", "", ""},
-        ReadCase{"layout_does_not_matter",
-                 "alpha.sdl 1 2 2 0 1 3 2 1 0 STARTED 1 4.0 10 4 0 0 PENDING", kAlpha},
-        ReadCase{"unknown_status_and_resource",
-                 group_line("alpha.sdl", 1, 1, 1) + rec_line(0, 1, 3, 1, 77, 0, "BOGUS"),
-                 group_line("alpha.sdl", 1, 1, 1) + rec_line(0, 1, 3, 1, 0, 0, "PENDING")},
-        ReadCase{"job_gone_others_kept",
-                 kAlpha + group_line("gone.sdl", 99, 2, 2) + rec_line(0, 1, 2, 1, 1, 0, "RUNNING") +
-                     rec_line(1, 3, 4, 3, 0, 0, "PENDING") + kBeta,
-                 kBeta + kAlpha},
-        ReadCase{"fewer_records_than_claimed",
-                 group_line("alpha.sdl", 1, 5, 2) + rec_line(0, 1, 3, 2, 1, 0, "STARTED") +
-                     rec_line(1, 4, 10, 4, 0, 0, "PENDING") + kBeta,
-                 kBeta + kAlpha},
-        ReadCase{"cut_in_a_record", kAlpha + kBetaOf2 + "\t1\t 6.000000\t 9.0", kBetaAs1 + kAlpha},
-        ReadCase{"not_a_number",
-                 kAlpha + kBetaOf2 + "\t1\t six\t 9.0\t 6  0\t 0\tPENDING\n" + kAlpha,
-                 kBetaAs1 + kAlpha},
-        ReadCase{"not_finite",
-                 kAlpha + group_line("beta.sdl", 2, 1, 1) + "\t0\t nan\t 9.0\t 6  0\t 0\tPENDING\n",
-                 kAlpha},
-        ReadCase{"garbled_group_line", "alpha.sdl\t x\t 1\t 1\n" + kBeta, ""},
-        ReadCase{"over_long_names",
-                 group_line(std::string(5000, 'n'), 1, 1, 1) +
-                     rec_line(0, 1, 3, 1, 1, 0, std::string(3000, 'S')) + kBeta,
-                 kBeta + group_line("alpha.sdl", 1, 1, 1) + rec_line(0, 1, 3, 1, 1, 0, "PENDING")},
-        ReadCase{"group_without_records", group_line("alpha.sdl", 1, 0, 3) + kBeta, kBeta}),
+// Each read puts the groups in reverse order.
+// clang-format off
+INSTANTIATE_TEST_SUITE_P(Files, ReadDamaged, testing::Values(
+    ReadCase{"well_formed", kAlpha + kBeta, kBeta + kAlpha}, ReadCase{"empty", "", ""},
+    ReadCase{"layout_does_not_matter", "alpha.sdl 1 2 2 0 1 3 2 1 0 STARTED 1 4.0 10 4 0 0 PENDING", kAlpha},
+    ReadCase{"unknown_status_and_resource", group_line("alpha.sdl", 1, 1, 1) + rec_line(0, 1, 3, 1, 77, 0, "BOGUS"), group_line("alpha.sdl", 1, 1, 1) + rec_line(0, 1, 3, 1, 0, 0, "PENDING")},
+    ReadCase{"job_gone_others_kept", kAlpha + group_line("gone.sdl", 99, 2, 2) + rec_lines("0 1 2 1 1 0 RUNNING, 1 3 4 3 0 0 PENDING") + kBeta, kBeta + kAlpha},
+    ReadCase{"fewer_records_than_claimed", group_line("alpha.sdl", 1, 5, 2) + rec_lines("0 1 3 2 1 0 STARTED, 1 4 10 4 0 0 PENDING") + kBeta, kBeta + kAlpha},
+    ReadCase{"cut_in_a_record", kAlpha + kBetaOf2 + "\t1\t 6.000000\t 9.0", kBetaAs1 + kAlpha},
+    ReadCase{"not_a_number", kAlpha + kBetaOf2 + "\t1\t six\t 9.0\t 6  0\t 0\tPENDING\n" + kAlpha, kBetaAs1 + kAlpha},
+    ReadCase{"not_finite", kAlpha + group_line("beta.sdl", 2, 1, 1) + "\t0\t nan\t 9.0\t 6  0\t 0\tPENDING\n", kAlpha},
+    ReadCase{"garbled_group_line", "alpha.sdl\t x\t 1\t 1\n" + kBeta, ""},
+    ReadCase{"over_long_names", group_line(std::string(5000, 'n'), 1, 1, 1) + rec_line(0, 1, 3, 1, 1, 0, std::string(3000, 'S')) + kBeta, kBeta + group_line("alpha.sdl", 1, 1, 1) + rec_line(0, 1, 3, 1, 1, 0, "PENDING")},
+    ReadCase{"group_without_records", group_line("alpha.sdl", 1, 0, 3) + kBeta, kBeta}),
     [](const auto& info) { return std::string(info.param.label); });
-
-// --- Locked cycles on the shared file ---------------------------------------
+// clang-format on
 
 TEST_F(TaskFileTest, EachRewriteReversesTheGroupsSoTwoGiveThemBack) {
   write_file("Render_Tasks", kAlpha + kBeta);
@@ -142,17 +95,15 @@ TEST_F(TaskFileTest, EachRewriteReversesTheGroupsSoTwoGiveThemBack) {
   EXPECT_EQ(read_file("Render_Tasks"), kBeta + kAlpha);
   Task_file_update(nullptr);
   EXPECT_EQ(read_file("Render_Tasks"), kAlpha + kBeta);
-  EXPECT_EQ(Task_file_search("otherhost"), 1);
-  EXPECT_EQ(Task_file_search("nohost"), 0);
+  EXPECT_EQ(std::pair(Task_file_search("otherhost"), Task_file_search("nohost")), std::pair(1, 0));
 }
 
 TEST_F(TaskFileTest, FileUpdateDropsTheGroupOfAJobThatIsOver) {
   for (const char* state : {"aborted", "failed", "finished", "restarted"}) {
-    SCOPED_TRACE(state);
     write_file("Render_Tasks", kAlpha + kBeta);
     alpha_->status.set(state);
     Task_file_update(alpha_);
-    EXPECT_EQ(read_file("Render_Tasks"), kBeta);
+    EXPECT_EQ(read_file("Render_Tasks"), kBeta) << state;
   }
 }
 
@@ -161,14 +112,13 @@ TEST_F(TaskFileTest, FileUpdateDropsTheGroupOfAJobThatIsOver) {
 // becomes of the entry and its render.
 struct OwnCase {
   const char* label;
-  float file_start;  // 4: the same task; anything else: a group built again
-  int file_dev;      // 1: this host, 2: another host
-  const char* file_status;
-  bool taken;           // this daemon took the piece (else the entry was made from the file)
-  const char* written;  // status in the file afterwards
+  float file_start;                   // 4: the same task; anything else: a group built again
+  int file_dev;                       // 1: this host, 2: another host
+  const char *file_status, *written;  // the record's status before and after
   float written_current;
   int entry_status;  // the entry's status afterwards
-  bool killed;       // its render was killed
+  // This daemon took the piece (else the entry was made from the file); its render was killed.
+  bool taken, killed;
 };
 
 class FileUpdateOwnership : public TaskFileTest, public testing::WithParamInterface<OwnCase> {};
@@ -180,68 +130,51 @@ TEST_P(FileUpdateOwnership, WritesOnlyWhatThisHostStillOwns) {
                                  rec_line(0, c.file_start, 6, 4, c.file_dev, 0, c.file_status));
   alpha_->status.set("started");
   TASK* e = Task_add(alpha_, TaskRec_alloc(nullptr, 4, 6, 5, here_, TASK_RUNNING, nullptr, 0));
-  e->taken = c.taken ? 1 : 0;
-  int child = fork();
-  if (child == 0) {
-    setpgid(0, 0);
-    pause();
-    _exit(0);
-  }
+  e->taken = c.taken;
+  const int child = sleeper();
   e->pid = child;
   Task_file_update(alpha_);
+  // Another job's record of the same id is not touched.
   EXPECT_EQ(read_file("Render_Tasks"),
             group_line("alpha.sdl", 1, 1, 1) +
-                rec_line(0, c.file_start, 6, c.written_current, c.file_dev, 0, c.written) +
-                other);  // another job's record of the same id is not touched
+                rec_line(0, c.file_start, 6, c.written_current, c.file_dev, 0, c.written) + other);
   EXPECT_EQ(e->rec->status, c.entry_status);
   if (!c.killed) kill(child, SIGKILL);
   int status = 0;
   ASSERT_EQ(waitpid(child, &status, 0), child);
   EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL);
-  if (c.killed) {
-    EXPECT_EQ(e->pid, 0);
-  }
+  EXPECT_TRUE(!c.killed || e->pid == 0) << e->pid;
   e->pid = 0;
   // Entries of a group built again are dropped at the next safe point.
   EXPECT_EQ(Task_retire_marked() != 0, c.file_start != 4.0f);
 }
 
-INSTANTIATE_TEST_SUITE_P(Owners, FileUpdateOwnership,
-                         testing::Values(OwnCase{"ours_follows_the_entry", 4, 1, "STARTED", true,
-                                                 "RUNNING", 5, TASK_RUNNING, false},
-                                         OwnCase{"put_back_is_left_and_lost", 4, 1, "PENDING", true,
-                                                 "PENDING", 4, TASK_PENDING, true},
-                                         OwnCase{"taken_by_another_host", 4, 2, "RUNNING", true,
-                                                 "RUNNING", 4, TASK_RUNNING, true},
-                                         OwnCase{"left_by_an_earlier_daemon", 4, 1, "RUNNING",
-                                                 false, "RUNNING", 4, TASK_RUNNING, false},
-                                         OwnCase{"rebuilt_group_same_id", 1, 1, "STARTED", true,
-                                                 "STARTED", 4, TASK_RUNNING, false}),
-                         [](const auto& info) { return std::string(info.param.label); });
+// clang-format off
+INSTANTIATE_TEST_SUITE_P(Owners, FileUpdateOwnership, testing::Values(
+    OwnCase{"ours_follows_the_entry", 4, 1, "STARTED", "RUNNING", 5, TASK_RUNNING, true, false},
+    OwnCase{"put_back_is_left_and_lost", 4, 1, "PENDING", "PENDING", 4, TASK_PENDING, true, true},
+    OwnCase{"taken_by_another_host", 4, 2, "RUNNING", "RUNNING", 4, TASK_RUNNING, true, true},
+    OwnCase{"left_by_an_earlier_daemon", 4, 1, "RUNNING", "RUNNING", 4, TASK_RUNNING, false, false},
+    OwnCase{"rebuilt_group_same_id", 1, 1, "STARTED", "STARTED", 4, TASK_RUNNING, true, false}),
+    [](const auto& info) { return std::string(info.param.label); });
+// clang-format on
 
 // 0: no pid file, 1: the pid of this live process, 2: the pid of one that ended.
 class DaemonAlive : public TaskFileTest, public testing::WithParamInterface<int> {};
 
 TEST_P(DaemonAlive, TasksOfADeadDaemonGoBackToPending) {
-  int pid = getpid();
-  if (GetParam() == 2) {
-    if ((pid = fork()) == 0) _exit(0);
-    ASSERT_EQ(waitpid(pid, nullptr, 0), pid);
-  }
-  if (GetParam() != 0) {
+  const int pid = GetParam() == 2 ? exited_pid() : getpid();
+  if (GetParam() != 0)
     write_file("testhost.pid", std::string(reinterpret_cast<const char*>(&pid), sizeof pid));
-  }
   write_file("Render_Tasks",
-             kBeta + group_line("alpha.sdl", 1, 3, 3) + rec_line(0, 1, 3, 2, 1, 4, "RUNNING") +
-                 rec_line(1, 4, 6, 4, 1, 0, "STARTED") + rec_line(2, 7, 10, 7, 1, 2, "FINISHED"));
+             kBeta + group_line("alpha.sdl", 1, 3, 3) +
+                 rec_lines("0 1 3 2 1 4 RUNNING, 1 4 6 4 1 0 STARTED, 2 7 10 7 1 2 FINISHED"));
   const bool dead = GetParam() != 1;
   EXPECT_EQ(Task_file_check(alpha_), dead ? 1 : 0);
   // Retries are cleared in the checked job's group only.
-  EXPECT_EQ(read_file("Render_Tasks"),
-            group_line("alpha.sdl", 1, 3, 3) +
-                rec_line(0, 1, 3, 2, 1, 0, dead ? "PENDING" : "RUNNING") +
-                rec_line(1, 4, 6, 4, 1, 0, dead ? "PENDING" : "STARTED") +
-                rec_line(2, 7, 10, 7, 1, 0, "FINISHED") + kBeta);
+  const char* rows = dead ? "0 1 3 2 1 0 PENDING, 1 4 6 4 1 0 PENDING, 2 7 10 7 1 0 FINISHED"
+                          : "0 1 3 2 1 0 RUNNING, 1 4 6 4 1 0 STARTED, 2 7 10 7 1 0 FINISHED";
+  EXPECT_EQ(read_file("Render_Tasks"), group_line("alpha.sdl", 1, 3, 3) + rec_lines(rows) + kBeta);
 }
 
 INSTANTIATE_TEST_SUITE_P(PidFiles, DaemonAlive, testing::Values(0, 1, 2));
@@ -251,40 +184,28 @@ INSTANTIATE_TEST_SUITE_P(PidFiles, DaemonAlive, testing::Values(0, 1, 2));
 // stays what it was: values, group link, owner, and the text around it.
 TEST_F(TaskFileTest, RecordsOfAReadOutliveTheReadAsTheirOwnersNeed) {
   // Three blocks' worth of records in one group, then beta's.
-  std::string text = "\nalpha.sdl\t 1\t 2500\t 2500\n";
-  char line[128];
-  for (int i = 0; i < 2500; ++i) {
-    snprintf(line, sizeof line, "\t%d\t %d.000000\t %d.000000\t %d.000000  1\t 0\tPENDING\n", i, i,
-             i, i);
-    text += line;
-  }
-  text += kBeta;
-  TaskGroup* groups = read_groups(text);
+  std::string alpha_text = "\nalpha.sdl\t 1\t 2500\t 2500\n";
+  for (int i = 0; i < 2500; ++i) alpha_text += rec_line(i, i, i, i, 1, 0, "PENDING");
+  const std::string text = alpha_text + kBeta, reversed = kBeta + alpha_text;
+  TaskGroup* groups = text_records::read_tasks(text);
   TaskGroup* alpha = TaskGroup_by_job(groups, alpha_);
   ASSERT_NE(alpha, nullptr);
-  EXPECT_EQ(write_groups(alpha), text.substr(0, text.size() - kBeta.size()));
+  EXPECT_EQ(written_tasks(alpha), alpha_text);
 
   // Unpooled at the head, in the middle and at the end of the group's list.
   std::vector<TASK*> kept;
   for (int at : {0, 1500, 2499}) {
     TaskRec** link = &alpha->tasks;
     for (int i = 0; i < at; ++i) link = &(*link)->next;
-    TaskRec* old = *link;
-    TaskRec* next = old->next;
-    TaskRec* own = TaskRec_unpool(link);
-    ASSERT_NE(own, old);
-    EXPECT_EQ(*link, own);
-    EXPECT_EQ(own->next, next);
-    EXPECT_EQ(own->group, alpha);
-    EXPECT_EQ(own->id, at);
-    EXPECT_EQ(own->dev, here_);
+    TaskRec *old = *link, *next = old->next, *own = TaskRec_unpool(link);
+    EXPECT_EQ(std::tuple(own == old, *link, own->next, own->group, own->id, own->dev),
+              std::tuple(false, own, next, alpha, at, here_));
     EXPECT_EQ(TaskRec_unpool(link), own);  // already its own
     kept.push_back(Task_add(alpha_, own));
   }
   // Kept without unpooling: its block stays for it.
   TASK* direct = Task_add(beta_, TaskGroup_by_job(groups, beta_)->tasks);
-  EXPECT_EQ(write_groups(groups),
-            text.substr(text.size() - kBeta.size()) + text.substr(0, text.size() - kBeta.size()));
+  EXPECT_EQ(written_tasks(groups), reversed);
   // Some freed one by one, out of order, the rest with their groups.
   for (int i = 2000; i > 1000; i -= 7) {
     TaskRec* rec = alpha->tasks;
@@ -292,15 +213,12 @@ TEST_F(TaskFileTest, RecordsOfAReadOutliveTheReadAsTheirOwnersNeed) {
     if (rec->task == nullptr) TaskRec_free(rec);
   }
   TaskGroup_free_all(&groups);
-  ASSERT_EQ(kept.size(), 3u);
-  EXPECT_EQ(kept[1]->rec->id, 1500);
-  EXPECT_EQ(kept[2]->rec->start, 2499.0f);
-  EXPECT_EQ(direct->rec->status, TASK_FAILED);
-  EXPECT_EQ(direct->rec->retries, 3);
+  EXPECT_EQ(
+      std::tuple(kept[1]->rec->id, kept[2]->rec->start, direct->rec->status, direct->rec->retries),
+      std::tuple(1500, 2499.0f, TASK_FAILED, 3));
   // A second read reuses the room and is read as the first.
-  groups = read_groups(text);
-  EXPECT_EQ(write_groups(groups),
-            text.substr(text.size() - kBeta.size()) + text.substr(0, text.size() - kBeta.size()));
+  groups = text_records::read_tasks(text);
+  EXPECT_EQ(written_tasks(groups), reversed);
   TaskGroup_free_all(&groups);
   while (rndctl.tasks != nullptr) TASK_free(rndctl.tasks);
 }
@@ -309,8 +227,7 @@ TEST_F(TaskFileTest, RecordsOfAReadOutliveTheReadAsTheirOwnersNeed) {
 // marked 1; one marked 2 only loses the mark, owned or not; the rest go.
 struct ReleaseCase {
   int keep;
-  bool owned;
-  bool survives;
+  bool owned, survives;
 };
 
 class ReleaseMarks : public TaskFileTest, public testing::WithParamInterface<ReleaseCase> {};
@@ -319,21 +236,14 @@ TEST_P(ReleaseMarks, GroupsReleaseWhatNobodyKeeps) {
   const ReleaseCase c = GetParam();
   TaskGroup* groups = TaskGroup_alloc(alpha_, 2);
   TaskRec* rec = TaskRec_alloc(groups, 1, 10, 1, here_, TASK_PENDING, nullptr, 0);
-  TaskRec* other = TaskRec_alloc(groups, 11, 20, 11, here_, TASK_PENDING, nullptr, 1);
-  ASSERT_TRUE(rec && other);
+  ASSERT_TRUE(rec && TaskRec_alloc(groups, 11, 20, 11, here_, TASK_PENDING, nullptr, 1));
   rec->keep = c.keep;
   TASK* owner = c.owned ? Task_add(alpha_, rec) : nullptr;
   TaskGroup_free_all(&groups);
   EXPECT_EQ(groups, nullptr);
-  if (owner != nullptr) {
-    EXPECT_EQ(owner->rec, c.survives ? rec : nullptr);
-  }
-  if (c.survives) {
-    EXPECT_EQ(rec->group, nullptr);
-    EXPECT_EQ(rec->next, nullptr);
-    EXPECT_EQ(rec->keep, 0);
-    if (owner == nullptr) TaskRec_free(rec);
-  }
+  EXPECT_TRUE(owner == nullptr || owner->rec == (c.survives ? rec : nullptr));
+  EXPECT_TRUE(!c.survives || (rec->group == nullptr && rec->next == nullptr && rec->keep == 0));
+  if (c.survives && owner == nullptr) TaskRec_free(rec);
   while (rndctl.tasks != nullptr) TASK_free(rndctl.tasks);
 }
 
@@ -342,8 +252,6 @@ INSTANTIATE_TEST_SUITE_P(Marks, ReleaseMarks,
                                          ReleaseCase{2, true, true}, ReleaseCase{2, false, true},
                                          ReleaseCase{0, false, false},
                                          ReleaseCase{1, false, false}));
-
-// --- Status files -----------------------------------------------------------
 
 TEST_F(TaskFileTest, StatusFileListsThisHostsLiveEntries) {
   entry(alpha_, 0, here_, TASK_RUNNING)->output.set("/pix/alpha.0001");
@@ -375,19 +283,16 @@ TEST_F(TaskFileTest, StatusFileListsThisHostsLiveEntries) {
 
 TEST_F(TaskFileTest, CurrentFileNamesStayWithin1024Characters) {
   std::string text;
-  for (int i = 0; i < 40; ++i) {
+  for (int i = 0; i < 40; ++i)
     text += "alpha.sdl 1 2 /pix/" + std::string(40, 'a' + i % 26) + "." + std::to_string(i) + "\n";
-  }
   ASSERT_EQ(mkdir(path("TSKSTAT").c_str(), 0775), 0);
   write_file("TSKSTAT/testhost", text + "alpha.sdl 1 99 " + std::string(3000, 'z') + "\n");
   const char* got = Task_current_filenames(alpha_, here_);
   ASSERT_NE(got, nullptr);
-  std::string names = got;
   // Whole names only, each followed by a space, as many as fit.
-  EXPECT_LE(names.size(), 1024u);
-  EXPECT_GT(names.size() + 47, 1024u);
-  EXPECT_EQ(names.back(), ' ');
-  EXPECT_EQ(names.find("/pix/aaaa"), 0u);
+  const std::string names = got;
+  EXPECT_TRUE(names.size() <= 1024u && names.size() + 47 > 1024u) << names.size();
+  EXPECT_TRUE(names.back() == ' ' && names.starts_with("/pix/aaaa")) << names;
 
   // A damaged code reads as pending; the dump stops where the file breaks.
   write_file("TSKSTAT/testhost", "alpha.sdl 1 99 out\nalpha.sdl x\n");

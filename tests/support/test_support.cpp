@@ -18,34 +18,16 @@ void rndctl_reset() {
   while (rndctl.jobs != nullptr) Job_del(rndctl.jobs);
   while (rndctl.devs != nullptr) Dev_del(rndctl.devs);
   fileop_reset();
-  rndctl.current_job = nullptr;
-  rndctl.current_dev = nullptr;
-  rndctl.job_index.slots.clear();
-  rndctl.dev_index.slots.clear();
-  rndctl.location.reset();
-  rndctl.user.reset();
-  rndctl.host.reset();
-  rndctl.install.reset();
-  rndctl.last_update = 0;
-  rndctl.pid = 0;
-  rndctl.running = 0;
-  rndctl.interval_min = 0;
-  rndctl.interval_sec = 0;
-  rndctl.signal_seen = 0;
-  rndctl.out_counter = 0;
-  rndctl.stream_counter = 0;
+  rndctl = RndCtl{};
 }
 
 bool write_text_file(const std::string& path, const std::string& content) {
-  std::ofstream out(path, std::ios::binary | std::ios::trunc);
-  out << content;
-  return static_cast<bool>(out);
+  return static_cast<bool>(std::ofstream(path, std::ios::binary | std::ios::trunc) << content);
 }
 
 std::string read_text_file(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
   std::ostringstream s;
-  s << in.rdbuf();
+  s << std::ifstream(path, std::ios::binary).rdbuf();
   return s.str();
 }
 
@@ -59,9 +41,8 @@ pid_t exited_pid() {
 std::vector<std::string> dir_names(const std::string& dir) {
   std::vector<std::string> names;
   if (DIR* d = opendir(dir.c_str())) {
-    while (struct dirent* e = readdir(d)) {
+    while (struct dirent* e = readdir(d))
       if (strcmp(e->d_name, ".") != 0 && strcmp(e->d_name, "..") != 0) names.push_back(e->d_name);
-    }
     closedir(d);
   }
   std::sort(names.begin(), names.end());
@@ -88,16 +69,12 @@ std::vector<RaceChild> race_children(int n, int (*body)(int i, void* ctx), void*
   close(go[0]);
   close(go[1]);
   std::vector<RaceChild> raced;
-  for (pid_t child : children) {
-    int status = -1;
-    waitpid(child, &status, 0);
-    raced.push_back({child, status});
-  }
+  for (pid_t child : children) waitpid(child, &raced.emplace_back(RaceChild{child, -1}).status, 0);
   return raced;
 }
 
 Ran run_program(std::vector<std::string> args, const std::string& scratch, const std::string& cwd) {
-  std::string out_path = scratch + ".out", err_path = scratch + ".err";
+  const std::string out_path = scratch + ".out", err_path = scratch + ".err";
   std::vector<char*> argv;
   for (std::string& a : args) argv.push_back(a.data());
   argv.push_back(nullptr);
@@ -113,10 +90,8 @@ Ran run_program(std::vector<std::string> args, const std::string& scratch, const
   }
   Ran r;
   waitpid(pid, &r.status, 0);
-  r.out = read_text_file(out_path);
-  r.err = read_text_file(err_path);
-  unlink(out_path.c_str());
-  unlink(err_path.c_str());
+  std::tie(r.out, r.err) = std::pair(read_text_file(out_path), read_text_file(err_path));
+  for (const std::string& p : {out_path, err_path}) unlink(p.c_str());
   return r;
 }
 
@@ -129,9 +104,8 @@ void remove_tree(const std::string& path) {
 void ControlDirTest::SetUp() {
   const char* tmp = getenv("TMPDIR");
   std::string templ = std::string(tmp != nullptr ? tmp : "/tmp") + "/rndctl_test_XXXXXX";
-  char* made = mkdtemp(templ.data());
-  ASSERT_NE(made, nullptr);
-  dir_ = made;
+  ASSERT_NE(mkdtemp(templ.data()), nullptr);
+  dir_ = templ;
   rndctl_reset();
   rndctl.location.set(dir_.c_str());
   rndctl.host.set("testhost");

@@ -3,6 +3,7 @@
 
 #include <gtest/gtest.h>
 #include <sys/wait.h>
+#include <unistd.h>
 
 #include <string>
 #include <vector>
@@ -19,6 +20,18 @@ bool write_text_file(const std::string& path, const std::string& content);
 std::string read_text_file(const std::string& path);
 /// The pid of a child that has already exited and been reaped.
 pid_t exited_pid();
+/// The first `bytes` bytes of `pid` as a pid file holds it.
+inline std::string pid_bytes(int32_t pid, size_t bytes = sizeof(int32_t)) {
+  return std::string(reinterpret_cast<const char*>(&pid), bytes);
+}
+/// A child in its own process group that waits to be killed.
+inline pid_t sleeper() {
+  pid_t pid = fork();
+  if (pid == 0)
+    for (setpgid(0, 0);;) pause();
+  setpgid(pid, pid);
+  return pid;
+}
 /// The sorted names in `dir`, without "." and "..".
 std::vector<std::string> dir_names(const std::string& dir);
 /// Forks `n` children that each run `body(i)` and _exit with its result,

@@ -29,8 +29,22 @@ std::string written(Write write) {
   return text;
 }
 
+/// What Task_write writes of `groups`, marked when it reports a failure.
 inline std::string written_tasks(TaskGroup* groups) {
-  return written([groups](FILE* fp) { Task_write(fp, groups); });
+  return written([groups](FILE* fp) {
+    if (Task_write(fp, groups) != 0) fputs("<Task_write failed>", fp);
+  });
+}
+
+/// The groups Task_read finds in `text`.
+inline TaskGroup* read_tasks(const std::string& text) {
+  FILE* fp = tmpfile();
+  if (fp == nullptr) return nullptr;
+  fwrite(text.data(), 1, text.size(), fp);
+  rewind(fp);
+  TaskGroup* groups = Task_read(fp);
+  fclose(fp);
+  return groups;
 }
 
 inline void delete_lists() {
@@ -46,16 +60,10 @@ inline void swap_lists(RndCtl& a, RndCtl& b) {
   std::swap(a.dev_name_index, b.dev_name_index);
 }
 
-inline std::string after_slash(const std::string& text) {
-  size_t slash = text.rfind('/');
-  return slash == std::string::npos ? text : text.substr(slash + 1);
-}
-
-/// Builds a resource, a second plain resource, a job holding the texts in
-/// every string field and a job without a name, and checks the property.
-/// `texts` is used round-robin (empty: every field ""); the lists must be
-/// empty, and are empty again afterwards.  Returns "" when it holds, else
-/// what went wrong.
+/// Builds a resource, a second plain resource, a job holding the texts in every string field and
+/// a job without a name, and checks the property.  `texts` is used round-robin (empty: every
+/// field ""); the lists must be empty, and are empty again afterwards.  Returns "" when it
+/// holds, else what went wrong.
 inline std::string check(const std::vector<std::string>& texts) {
   size_t next = 0;
   auto t = [&]() -> std::string {
@@ -81,14 +89,10 @@ inline std::string check(const std::vector<std::string>& texts) {
     fill(*f);
   const std::string host = held[0], location = held[1], name = held[3], comment = held[4],
                     user = held[5], exe = held[7];
-  job->animate = 1;
-  job->frames[1] = 10.0f;
-  job->frames[0] = job->frames[2] = 1.0f;
-  RndPathList_add(job, t().c_str());
-  RndPathList_add(job, t().c_str());
-  RndDevList_add(job, odd);
-  RndDevList_add(job, plain);
-  RndDevList_add(nameless, plain);
+  std::tie(job->animate, job->frames[0], job->frames[1], job->frames[2]) = std::tuple(1, 1, 10, 1);
+  for (int i = 0; i < 2; ++i) RndPathList_add(job, t().c_str());
+  for (auto [on, dev] : {std::pair{job, odd}, {job, plain}, {nameless, plain}})
+    RndDevList_add(on, dev);
 
   const std::string devs_text = written(Resource_control_write_dev);
   const std::string jobs_text = written(Job_control_write_dev);
@@ -98,7 +102,7 @@ inline std::string check(const std::vector<std::string>& texts) {
   odd->host_name.set(RJC_name_form(host.c_str()).c_str());
   odd->remote_location.set(RJC_string_form(location.c_str()).c_str());
   odd->comment.reset();  // a resource comment is written, never read
-  job->name.set(RJC_name_form(after_slash(name).c_str()).c_str());
+  job->name.set(RJC_name_form(name.substr(name.rfind('/') + 1).c_str()).c_str());
   job->comment.set(RJC_comment_form(comment.c_str()).c_str());
   job->user.set(RJC_name_form(user.c_str()).c_str());
   job->executable.set(RJC_name_form(exe.c_str()).c_str());
@@ -128,23 +132,18 @@ inline std::string check(const std::vector<std::string>& texts) {
   if (RJC_parse_string(jobs_text.data(), jobs_text.size(), "Render_Job_Control") != 0)
     fail("job file does not parse:\n" + jobs_text);
 
-  Dev* a = aside.devs;
-  Dev* b = rndctl.devs;
-  for (; a != nullptr && b != nullptr; a = a->next, b = b->next)
-    if (ISA_devdif(a, b) != 0) fail("resource " + std::to_string(a->index) + " differs");
-  if (a != nullptr || b != nullptr) fail("resource lists differ in length");
-  Job* x = aside.jobs;
-  Job* y = rndctl.jobs;
-  for (; x != nullptr && y != nullptr; x = x->next, y = y->next)
-    if (ISA_jobdif(x, y) != 0) fail("job " + std::to_string(x->index) + " differs");
-  if (x != nullptr || y != nullptr) fail("job lists differ in length");
+  auto compare = [&](auto* a, auto* b, auto dif, const std::string& what) {
+    for (; a != nullptr && b != nullptr; a = a->next, b = b->next)
+      if (dif(a, b) != 0) fail(what + " " + std::to_string(a->index) + " differs");
+    if (a != nullptr || b != nullptr) fail(what + " lists differ in length");
+  };
+  compare(aside.devs, rndctl.devs, ISA_devdif, "resource");
+  compare(aside.jobs, rndctl.jobs, ISA_jobdif, "job");
   if (written(Resource_control_write_dev) != devs_expected) fail("resource file not stable");
   if (written(Job_control_write_dev) != jobs_text) fail("job file not stable");
 
   // The task file reads back group by group, each under its job's index.
-  FILE* fp = fmemopen(const_cast<char*>(tasks_text.data()), tasks_text.size(), "r");
-  TaskGroup* read = fp != nullptr ? Task_read(fp) : nullptr;
-  if (fp != nullptr) fclose(fp);
+  TaskGroup* read = read_tasks(tasks_text);
   // The reader gives the groups in an order of its own: compared by index.
   int seen[2] = {0, 0};
   TaskGroup* by_index[2] = {nullptr, nullptr};
@@ -157,8 +156,7 @@ inline std::string check(const std::vector<std::string>& texts) {
   std::string again;
   for (TaskGroup* g : by_index) {
     if (g == nullptr) continue;
-    TaskGroup* after = g->next;
-    g->next = nullptr;
+    TaskGroup* after = std::exchange(g->next, nullptr);
     again += written_tasks(g);
     g->next = after;
   }
