@@ -36,12 +36,30 @@
 #include "Utility/rndctl/tasks/rj_perform.h"
 #include "Utility/rndctl/tasks/rj_select.h"
 #include "Utility/rndctl/tasks/rj_task.h"
+#include "Utility/rndctl/tasks/rj_taskfile.h"
 #include "Utility/rndctl/tasks/rj_taskrec.h"
 #include "Utility/rndctl/tasks/rj_tskio.h"
 
 namespace {
 
 bool held(const TaskRec* rec) { return rec->status == TASK_STARTED || rec->status == TASK_RUNNING; }
+
+// Whether the file as it stands holds a record that `wanted` would put back.
+// Every daemon looks at start-up and once a minute, nearly always for
+// nothing; a look without the lock keeps those looks from queueing at the
+// lock with the hosts that take work.
+template <class Wanted>
+bool any_to_put_back(Wanted wanted) {
+  TaskGroup* groups = Task_file_peek();
+  bool found = false;
+  for (TaskGroup* g = groups; g != nullptr && !found; g = g->next) {
+    for (TaskRec* rec = g->tasks; rec != nullptr && !found; rec = rec->next) {
+      found = held(rec) && wanted(g, rec);
+    }
+  }
+  TaskGroup_free_all(&groups);
+  return found;
+}
 
 // One locked read-modify-write of the task file: every held record for which
 // `pick` says yes is put back.  The other hosts of each job touched are woken
@@ -99,8 +117,8 @@ TaskRec* Task_put_back(TaskGroup** groups, TaskGroup* group, TaskRec* rec) {
 
 int Task_reclaim_this_host() {
   int killed = rj_render_kill_leftovers();
-  int count =
-      put_back_cycle([](TaskGroup*, TaskRec* rec) { return rj_dev_is_this_host(rec->dev); });
+  auto mine = [](TaskGroup*, TaskRec* rec) { return rj_dev_is_this_host(rec->dev); };
+  int count = any_to_put_back(mine) ? put_back_cycle(mine) : 0;
   dbgpnt("start-up: %d render(s) killed, %d task(s) put back\n", killed, count);
   return count;
 }
@@ -127,15 +145,18 @@ int Task_reclaim_dead_hosts(time_t server_now) {
     verdicts.emplace(host, v);
     return v;
   };
-  return put_back_cycle([&](TaskGroup* g, TaskRec* rec) {
+  auto dead_holder = [&](const TaskRec* rec) {
     if (rec->dev == nullptr || rec->dev->host_name.none() || rj_dev_is_this_host(rec->dev)) {
-      return false;
+      return Verdict{false, 0};
     }
-    const char* host = rec->dev->host_name.c_str();
-    Verdict v = judge(host);
+    return judge(rec->dev->host_name.c_str());
+  };
+  if (!any_to_put_back([&](TaskGroup*, TaskRec* rec) { return dead_holder(rec).dead; })) return 0;
+  return put_back_cycle([&](TaskGroup* g, TaskRec* rec) {
+    Verdict v = dead_holder(rec);
     if (!v.dead) return false;
     wrt_logfile("put back task %d of \"%s\" from host %s: no heartbeat for %ld seconds", rec->id,
-                g->job->name.or_else("noname"), host, v.age);
+                g->job->name.or_else("noname"), rec->dev->host_name.c_str(), v.age);
     return true;
   });
 }

@@ -19,6 +19,7 @@
 #include "Utility/rndctl/base/rj_log.h"
 #include "Utility/rndctl/base/rj_text.h"
 #include "Utility/rndctl/ctldir/rj_fileio.h"
+#include "Utility/rndctl/ctldir/rj_paths.h"
 #include "Utility/rndctl/ctlfile/rj_ctlfile.h"
 #include "Utility/rndctl/records/rj_dev.h"
 #include "Utility/rndctl/records/rj_job.h"
@@ -337,6 +338,14 @@ int Task_file_search(const char* host) {
     TaskGroup_free_all(&groups);
   }
   return found;
+}
+
+TaskGroup* Task_file_peek() {
+  FILE* fp = fopen(rj_control_path(FILE_TASKS).c_str(), "re");
+  if (fp == nullptr) return nullptr;
+  TaskGroup* groups = Task_read(fp);
+  fclose(fp);  // read only: nothing to lose
+  return groups;
 }
 
 int Task_file_rewrite(const std::function<bool(TaskGroup** groups)>& change) {

@@ -43,6 +43,12 @@ void Task_file_dump();
 /// 1 when a record of the task file names a resource on `host`, else 0
 /// (0 too when the file cannot be read).
 int Task_file_search(const char* host);
+/// Reads the task file without its lock (null when it cannot be read).
+/// Writers replace the file whole (aside, then renamed in), so this is one
+/// whole version, perhaps already an old one: good for telling whether a
+/// locked cycle has anything to do, never for writing back.  The caller
+/// frees the groups (TaskGroup_free_all).
+TaskGroup* Task_file_peek();
 /// The one locked read-modify-write of the task file: takes its lock, reads
 /// the groups, hands them to `change` (which may add, cut and free records
 /// and groups), and when it returns true writes them back (aside, then
