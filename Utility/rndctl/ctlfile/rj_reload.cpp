@@ -462,6 +462,50 @@ bool write_back(const std::string& resources, const std::string& jobs) {
   return current;
 }
 
+// Settles the lists against the job file as it stands and writes the result
+// back, all under the job file's lock (the resource file's bytes are those
+// read before; its lock is not taken here).  Used once an optimistic try
+// found the job file rewritten between its read and its write: on a farm
+// of many hosts every host writes its progress into that one file, and the
+// next try would most likely meet another writer again.  Returns false only
+// when the file could not be read.
+bool settle_jobs_locked(const std::string& resources, int editor) {
+  FileopLock lock(FILE_JOBS);
+  std::string jobs;
+  FILE* fp = read_fileop(FILE_JOBS);
+  if (fp == nullptr) return false;
+  char buf[1 << 16];
+  size_t n;
+  bool ok = true;
+  while ((n = fread(buf, 1, sizeof buf, fp)) > 0) jobs.append(buf, n);
+  if (ferror(fp)) ok = false;
+  (void)close_fileop(FILE_JOBS);  // a failure is reported there; the old file stands
+  if (!ok) {
+    forget(FILE_JOBS);
+    return false;
+  }
+  reconcile_from(resources, jobs, editor);
+  std::string text = render(FILE_JOBS);
+  if (text == jobs) {
+    remember(FILE_JOBS, jobs);
+    return true;
+  }
+  fp = update_fileop(FILE_JOBS);
+  if (fp == nullptr) {
+    forget(FILE_JOBS);
+    return true;  // reported; the old file stands, and trying again would not help
+  }
+  rewind_fileop(FILE_JOBS);
+  ok = fwrite(text.data(), 1, text.size(), fp) == text.size();
+  ok = close_and_truncate_fileop(FILE_JOBS) == 0 && ok;
+  if (ok) {
+    remember(FILE_JOBS, text);
+  } else {
+    forget(FILE_JOBS);
+  }
+  return true;
+}
+
 // Only the reload at the start of a pass (editor 0) may call a change of the
 // update time seen.  The write-back at the end of a pass (editor 1) comes
 // after this pass has picked its work: a touch that landed during the pass
@@ -492,21 +536,27 @@ void Update_from_demon(int editor) {
   }
 
   // Each file's lock is held only to read it and, when the lists differ from
-  // it, to replace it; never both locks at once, never while parsing.  A file
-  // rewritten by somebody else between the read and the write is read again
-  // and settled against once more: the settling rules make that converge.
+  // it, to replace it; never both locks at once.  The first try parses with
+  // no lock held.  A file rewritten by somebody else between the read and
+  // the write sends the job file to one read, settle and write under its
+  // lock, which no other writer can come between.
   for (int attempt = 0; attempt < 8; ++attempt) {
     const Seen* res = read_file(FILE_RESOURCES);
-    const Seen* job = read_file(FILE_JOBS);
     // Copies: a write-back replaces what is remembered of the files.
     const std::string resources = res != nullptr ? res->bytes : std::string();
+    if (attempt > 0 && res != nullptr) {
+      // The last try lost a race for a file: the job file is now settled
+      // under its lock, then the resource file as before.
+      if (!settle_jobs_locked(resources, editor)) break;  // reported by the open
+      std::string text = render(FILE_RESOURCES);
+      if (text == resources || write_if_unchanged(FILE_RESOURCES, text, resources) != 0) break;
+      continue;
+    }
+    const Seen* job = read_file(FILE_JOBS);
     const std::string jobs = job != nullptr ? job->bytes : std::string();
     reconcile_from(resources, jobs, editor);
     if (res == nullptr || job == nullptr) break;  // reported by the open; nothing to write to
     if (write_back(resources, jobs)) break;
-    // In the daemon the files as they stand win: what it failed to write
-    // goes with the newer version, which the next read takes as it is.
-    if (editor == 0 && attempt > 0) break;
   }
   take_marks();
 
