@@ -1,5 +1,6 @@
 // Week grids: filling them from entries, taking blocks back out, and the
 // checks against a clock that the tests set.
+#include <algorithm>
 #include <cstdlib>
 #include <ctime>
 #include <string>
@@ -39,17 +40,14 @@ struct Entry {
 
 // What the writer would print for a grid: the blocks in order.
 std::vector<std::string> blocks_of(const int* grid) {
-  int scratch[RJ_WEEK_SCAN];
+  int scratch[RJ_WEEK_SCAN], times[2];
   std::copy(grid, grid + RJ_WEEK_SCAN, scratch);
   std::vector<std::string> out;
-  int times[2];
   const char* days[2];
-  while (Schedule_get_a_block(scratch, times, days) != 0) {
-    char text[80];
+  for (char text[80]; Schedule_get_a_block(scratch, times, days) != 0; out.push_back(text)) {
     bool one_day = std::string(days[0]) == days[1];
     snprintf(text, sizeof text, "{ %d to %d %s%s%s }", times[0], times[1], days[0],
              one_day ? "" : " to ", one_day ? "" : days[1]);
-    out.push_back(text);
   }
   return out;
 }
@@ -76,18 +74,15 @@ TEST(BlockRoundTrip, EntriesComeBackAsBlocks) {
     Job job;
     for (const Entry& e : entries) {
       // The parser keeps only entries whose day words are days.
-      const char* first = Schedule_get_day(e.first);
-      const char* last = Schedule_get_day(e.last);
-      if (first == nullptr || last == nullptr) continue;
-      Schedule_dev_lock(&dev, e.start, e.end, first, last);
-      Schedule_job_runs(&job, e.start, e.end, first, last);
+      const char *first = Schedule_get_day(e.first), *last = Schedule_get_day(e.last);
+      if (first != nullptr && last != nullptr) Schedule_dev_lock(&dev, e.start, e.end, first, last);
+      if (first != nullptr && last != nullptr) Schedule_job_runs(&job, e.start, e.end, first, last);
     }
-    int set = 0;
-    for (int i = 0; i < RJ_WEEK_SCAN; i++) set += dev.locks[i] != 0;
-    EXPECT_EQ(set, slots_set) << entries[0].start;
-    EXPECT_EQ(dev.locks[RJ_WEEK], 0);
-    EXPECT_EQ(blocks_of(dev.locks), blocks);
-    EXPECT_EQ(blocks_of(job.runs), blocks);
+    int set =
+        std::count_if(dev.locks, dev.locks + RJ_WEEK_SCAN, [](int slot) { return slot != 0; });
+    EXPECT_EQ(std::tuple(set, dev.locks[RJ_WEEK], blocks_of(dev.locks), blocks_of(job.runs)),
+              std::tuple(slots_set, 0, blocks, blocks))
+        << entries[0].start << " " << entries[0].first;
   }
 }
 
@@ -104,9 +99,9 @@ TEST_F(ScheduleTest, ClockPosition) {
   Schedule_dev_lock(Dev_new(nullptr, nullptr, "d", 1), 0, 2400, "sunday", "saturday");
   last_float_time_index = 12.0f;
   fake_now = static_cast<time_t>(1) << 62;
-  EXPECT_EQ(get_current_schedule_index(), -1);
-  EXPECT_FLOAT_EQ(last_float_time_index, 12.0f);
-  EXPECT_EQ(Dev_schedule_check("testhost"), -1);
+  EXPECT_EQ((std::tuple{get_current_schedule_index(), last_float_time_index,
+                        Dev_schedule_check("testhost")}),
+            std::tuple(-1, 12.0f, -1));
 }
 
 TEST_F(ScheduleTest, JobRunStates) {
@@ -118,11 +113,8 @@ TEST_F(ScheduleTest, JobRunStates) {
     job->ctrl = state;
     EXPECT_EQ(Job_available(job), expected[state]) << state;
   }
-  job->ctrl = RUN_SCHEDULE;
   at(1, 12, 0);
-  EXPECT_EQ(Job_schedule_check(job), 0);
-  job->ctrl = 9;
-  EXPECT_EQ(Job_schedule_check(job), 0);
+  for (int ctrl : {int(RUN_SCHEDULE), 9}) EXPECT_EQ((job->ctrl = ctrl, Job_schedule_check(job)), 0);
 }
 
 TEST_F(ScheduleTest, SaturdayNightLockWakesAtTheWeekBoundary) {
@@ -130,7 +122,6 @@ TEST_F(ScheduleTest, SaturdayNightLockWakesAtTheWeekBoundary) {
   Schedule_dev_lock(dev, 2200, 2400, "saturday", "saturday");
   Schedule_dev_lock(dev, 0, 600, "sunday", "sunday");
   dev->status = LOCK_SCHEDULE;
-
   at(6, 23, 10);
   // 50 minutes to the end of the week, less the float rounding of 23:10.
   EXPECT_EQ(check(), std::pair(334, 2999));
@@ -138,8 +129,8 @@ TEST_F(ScheduleTest, SaturdayNightLockWakesAtTheWeekBoundary) {
   EXPECT_EQ(check(), std::pair(0, 6 * 3600));
 
   at(0, 6, 0);
-  EXPECT_EQ(Dev_schedule_check("testhost"), -1);
-  EXPECT_EQ(Dev_schedule_check("otherhost"), -1);
+  EXPECT_EQ(std::pair(Dev_schedule_check("testhost"), Dev_schedule_check("otherhost")),
+            std::pair(-1, -1));
 }
 
 TEST_F(ScheduleTest, LockedStateSleepsToTheNextHalfHour) {
@@ -147,7 +138,6 @@ TEST_F(ScheduleTest, LockedStateSleepsToTheNextHalfHour) {
   dev->status = LOCK_LOCKED;
   at(2, 14, 0);
   EXPECT_EQ(check(), std::pair(2 * 48 + 28, 1800));
-
   // An available resource is never locked, whatever its grid says.
   dev->status = LOCK_AVAILABLE;
   Schedule_dev_lock(dev, 0, 2400, "sunday", "saturday");
@@ -166,7 +156,6 @@ TEST_F(ScheduleTest, TwoResourcesForOneHost) {
 
   at(1, 9, 0);
   EXPECT_EQ(check(), std::pair(66, 5 * 3600));
-
   // With B first, the scan stops at B's clear slot before A is looked at,
   // and stops short at noon; the check at noon finds B locked.
   Dev_del(b);
