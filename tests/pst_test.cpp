@@ -16,9 +16,6 @@ namespace {
 std::optional<std::string> get_env(const char* name) {
   return getenv(name) != nullptr ? std::optional<std::string>(getenv(name)) : std::nullopt;
 }
-void restore_env(const char* name, const std::optional<std::string>& v) {
-  v ? setenv(name, v->c_str(), 1) : unsetenv(name);
-}
 std::string prefs_line(const std::string& name, const std::string& value) {
   return name + " \"" + value + "\"\n";
 }
@@ -40,8 +37,7 @@ class PstTest : public ::testing::Test {
     pst_reset_cache();
     remove_tree(home_);
     remove_tree(site_);
-    restore_env("HOME", saved_home_);
-    restore_env("ZARNO_LOCATION", saved_location_);
+    for (auto& [name, value] : saved_) value ? setenv(name, value->c_str(), 1) : unsetenv(name);
   }
 
   static void write_prefs(const std::string& dir, const std::string& content, mode_t mode = 0644) {
@@ -53,15 +49,14 @@ class PstTest : public ::testing::Test {
     return v != nullptr ? v : "(null)";
   }
 
-  const std::optional<std::string> saved_home_ = get_env("HOME");
-  const std::optional<std::string> saved_location_ = get_env("ZARNO_LOCATION");
+  const std::pair<const char*, std::optional<std::string>> saved_[2] = {
+      {"HOME", get_env("HOME")}, {"ZARNO_LOCATION", get_env("ZARNO_LOCATION")}};
   std::string home_, site_;
 };
 
 // A writable site file, else the user's, else the site file.
 TEST_F(PstTest, PrefsFileChoice) {
-  ASSERT_EQ(chmod(home_.c_str(), 0755), 0);
-  ASSERT_EQ(chmod(site_.c_str(), 0755), 0);
+  for (const std::string& dir : {home_, site_}) ASSERT_EQ(chmod(dir.c_str(), 0755), 0);
   for (auto [site_mode, user_file, expected] : {std::tuple{0666, true, "/site/ctl"},
                                                 {0444, true, "/user/ctl"},
                                                 {0444, false, "/site/ctl"}}) {
@@ -70,17 +65,12 @@ TEST_F(PstTest, PrefsFileChoice) {
     if (user_file) write_prefs(home_, prefs_line("ZARNO_RNDCTL_LOCATION", "/user/ctl"));
     // Looked up in a child that cannot override file permissions, so that a
     // read-only file is read-only for it; its exit code is the answer.
-    static const char* want;
-    want = expected;
-    int status = race_children(
-                     1,
-                     [](int, void*) {
-                       if (geteuid() == 0 && (setgid(65534) != 0 || setuid(65534) != 0)) return 2;
-                       const char* v = get_zarno_variable("ZARNO_RNDCTL_LOCATION");
-                       return v != nullptr && strcmp(v, want) == 0 ? 0 : 1;
-                     },
-                     nullptr)[0]
-                     .status;
+    auto child = [](int, void* want) {
+      if (geteuid() == 0 && (setgid(65534) != 0 || setuid(65534) != 0)) return 2;
+      const char* v = get_zarno_variable("ZARNO_RNDCTL_LOCATION");
+      return v != nullptr && strcmp(v, static_cast<const char*>(want)) == 0 ? 0 : 1;
+    };
+    int status = race_children(1, child, const_cast<char*>(expected))[0].status;
     ASSERT_TRUE(WIFEXITED(status));
     if (WEXITSTATUS(status) == 2) GTEST_SKIP() << "cannot drop privileges";
     EXPECT_EQ(WEXITSTATUS(status), 0) << site_mode << user_file;
@@ -88,8 +78,7 @@ TEST_F(PstTest, PrefsFileChoice) {
 }
 
 TEST_F(PstTest, ExpandsFromTheEnvironment) {
-  setenv("PST_A", "a", 1);
-  setenv("PST_EMPTY", "", 1);
+  for (auto [name, value] : {std::pair{"PST_A", "a"}, {"PST_EMPTY", ""}}) setenv(name, value, 1);
   setenv("PST_LONG", std::string(200, 'L').c_str(), 1);
   unsetenv("UNSET_VAR");
   // As written in the file, and what a lookup gives ("(null)": no value).
@@ -114,7 +103,6 @@ TEST_F(PstTest, UnknownVariableAndUnreadableFileYieldNull) {
   write_prefs(site_, prefs_line("KNOWN", "yes"));
   EXPECT_EQ(lookup("UNKNOWN"), "(null)");
   EXPECT_EQ(get_zarno_variable(nullptr), nullptr);
-
   pst_reset_cache();
   setenv("ZARNO_LOCATION", (site_ + "/missing").c_str(), 1);
   testing::internal::CaptureStderr();
