@@ -101,8 +101,7 @@ TEST_F(JobCheckTest, SceneCheckKeepsFramesAndHonoursTheExtensionFlag) {
 }
 
 TEST_F(JobCheckTest, FieldChecksFillOwnersAndDropDeadLocks) {
-  Job* mine = Job_new(nullptr, nullptr, "mine", 1);
-  Job* stale = Job_new(nullptr, nullptr, "stale", 2);
+  Job *mine = Job_new(nullptr, nullptr, "mine", 1), *stale = Job_new(nullptr, nullptr, "stale", 2);
   Dev* dev = Dev_new(nullptr, nullptr, "d", 1);
   mine->lock_pid = rndctl.pid;
   stale->lock_pid = dev->lock_pid = 999999;  // no editor registered under it
@@ -127,20 +126,18 @@ TEST_F(JobCheckTest, LiveJobsOnAHost) {
 
 // Fields and pick level take no part; any other change is a difference.
 TEST_F(JobCheckTest, JobDifferences) {
-  Dev* dev = Dev_new(nullptr, nullptr, "host", 1);
-  Dev* other_dev = Dev_new(nullptr, nullptr, "host", 2);
+  Dev *dev = Dev_new(nullptr, nullptr, "host", 1),
+      *other_dev = Dev_new(nullptr, nullptr, "host", 2);
   const std::function<void(Job*)> changes[] = {
       [](Job* j) { j->name.reset(); }, [](Job* j) { j->frames[2] = 1e-9f; },
       [](Job* j) { j->runs[335] = 1; }, [](Job* j) { j->searchpath->path.set("/other"); },
       [&](Job* j) { RndDevList_add(j, other_dev); }};
   for (size_t i = 0; i < std::size(changes); i++) {
-    Job* a = Job_new(nullptr, nullptr, "shot", 1);
-    Job* b = Job_new(nullptr, nullptr, "shot", 1);
+    Job *a = Job_new(nullptr, nullptr, "shot", 1), *b = Job_new(nullptr, nullptr, "shot", 1);
     for (Job* j : {a, b}) RndDevList_add(j, dev), RndPathList_add(j, "/maps"), j->runs[100] = 1;
     std::tie(a->fields, a->pick_level) = std::pair(3, 1);
-    EXPECT_EQ(ISA_jobdif(a, b), 0) << i;
-    changes[i](b);
-    EXPECT_EQ(ISA_jobdif(a, b), 1) << i;
+    EXPECT_EQ((std::pair{ISA_jobdif(a, b), (changes[i](b), ISA_jobdif(a, b))}), std::pair(0, 1))
+        << i;
   }
 }
 
@@ -149,8 +146,7 @@ TEST_F(JobCheckTest, ResourceDifferences) {
   // its own copies of the jobs, linked in the other order.
   auto copy_of_a = [](int first, int second) {
     Dev* d = Dev_new(nullptr, nullptr, "a", 1);
-    RndDevList_add(Job_new(nullptr, nullptr, "j", first), d);
-    RndDevList_add(Job_new(nullptr, nullptr, "j", second), d);
+    for (int index : {first, second}) RndDevList_add(Job_new(nullptr, nullptr, "j", index), d);
     return d;
   };
   Dev* a = copy_of_a(1, 2);
@@ -161,7 +157,6 @@ TEST_F(JobCheckTest, ResourceDifferences) {
       [](Dev* d) { RndDevList_add(Job_new(nullptr, nullptr, "j", 3), d); }};
   for (size_t i = 0; i < std::size(changes); i++) {
     Dev* copy = copy_of_a(2, 1);
-    changes[i](copy);
-    EXPECT_EQ(ISA_devdif(a, copy), 1) << i;
+    EXPECT_EQ((changes[i](copy), ISA_devdif(a, copy)), 1) << i;
   }
 }
