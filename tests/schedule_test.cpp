@@ -12,11 +12,6 @@ namespace {
 
 time_t fake_now = 0;
 
-// 2024-01-07 was a Sunday.
-time_t week_time(int day, int hour, int minute) {
-  return 1704585600 + day * 86400 + hour * 3600 + minute * 60;
-}
-
 class ScheduleTest : public ControlDirTest {
  protected:
   void SetUp() override {
@@ -25,7 +20,10 @@ class ScheduleTest : public ControlDirTest {
     tzset();
     rj_clock = [] { return fake_now; };
   }
-  void at(int day, int hour, int minute) { fake_now = week_time(day, hour, minute); }
+  // A time of the week starting on 2024-01-07, a Sunday.
+  void at(int day, int hour, int minute) {
+    fake_now = 1704585600 + day * 86400 + hour * 3600 + minute * 60;
+  }
   // This host's position in the week and the seconds it would sleep from there.
   static std::pair<int, int> check() {
     int now = Dev_schedule_check("testhost");
@@ -109,10 +107,8 @@ TEST_F(ScheduleTest, JobRunStates) {
   Schedule_job_runs(job, 800, 1200, "monday", "monday");
   at(1, 9, 0);
   const int expected[] = {0, 1, 2, 2, 2};  // unset, paused, available, schedule (in), now
-  for (int state = RUN_UNSET; state <= RUN_NOW; state++) {
-    job->ctrl = state;
-    EXPECT_EQ(Job_available(job), expected[state]) << state;
-  }
+  for (int state = RUN_UNSET; state <= RUN_NOW; state++)
+    EXPECT_EQ((job->ctrl = state, Job_available(job)), expected[state]) << state;
   at(1, 12, 0);
   for (int ctrl : {int(RUN_SCHEDULE), 9}) EXPECT_EQ((job->ctrl = ctrl, Job_schedule_check(job)), 0);
 }
@@ -149,8 +145,7 @@ TEST_F(ScheduleTest, LockedStateSleepsToTheNextHalfHour) {
 }
 
 TEST_F(ScheduleTest, TwoResourcesForOneHost) {
-  Dev* a = Dev_new(nullptr, nullptr, "A", 1);
-  Dev* b = Dev_new(nullptr, nullptr, "B", 2);
+  Dev *a = Dev_new(nullptr, nullptr, "A", 1), *b = Dev_new(nullptr, nullptr, "B", 2);
   Schedule_dev_lock(a, 800, 1200, "monday", "monday");
   Schedule_dev_lock(b, 1200, 1400, "monday", "monday");
 
