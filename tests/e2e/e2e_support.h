@@ -5,6 +5,7 @@
 #include <sys/types.h>
 
 #include <functional>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -67,7 +68,7 @@ class Farm {
   std::string dir_;
   std::string scratch_;
   int counter_ = 0;
-  std::vector<Daemon*> daemons_;
+  std::vector<std::unique_ptr<Daemon>> daemons_;
 };
 
 /// Polls `done` every few milliseconds, waking `daemon` (when given) now and
