@@ -16,9 +16,6 @@ namespace {
 std::optional<std::string> get_env(const char* name) {
   return getenv(name) != nullptr ? std::optional<std::string>(getenv(name)) : std::nullopt;
 }
-std::string prefs_line(const std::string& name, const std::string& value) {
-  return name + " \"" + value + "\"\n";
-}
 
 // A user's home and a site directory of its own; the environment points at
 // them for the test and is put back afterwards.
@@ -35,13 +32,14 @@ class PstTest : public ::testing::Test {
   }
   void TearDown() override {
     pst_reset_cache();
-    remove_tree(home_);
-    remove_tree(site_);
+    for (const std::string& dir : {home_, site_}) remove_tree(dir);
     for (auto& [name, value] : saved_) value ? setenv(name, value->c_str(), 1) : unsetenv(name);
   }
 
-  static void write_prefs(const std::string& dir, const std::string& content, mode_t mode = 0644) {
-    ASSERT_TRUE(write_text_file(dir + "/.ZarnoPrefs", content));
+  // A preferences file in `dir` setting `name` to `value`.
+  static void write_prefs(const std::string& dir, const std::string& name, const std::string& value,
+                          mode_t mode = 0644) {
+    ASSERT_TRUE(write_text_file(dir + "/.ZarnoPrefs", name + " \"" + value + "\"\n"));
     ASSERT_EQ(chmod((dir + "/.ZarnoPrefs").c_str(), mode), 0);
   }
   static std::string lookup(const char* name) {
@@ -61,8 +59,8 @@ TEST_F(PstTest, PrefsFileChoice) {
                                                 {0444, true, "/user/ctl"},
                                                 {0444, false, "/site/ctl"}}) {
     unlink((home_ + "/.ZarnoPrefs").c_str());
-    write_prefs(site_, prefs_line("ZARNO_RNDCTL_LOCATION", "/site/ctl"), site_mode);
-    if (user_file) write_prefs(home_, prefs_line("ZARNO_RNDCTL_LOCATION", "/user/ctl"));
+    write_prefs(site_, "ZARNO_RNDCTL_LOCATION", "/site/ctl", site_mode);
+    if (user_file) write_prefs(home_, "ZARNO_RNDCTL_LOCATION", "/user/ctl");
     // Looked up in a child that cannot override file permissions, so that a
     // read-only file is read-only for it; its exit code is the answer.
     auto child = [](int, void* want) {
@@ -93,31 +91,26 @@ TEST_F(PstTest, ExpandsFromTheEnvironment) {
            {"   ", "(null)"},
            {"$UNSET_VAR", "(null)"},
            {"$PST_LONG$PST_LONG", std::string(255, 'L')}}) {  // cut at the buffer
-    write_prefs(site_, prefs_line("V", value));
+    write_prefs(site_, "V", value);
     pst_reset_cache();
     EXPECT_EQ(lookup("V"), expected) << value;
   }
 }
 
-TEST_F(PstTest, UnknownVariableAndUnreadableFileYieldNull) {
-  write_prefs(site_, prefs_line("KNOWN", "yes"));
+// The default project comes from the browser's file, never the preferences.
+TEST_F(PstTest, UnknownVariableAndUnreadableFileYieldNullAndTheDefaultProjectNeverAsks) {
+  write_prefs(site_, "KNOWN", "yes");
   EXPECT_EQ(lookup("UNKNOWN"), "(null)");
   EXPECT_EQ(get_zarno_variable(nullptr), nullptr);
   pst_reset_cache();
   setenv("ZARNO_LOCATION", (site_ + "/missing").c_str(), 1);
   testing::internal::CaptureStderr();
+  EXPECT_EQ(lookup("zarno_Default_Project"), "demo");
+  EXPECT_EQ(testing::internal::GetCapturedStderr(), "");
+  testing::internal::CaptureStderr();
   EXPECT_EQ(lookup("KNOWN"), "(null)");
   EXPECT_EQ(testing::internal::GetCapturedStderr(),
             "Unable to read Zarno Preferences file (" + site_ + "/missing/.ZarnoPrefs).\n");
-}
-
-TEST_F(PstTest, DefaultProjectComesFromTheBrowserFileNeverThePrefs) {
-  // A preferences file that cannot be read would complain if it were asked.
-  setenv("ZARNO_LOCATION", (site_ + "/missing").c_str(), 1);
-  testing::internal::CaptureStderr();
-  EXPECT_EQ(lookup("zarno_Default_Project"), "demo");
-  EXPECT_EQ(testing::internal::GetCapturedStderr(), "");
-
   ASSERT_TRUE(
       write_text_file(home_ + "/.ZarnoBrowserPrefs",
                       "CURRENT_PROJECT \"first\"\nOTHER_KEY \"other\"\n"
