@@ -46,8 +46,7 @@ TEST(MaNormal, BlocksAreAlignedReusedLastInFirstOutAndKeepTheirBytes) {
     char* p = block(n, __LINE__);
     ASSERT_TRUE(p != nullptr && reinterpret_cast<uintptr_t>(p) % 16 == 0) << n;
     EXPECT_GE(MA_usable_size(p), n);
-    memset(p, 'a' + static_cast<int>(n % 26), n);
-    blocks.push_back(p);
+    blocks.push_back(static_cast<char*>(memset(p, 'a' + static_cast<int>(n % 26), n)));
   }
   void* again = block(24, __LINE__);
   MA_free(again, __LINE__, kUnit);
@@ -91,10 +90,8 @@ TEST(MaNormal, ThreadsAllocatingTogetherNeverShareABlock) {
 // switching back afterwards is safe.
 class MaDebug : public testing::Test {
  protected:
-  void SetUp() override {
-    MA_init();  // reads the environment once; the settings below must win
-    ma_debug = ma_chkfree = ma_stomp = 1;
-  }
+  // MA_init reads the environment once: the settings after it must win.
+  void SetUp() override { MA_init(), ma_debug = ma_chkfree = ma_stomp = 1; }
   void TearDown() override { ma_debug = ma_chkfree = ma_stomp = 0; }
 };
 

@@ -223,10 +223,7 @@ void run(unsigned seed, const SshServer* ssh) {
   std::vector<std::string> stuck = hosts.shut_down(30);
   EXPECT_TRUE(stuck.empty()) << stuck.size() << " daemon(s) did not leave within 30 s of an "
                              << "operator's stop (waiting on a lock?), first " << stuck[0];
-  std::string locks;
-  for (const std::string& name : dir_names(farm.dir()))
-    if (name.ends_with(".lock")) locks += " " + name;
-  EXPECT_EQ(locks, "") << "lock directories left";
+  EXPECT_EQ(lock_dirs(farm), std::vector<std::string>{}) << "lock directories left";
   EXPECT_TRUE(wait_for([&] { return hosts.renders_left().empty(); }, 10))
       << hosts.renders_left().size() << " render(s) left running";
 }

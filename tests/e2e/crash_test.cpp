@@ -22,12 +22,6 @@ using testing::HasSubstr;
 
 bool any_held(Farm& farm) { return std::ranges::any_of(task_records(farm), &FileRec::held); }
 
-std::vector<std::string> lock_dirs(Farm& farm) {
-  std::vector<std::string> locks = dir_names(farm.dir());
-  std::erase_if(locks, [](const std::string& name) { return !name.ends_with(".lock"); });
-  return locks;
-}
-
 // Gone, or a zombie nobody has reaped yet.
 bool process_gone(int pid) {
   std::string stat = read_text_file("/proc/" + std::to_string(pid) + "/stat");
@@ -82,16 +76,13 @@ TEST_F(CrashTest, ARestartedDaemonEndsTheOldRenderAndRendersTheRestFromTheFrameR
   ASSERT_TRUE(wait_for([&] { return rendered(2); }, 60)) << first.log();
   utimensat(AT_FDCWD, farm_.path(host_ + ".pid").c_str(), nullptr, 0);
   float reached = 0;
-  ASSERT_TRUE(wait_for(
-      [&] {
-        for (const FileRec& r : task_records(farm_))
-          if (r.status == "RUNNING" && r.current > r.start) reached = r.current;
-        return reached > 0 && lock_dirs(farm_).empty();
-      },
-      30))
-      << farm_.read("Render_Tasks");
-  kill(first.pid, SIGKILL);
-  ASSERT_TRUE(wait_for([&] { return first.ended(); }, 10));
+  auto recorded = [&] {
+    for (const FileRec& r : task_records(farm_))
+      if (r.status == "RUNNING" && r.current > r.start) reached = r.current;
+    return reached > 0 && lock_dirs(farm_).empty();
+  };
+  ASSERT_TRUE(wait_for(recorded, 30)) << farm_.read("Render_Tasks");
+  ASSERT_TRUE(kill(first.pid, SIGKILL) == 0 && wait_for([&] { return first.ended(); }, 10));
   EXPECT_FALSE(process_gone(render)) << "the render outlives its daemon";
   // Frames the task file counts as done must not be painted again.
   auto done = images_before(static_cast<int>(reached));
@@ -121,8 +112,7 @@ TEST_F(CrashTest, ACleanExitEndsItsRenderAndPutsTheTaskBack) {
   ASSERT_GT(render, 0) << d.log();
 
   ASSERT_EQ(unlink(farm_.path(host_ + ".pid").c_str()), 0);
-  d.wake();
-  ASSERT_TRUE(wait_for([&] { return d.ended(); }, 30));
+  ASSERT_TRUE((d.wake(), wait_for([&] { return d.ended(); }, 30)));
   EXPECT_TRUE(wait_for([&] { return process_gone(render); }, 30));
   EXPECT_TRUE(!any_held(farm_) && farm_.read("Render_Tasks").find("PENDING") != std::string::npos)
       << farm_.read("Render_Tasks");

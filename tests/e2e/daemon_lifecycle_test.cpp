@@ -53,20 +53,14 @@ bool woken(Daemon& d) {
       10);
 }
 
-TEST_F(DaemonLifecycle, SecondDaemonOnTheSameHostRefusesToStart) {
-  Daemon& first = farm.start_on_farm();
-  ASSERT_TRUE(started(first));
+TEST_F(DaemonLifecycle, SecondDaemonIsRefusedAndARemovedPidFileEndsTheFirst) {
+  Daemon& d = farm.start_on_farm();
+  ASSERT_TRUE(started(d));
   Daemon& second = farm.start_on_farm();
   EXPECT_EQ(exit_code(second), 1);
   EXPECT_THAT(read_text_file(second.tmpdir + "/early"),
-              HasSubstr("process is alive --> " + first.host + ":" + std::to_string(first.pid)));
-  EXPECT_EQ(read_pid_file(farm.path(first.host + ".pid")), first.pid);
-  EXPECT_FALSE(first.ended());
-}
-
-TEST_F(DaemonLifecycle, RemovedPidFileEndsTheDaemonAtItsNextWakeUp) {
-  Daemon& d = farm.start_on_farm();
-  ASSERT_TRUE(started(d));
+              HasSubstr("process is alive --> " + d.host + ":" + std::to_string(d.pid)));
+  EXPECT_TRUE(read_pid_file(farm.path(d.host + ".pid")) == d.pid && !d.ended());
   ASSERT_EQ(exit_without_pid_file(d), 1);
   EXPECT_THAT(farm.read("Render_Access"),
               testing::AllOf(HasSubstr("* Exiting due to self check failure --  " + d.host +
@@ -79,8 +73,7 @@ TEST_F(DaemonLifecycle, ExitsOnTheEleventhWorklessWakeUp) {
   ASSERT_TRUE(started(d));
   for (int i = 1; i <= 10; ++i) ASSERT_TRUE(woken(d)) << "wake-up " << i;
   EXPECT_FALSE(d.ended());
-  d.wake();
-  EXPECT_EQ(exit_code(d), 1);
+  EXPECT_EQ((d.wake(), exit_code(d)), 1);
 }
 
 TEST_F(DaemonLifecycle, RefusesAControlDirectoryThatIsNotThere) {
@@ -94,9 +87,8 @@ TEST_F(DaemonLifecycle, RefusesAControlDirectoryThatIsNotThere) {
 
 TEST_F(DaemonLifecycle, APlantedLinkDoesNotRedirectTheLog) {
   std::string tmp = farm.path("plantedtmp"), victim = farm.path("victim");
-  ASSERT_EQ(mkdir(tmp.c_str(), 0777), 0);
-  write_text_file(victim, "precious\n");
-  ASSERT_EQ(symlink(victim.c_str(), (tmp + "/zarno_render_demon.LOG").c_str()), 0);
+  ASSERT_TRUE(mkdir(tmp.c_str(), 0777) == 0 && write_text_file(victim, "precious\n") &&
+              symlink(victim.c_str(), (tmp + "/zarno_render_demon.LOG").c_str()) == 0);
   Daemon& d = farm.start_on_farm({}, "", {"DRCTMPDIR=" + tmp});
   d.tmpdir = tmp;
   ASSERT_TRUE(started(d));
@@ -108,8 +100,7 @@ TEST_F(DaemonLifecycle, APlantedLinkDoesNotRedirectTheLog) {
 TEST_F(DaemonLifecycle, WakeUpsWhileStartUpWaitsForALockAreSurvived) {
   // Held by a live process of another host: nothing breaks it early.
   std::string lock = farm.path("Render_Resource_Control.lock");
-  ASSERT_EQ(mkdir(lock.c_str(), 0777), 0);
-  write_text_file(lock + "/otherhost", "1\n");
+  ASSERT_TRUE(mkdir(lock.c_str(), 0777) == 0 && write_text_file(lock + "/otherhost", "1\n"));
   Daemon& d = farm.start_on_farm();
   // The log is opened just before the first load, which waits for the lock.
   ASSERT_TRUE(wait_for([&] { return access(d.log_path().c_str(), F_OK) == 0; }, 20));
@@ -150,8 +141,7 @@ TEST_F(DaemonLifecycle, DebugOptionWinsOverTheEnvironment) {
   ASSERT_NE(exit_without_pid_file(traced), -2);
   Daemon& quiet = farm.start({"-l", farm.dir(), "-d", "0"}, "", {"RNDCTL_DEBUG=1"});
   ASSERT_TRUE(started(quiet));
-  // Its exit proves it went through a wake-up without tracing anything:
-  // nothing but the warning of a daemon started as root.
+  // Its exit proves a wake-up went by untraced: only a root daemon's warning is logged.
   EXPECT_EQ(exit_without_pid_file(quiet), 1);
   EXPECT_EQ(quiet.log(), geteuid() != 0
                              ? ""

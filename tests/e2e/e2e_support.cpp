@@ -53,8 +53,7 @@ void Daemon::stop() {
   reaped = waitpid(pid, &status, 0) == pid;
   // Orphans are reaped by someone else: wait until they are really gone, so
   // that a probe of their pid no longer finds them.
-  auto gone = [](int p) { return access(("/proc/" + std::to_string(p)).c_str(), F_OK) != 0; };
-  wait_for([&] { return std::ranges::all_of(killed, gone); }, 10);
+  wait_for([&] { return std::ranges::all_of(killed, pid_gone); }, 10);
 }
 
 Farm::Farm() {
@@ -126,6 +125,8 @@ bool wait_for(const std::function<bool()>& done, double seconds, Daemon* wake) {
   }
   return done();
 }
+
+bool pid_gone(int pid) { return access(("/proc/" + std::to_string(pid)).c_str(), F_OK) != 0; }
 
 int count_of(const std::string& text, const std::string& needle) {
   int n = 0;

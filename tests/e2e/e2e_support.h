@@ -78,6 +78,9 @@ bool wait_for(const std::function<bool()>& done, double seconds, Daemon* wake = 
 /// Counts the occurrences of `needle` in `text`.
 int count_of(const std::string& text, const std::string& needle);
 
+/// True once no process of that pid exists (a zombie still does).
+bool pid_gone(int pid);
+
 /// Pids of a process's children, and how many of them are zombies.
 std::vector<int> children_of(int pid, int* zombies = nullptr);
 

@@ -53,14 +53,11 @@ std::vector<int> pids_where(const std::function<bool(int)>& keep) {
   return pids;
 }
 
-bool gone(int pid) { return access(("/proc/" + std::to_string(pid)).c_str(), F_OK) != 0; }
-
 }  // namespace
 
 long long wall_ns() {
-  struct timespec ts;
-  clock_gettime(CLOCK_REALTIME, &ts);
-  return static_cast<long long>(ts.tv_sec) * 1000000000LL + ts.tv_nsec;
+  auto since_epoch = std::chrono::system_clock::now().time_since_epoch();  // CLOCK_REALTIME
+  return std::chrono::duration_cast<std::chrono::nanoseconds>(since_epoch).count();
 }
 
 std::vector<Stamp> read_stamps(const std::string& path) {
@@ -137,7 +134,8 @@ std::string SshServer::sshfs_command(const std::string& remote_dir,
          " " + mount_point;
 }
 
-FarmHosts::FarmHosts(Farm& farm, const SshServer* ssh) : farm_(farm), ssh_(ssh) {
+FarmHosts::FarmHosts(Farm& farm, const SshServer* ssh)
+    : farm_(farm), ssh_(ssh), env_(render_env()) {
   // Probes of another host's pid go through a remote shell; every host of
   // this farm shares this machine's pids, so the shim runs the probe here.
   std::string rsh = farm.path("../rsh_here");
@@ -145,7 +143,6 @@ FarmHosts::FarmHosts(Farm& farm, const SshServer* ssh) : farm_(farm), ssh_(ssh) 
                   "#!/bin/sh\n# rsh HOST -n COMMAND\nshift\n[ \"$1\" = -n ] && shift\n"
                   "exec /bin/sh -c \"$1\"\n");
   chmod(rsh.c_str(), 0755);
-  env_ = render_env();
   env_.push_back("ZARNO_RSH=" + rsh);
 }
 
@@ -191,7 +188,7 @@ void FarmHosts::power_cut(const std::string& name) {
       pids_where([&](int pid) { return host.namespaces.count(uts_of(pid)) != 0; });
   for (int pid : victims) kill(pid, SIGKILL);
   if (d != nullptr) d->stop();
-  wait_for([&] { return std::all_of(victims.begin(), victims.end(), gone); }, 10);
+  wait_for([&] { return std::ranges::all_of(victims, pid_gone); }, 10);
 }
 
 bool FarmHosts::wait_until(const std::function<bool()>& done, double seconds) {

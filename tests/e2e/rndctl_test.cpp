@@ -156,8 +156,8 @@ class RndctlFarmTest : public ::testing::Test {
     for (int tries = 0; daemon != nullptr && tries < 500; ++tries, usleep(20000)) {
       kill(daemon->pid, SIGSTOP);
       bool holds = false;
-      for (const std::string& n : dir_names(farm_.dir()))
-        holds |= n.ends_with(".lock") && access(farm_.path(n + "/" + host).c_str(), F_OK) == 0;
+      for (const std::string& n : lock_dirs(farm_))
+        holds |= access(farm_.path(n + "/" + host).c_str(), F_OK) == 0;
       if (!holds) return hosts_.power_cut(host), true;
       kill(daemon->pid, SIGCONT);
     }
