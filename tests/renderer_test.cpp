@@ -32,9 +32,8 @@ Strings ball(const char* end, const char* ext, const std::string& options) {
 class RendererTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    char tmpl[] = "/tmp/frame_painter_test.XXXXXX";
-    ASSERT_NE(mkdtemp(tmpl), nullptr);
-    project_ = tmpl;
+    project_ = testing::TempDir() + "frame_painter_test.XXXXXX";
+    ASSERT_NE(mkdtemp(project_.data()), nullptr);
     for (const char* sub : {"/sdl", "/pix"}) ASSERT_EQ(mkdir((project_ + sub).c_str(), 0755), 0);
     ASSERT_TRUE(write_text_file(
         project_ + "/sdl/scene.sdl",

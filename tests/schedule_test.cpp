@@ -24,10 +24,11 @@ class ScheduleTest : public ControlDirTest {
   void at(int day, int hour, int minute) {
     fake_now = 1704585600 + day * 86400 + hour * 3600 + minute * 60;
   }
-  // This host's position in the week and the seconds it would sleep from there.
+  // This host's position in the week and the seconds it would sleep from there
+  // (none when it is not locked).
   static std::pair<int, int> check() {
     int now = Dev_schedule_check("testhost");
-    return {now, get_next_available_time("testhost", now)};
+    return {now, now < 0 ? 0 : get_next_available_time("testhost", now)};
   }
 };
 
@@ -113,35 +114,29 @@ TEST_F(ScheduleTest, JobRunStates) {
   for (int ctrl : {int(RUN_SCHEDULE), 9}) EXPECT_EQ((job->ctrl = ctrl, Job_schedule_check(job)), 0);
 }
 
-TEST_F(ScheduleTest, SaturdayNightLockWakesAtTheWeekBoundary) {
-  Dev* dev = Dev_new(nullptr, nullptr, "night", 1);
-  Schedule_dev_lock(dev, 2200, 2400, "saturday", "saturday");
-  Schedule_dev_lock(dev, 0, 600, "sunday", "sunday");
-  dev->status = LOCK_SCHEDULE;
-  at(6, 23, 10);
-  // 50 minutes to the end of the week, less the float rounding of 23:10.
-  EXPECT_EQ(check(), std::pair(334, 2999));
-  at(0, 0, 0);
-  EXPECT_EQ(check(), std::pair(0, 6 * 3600));
-
-  at(0, 6, 0);
-  EXPECT_EQ(std::pair(Dev_schedule_check("testhost"), Dev_schedule_check("otherhost")),
-            std::pair(-1, -1));
-}
-
-TEST_F(ScheduleTest, LockedStateSleepsToTheNextHalfHour) {
-  Dev* dev = Dev_new(nullptr, nullptr, "locked", 1);
-  dev->status = LOCK_LOCKED;
-  at(2, 14, 0);
-  EXPECT_EQ(check(), std::pair(2 * 48 + 28, 1800));
-  // An available resource is never locked, whatever its grid says.
-  dev->status = LOCK_AVAILABLE;
-  Schedule_dev_lock(dev, 0, 2400, "sunday", "saturday");
-  EXPECT_EQ(Dev_schedule_check("testhost"), -1);
-
-  // Locked all week: the clear week's-end position is where it wakes.
-  dev->status = LOCK_SCHEDULE;
-  EXPECT_EQ(check(), std::pair(2 * 48 + 28, (336 - 2 * 48 - 28) * 1800));
+// Where a resource's lock state and grid put this host in the week and how
+// long it sleeps: to the week's boundary (less the float rounding of 23:10),
+// the next half hour, the clear week's end, or not at all (AVAILABLE never is).
+TEST_F(ScheduleTest, LockedResourcesWakeWhereTheirLockEnds) {
+  const std::vector<Entry> night = {{2200, 2400, "saturday", "saturday"},
+                                    {0, 600, "sunday", "sunday"}};
+  const std::vector<Entry> week = {{0, 2400, "sunday", "saturday"}};
+  const std::tuple<int, std::vector<Entry>, int, int, int, std::pair<int, int>> rows[] = {
+      {LOCK_SCHEDULE, night, 6, 23, 10, {334, 2999}},
+      {LOCK_SCHEDULE, night, 0, 0, 0, {0, 6 * 3600}},
+      {LOCK_SCHEDULE, night, 0, 6, 0, {-1, 0}},
+      {LOCK_LOCKED, {}, 2, 14, 0, {2 * 48 + 28, 1800}},
+      {LOCK_SCHEDULE, week, 2, 14, 0, {2 * 48 + 28, (336 - 2 * 48 - 28) * 1800}},
+      {LOCK_AVAILABLE, week, 2, 14, 0, {-1, 0}}};
+  for (const auto& [status, locks, day, hour, minute, wakes] : rows) {
+    Dev* dev = Dev_new(nullptr, nullptr, "d", 1);
+    dev->status = status;
+    for (const Entry& e : locks) Schedule_dev_lock(dev, e.start, e.end, e.first, e.last);
+    at(day, hour, minute);
+    EXPECT_EQ(check(), wakes) << status << " " << locks.size() << " at " << day << " " << hour;
+    EXPECT_EQ(Dev_schedule_check("otherhost"), -1);
+    Dev_del(dev);
+  }
 }
 
 TEST_F(ScheduleTest, TwoResourcesForOneHost) {
