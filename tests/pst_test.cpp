@@ -16,12 +16,6 @@ namespace {
 std::optional<std::string> get_env(const char* name) {
   return getenv(name) != nullptr ? std::optional<std::string>(getenv(name)) : std::nullopt;
 }
-void restore_env(const char* name, const std::optional<std::string>& v) {
-  v ? setenv(name, v->c_str(), 1) : unsetenv(name);
-}
-std::string prefs_line(const std::string& name, const std::string& value) {
-  return name + " \"" + value + "\"\n";
-}
 
 // A user's home and a site directory of its own; the environment points at
 // them for the test and is put back afterwards.
@@ -38,14 +32,14 @@ class PstTest : public ::testing::Test {
   }
   void TearDown() override {
     pst_reset_cache();
-    remove_tree(home_);
-    remove_tree(site_);
-    restore_env("HOME", saved_home_);
-    restore_env("ZARNO_LOCATION", saved_location_);
+    for (const std::string& dir : {home_, site_}) remove_tree(dir);
+    for (auto& [name, value] : saved_) value ? setenv(name, value->c_str(), 1) : unsetenv(name);
   }
 
-  static void write_prefs(const std::string& dir, const std::string& content, mode_t mode = 0644) {
-    ASSERT_TRUE(write_text_file(dir + "/.ZarnoPrefs", content));
+  // A preferences file in `dir` setting `name` to `value`.
+  static void write_prefs(const std::string& dir, const std::string& name, const std::string& value,
+                          mode_t mode = 0644) {
+    ASSERT_TRUE(write_text_file(dir + "/.ZarnoPrefs", name + " \"" + value + "\"\n"));
     ASSERT_EQ(chmod((dir + "/.ZarnoPrefs").c_str(), mode), 0);
   }
   static std::string lookup(const char* name) {
@@ -53,34 +47,28 @@ class PstTest : public ::testing::Test {
     return v != nullptr ? v : "(null)";
   }
 
-  const std::optional<std::string> saved_home_ = get_env("HOME");
-  const std::optional<std::string> saved_location_ = get_env("ZARNO_LOCATION");
+  const std::pair<const char*, std::optional<std::string>> saved_[2] = {
+      {"HOME", get_env("HOME")}, {"ZARNO_LOCATION", get_env("ZARNO_LOCATION")}};
   std::string home_, site_;
 };
 
 // A writable site file, else the user's, else the site file.
 TEST_F(PstTest, PrefsFileChoice) {
-  ASSERT_EQ(chmod(home_.c_str(), 0755), 0);
-  ASSERT_EQ(chmod(site_.c_str(), 0755), 0);
+  for (const std::string& dir : {home_, site_}) ASSERT_EQ(chmod(dir.c_str(), 0755), 0);
   for (auto [site_mode, user_file, expected] : {std::tuple{0666, true, "/site/ctl"},
                                                 {0444, true, "/user/ctl"},
                                                 {0444, false, "/site/ctl"}}) {
     unlink((home_ + "/.ZarnoPrefs").c_str());
-    write_prefs(site_, prefs_line("ZARNO_RNDCTL_LOCATION", "/site/ctl"), site_mode);
-    if (user_file) write_prefs(home_, prefs_line("ZARNO_RNDCTL_LOCATION", "/user/ctl"));
+    write_prefs(site_, "ZARNO_RNDCTL_LOCATION", "/site/ctl", site_mode);
+    if (user_file) write_prefs(home_, "ZARNO_RNDCTL_LOCATION", "/user/ctl");
     // Looked up in a child that cannot override file permissions, so that a
     // read-only file is read-only for it; its exit code is the answer.
-    static const char* want;
-    want = expected;
-    int status = race_children(
-                     1,
-                     [](int, void*) {
-                       if (geteuid() == 0 && (setgid(65534) != 0 || setuid(65534) != 0)) return 2;
-                       const char* v = get_zarno_variable("ZARNO_RNDCTL_LOCATION");
-                       return v != nullptr && strcmp(v, want) == 0 ? 0 : 1;
-                     },
-                     nullptr)[0]
-                     .status;
+    auto child = [](int, void* want) {
+      if (geteuid() == 0 && (setgid(65534) != 0 || setuid(65534) != 0)) return 2;
+      const char* v = get_zarno_variable("ZARNO_RNDCTL_LOCATION");
+      return v != nullptr && strcmp(v, static_cast<const char*>(want)) == 0 ? 0 : 1;
+    };
+    int status = race_children(1, child, const_cast<char*>(expected))[0].status;
     ASSERT_TRUE(WIFEXITED(status));
     if (WEXITSTATUS(status) == 2) GTEST_SKIP() << "cannot drop privileges";
     EXPECT_EQ(WEXITSTATUS(status), 0) << site_mode << user_file;
@@ -88,8 +76,7 @@ TEST_F(PstTest, PrefsFileChoice) {
 }
 
 TEST_F(PstTest, ExpandsFromTheEnvironment) {
-  setenv("PST_A", "a", 1);
-  setenv("PST_EMPTY", "", 1);
+  for (auto [name, value] : {std::pair{"PST_A", "a"}, {"PST_EMPTY", ""}}) setenv(name, value, 1);
   setenv("PST_LONG", std::string(200, 'L').c_str(), 1);
   unsetenv("UNSET_VAR");
   // As written in the file, and what a lookup gives ("(null)": no value).
@@ -104,32 +91,26 @@ TEST_F(PstTest, ExpandsFromTheEnvironment) {
            {"   ", "(null)"},
            {"$UNSET_VAR", "(null)"},
            {"$PST_LONG$PST_LONG", std::string(255, 'L')}}) {  // cut at the buffer
-    write_prefs(site_, prefs_line("V", value));
+    write_prefs(site_, "V", value);
     pst_reset_cache();
     EXPECT_EQ(lookup("V"), expected) << value;
   }
 }
 
-TEST_F(PstTest, UnknownVariableAndUnreadableFileYieldNull) {
-  write_prefs(site_, prefs_line("KNOWN", "yes"));
+// The default project comes from the browser's file, never the preferences.
+TEST_F(PstTest, UnknownVariableAndUnreadableFileYieldNullAndTheDefaultProjectNeverAsks) {
+  write_prefs(site_, "KNOWN", "yes");
   EXPECT_EQ(lookup("UNKNOWN"), "(null)");
   EXPECT_EQ(get_zarno_variable(nullptr), nullptr);
-
   pst_reset_cache();
-  setenv("ZARNO_LOCATION", (site_ + "/missing").c_str(), 1);
-  testing::internal::CaptureStderr();
-  EXPECT_EQ(lookup("KNOWN"), "(null)");
-  EXPECT_EQ(testing::internal::GetCapturedStderr(),
-            "Unable to read Zarno Preferences file (" + site_ + "/missing/.ZarnoPrefs).\n");
-}
-
-TEST_F(PstTest, DefaultProjectComesFromTheBrowserFileNeverThePrefs) {
-  // A preferences file that cannot be read would complain if it were asked.
   setenv("ZARNO_LOCATION", (site_ + "/missing").c_str(), 1);
   testing::internal::CaptureStderr();
   EXPECT_EQ(lookup("zarno_Default_Project"), "demo");
   EXPECT_EQ(testing::internal::GetCapturedStderr(), "");
-
+  testing::internal::CaptureStderr();
+  EXPECT_EQ(lookup("KNOWN"), "(null)");
+  EXPECT_EQ(testing::internal::GetCapturedStderr(),
+            "Unable to read Zarno Preferences file (" + site_ + "/missing/.ZarnoPrefs).\n");
   ASSERT_TRUE(
       write_text_file(home_ + "/.ZarnoBrowserPrefs",
                       "CURRENT_PROJECT \"first\"\nOTHER_KEY \"other\"\n"

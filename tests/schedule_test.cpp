@@ -1,5 +1,6 @@
 // Week grids: filling them from entries, taking blocks back out, and the
 // checks against a clock that the tests set.
+#include <algorithm>
 #include <cstdlib>
 #include <ctime>
 #include <string>
@@ -11,11 +12,6 @@ namespace {
 
 time_t fake_now = 0;
 
-// 2024-01-07 was a Sunday.
-time_t week_time(int day, int hour, int minute) {
-  return 1704585600 + day * 86400 + hour * 3600 + minute * 60;
-}
-
 class ScheduleTest : public ControlDirTest {
  protected:
   void SetUp() override {
@@ -24,11 +20,15 @@ class ScheduleTest : public ControlDirTest {
     tzset();
     rj_clock = [] { return fake_now; };
   }
-  void at(int day, int hour, int minute) { fake_now = week_time(day, hour, minute); }
-  // This host's position in the week and the seconds it would sleep from there.
+  // A time of the week starting on 2024-01-07, a Sunday.
+  void at(int day, int hour, int minute) {
+    fake_now = 1704585600 + day * 86400 + hour * 3600 + minute * 60;
+  }
+  // This host's position in the week and the seconds it would sleep from there
+  // (none when it is not locked).
   static std::pair<int, int> check() {
     int now = Dev_schedule_check("testhost");
-    return {now, get_next_available_time("testhost", now)};
+    return {now, now < 0 ? 0 : get_next_available_time("testhost", now)};
   }
 };
 
@@ -39,17 +39,14 @@ struct Entry {
 
 // What the writer would print for a grid: the blocks in order.
 std::vector<std::string> blocks_of(const int* grid) {
-  int scratch[RJ_WEEK_SCAN];
+  int scratch[RJ_WEEK_SCAN], times[2];
   std::copy(grid, grid + RJ_WEEK_SCAN, scratch);
   std::vector<std::string> out;
-  int times[2];
   const char* days[2];
-  while (Schedule_get_a_block(scratch, times, days) != 0) {
-    char text[80];
+  for (char text[80]; Schedule_get_a_block(scratch, times, days) != 0; out.push_back(text)) {
     bool one_day = std::string(days[0]) == days[1];
     snprintf(text, sizeof text, "{ %d to %d %s%s%s }", times[0], times[1], days[0],
              one_day ? "" : " to ", one_day ? "" : days[1]);
-    out.push_back(text);
   }
   return out;
 }
@@ -76,18 +73,15 @@ TEST(BlockRoundTrip, EntriesComeBackAsBlocks) {
     Job job;
     for (const Entry& e : entries) {
       // The parser keeps only entries whose day words are days.
-      const char* first = Schedule_get_day(e.first);
-      const char* last = Schedule_get_day(e.last);
+      const char *first = Schedule_get_day(e.first), *last = Schedule_get_day(e.last);
       if (first == nullptr || last == nullptr) continue;
       Schedule_dev_lock(&dev, e.start, e.end, first, last);
       Schedule_job_runs(&job, e.start, e.end, first, last);
     }
-    int set = 0;
-    for (int i = 0; i < RJ_WEEK_SCAN; i++) set += dev.locks[i] != 0;
-    EXPECT_EQ(set, slots_set) << entries[0].start;
-    EXPECT_EQ(dev.locks[RJ_WEEK], 0);
-    EXPECT_EQ(blocks_of(dev.locks), blocks);
-    EXPECT_EQ(blocks_of(job.runs), blocks);
+    int set = RJ_WEEK_SCAN - std::count(dev.locks, dev.locks + RJ_WEEK_SCAN, 0);
+    EXPECT_EQ(std::tuple(set, dev.locks[RJ_WEEK], blocks_of(dev.locks), blocks_of(job.runs)),
+              std::tuple(slots_set, 0, blocks, blocks))
+        << entries[0].start << " " << entries[0].first;
   }
 }
 
@@ -104,9 +98,9 @@ TEST_F(ScheduleTest, ClockPosition) {
   Schedule_dev_lock(Dev_new(nullptr, nullptr, "d", 1), 0, 2400, "sunday", "saturday");
   last_float_time_index = 12.0f;
   fake_now = static_cast<time_t>(1) << 62;
-  EXPECT_EQ(get_current_schedule_index(), -1);
-  EXPECT_FLOAT_EQ(last_float_time_index, 12.0f);
-  EXPECT_EQ(Dev_schedule_check("testhost"), -1);
+  EXPECT_EQ((std::tuple{get_current_schedule_index(), last_float_time_index,
+                        Dev_schedule_check("testhost")}),
+            std::tuple(-1, 12.0f, -1));
 }
 
 TEST_F(ScheduleTest, JobRunStates) {
@@ -114,59 +108,44 @@ TEST_F(ScheduleTest, JobRunStates) {
   Schedule_job_runs(job, 800, 1200, "monday", "monday");
   at(1, 9, 0);
   const int expected[] = {0, 1, 2, 2, 2};  // unset, paused, available, schedule (in), now
-  for (int state = RUN_UNSET; state <= RUN_NOW; state++) {
-    job->ctrl = state;
-    EXPECT_EQ(Job_available(job), expected[state]) << state;
-  }
-  job->ctrl = RUN_SCHEDULE;
+  for (int state = RUN_UNSET; state <= RUN_NOW; state++)
+    EXPECT_EQ((job->ctrl = state, Job_available(job)), expected[state]) << state;
   at(1, 12, 0);
-  EXPECT_EQ(Job_schedule_check(job), 0);
-  job->ctrl = 9;
-  EXPECT_EQ(Job_schedule_check(job), 0);
+  for (int ctrl : {int(RUN_SCHEDULE), 9}) EXPECT_EQ((job->ctrl = ctrl, Job_schedule_check(job)), 0);
 }
 
-TEST_F(ScheduleTest, SaturdayNightLockWakesAtTheWeekBoundary) {
-  Dev* dev = Dev_new(nullptr, nullptr, "night", 1);
-  Schedule_dev_lock(dev, 2200, 2400, "saturday", "saturday");
-  Schedule_dev_lock(dev, 0, 600, "sunday", "sunday");
-  dev->status = LOCK_SCHEDULE;
-
-  at(6, 23, 10);
-  // 50 minutes to the end of the week, less the float rounding of 23:10.
-  EXPECT_EQ(check(), std::pair(334, 2999));
-  at(0, 0, 0);
-  EXPECT_EQ(check(), std::pair(0, 6 * 3600));
-
-  at(0, 6, 0);
-  EXPECT_EQ(Dev_schedule_check("testhost"), -1);
-  EXPECT_EQ(Dev_schedule_check("otherhost"), -1);
-}
-
-TEST_F(ScheduleTest, LockedStateSleepsToTheNextHalfHour) {
-  Dev* dev = Dev_new(nullptr, nullptr, "locked", 1);
-  dev->status = LOCK_LOCKED;
-  at(2, 14, 0);
-  EXPECT_EQ(check(), std::pair(2 * 48 + 28, 1800));
-
-  // An available resource is never locked, whatever its grid says.
-  dev->status = LOCK_AVAILABLE;
-  Schedule_dev_lock(dev, 0, 2400, "sunday", "saturday");
-  EXPECT_EQ(Dev_schedule_check("testhost"), -1);
-
-  // Locked all week: the clear week's-end position is where it wakes.
-  dev->status = LOCK_SCHEDULE;
-  EXPECT_EQ(check(), std::pair(2 * 48 + 28, (336 - 2 * 48 - 28) * 1800));
+// Where a resource's lock state and grid put this host in the week and how
+// long it sleeps: to the week's boundary (less the float rounding of 23:10),
+// the next half hour, the clear week's end, or not at all (AVAILABLE never is).
+TEST_F(ScheduleTest, LockedResourcesWakeWhereTheirLockEnds) {
+  const std::vector<Entry> night = {{2200, 2400, "saturday", "saturday"},
+                                    {0, 600, "sunday", "sunday"}};
+  const std::vector<Entry> week = {{0, 2400, "sunday", "saturday"}};
+  const std::tuple<int, std::vector<Entry>, int, int, int, std::pair<int, int>> rows[] = {
+      {LOCK_SCHEDULE, night, 6, 23, 10, {334, 2999}},
+      {LOCK_SCHEDULE, night, 0, 0, 0, {0, 6 * 3600}},
+      {LOCK_SCHEDULE, night, 0, 6, 0, {-1, 0}},
+      {LOCK_LOCKED, {}, 2, 14, 0, {2 * 48 + 28, 1800}},
+      {LOCK_SCHEDULE, week, 2, 14, 0, {2 * 48 + 28, (336 - 2 * 48 - 28) * 1800}},
+      {LOCK_AVAILABLE, week, 2, 14, 0, {-1, 0}}};
+  for (const auto& [status, locks, day, hour, minute, wakes] : rows) {
+    Dev* dev = Dev_new(nullptr, nullptr, "d", 1);
+    dev->status = status;
+    for (const Entry& e : locks) Schedule_dev_lock(dev, e.start, e.end, e.first, e.last);
+    at(day, hour, minute);
+    EXPECT_EQ(check(), wakes) << status << " " << locks.size() << " at " << day << " " << hour;
+    EXPECT_EQ(Dev_schedule_check("otherhost"), -1);
+    Dev_del(dev);
+  }
 }
 
 TEST_F(ScheduleTest, TwoResourcesForOneHost) {
-  Dev* a = Dev_new(nullptr, nullptr, "A", 1);
-  Dev* b = Dev_new(nullptr, nullptr, "B", 2);
+  Dev *a = Dev_new(nullptr, nullptr, "A", 1), *b = Dev_new(nullptr, nullptr, "B", 2);
   Schedule_dev_lock(a, 800, 1200, "monday", "monday");
   Schedule_dev_lock(b, 1200, 1400, "monday", "monday");
 
   at(1, 9, 0);
   EXPECT_EQ(check(), std::pair(66, 5 * 3600));
-
   // With B first, the scan stops at B's clear slot before A is looked at,
   // and stops short at noon; the check at noon finds B locked.
   Dev_del(b);

@@ -33,15 +33,15 @@ struct Event {
   std::string target;   // host, or job for a restart
   double before, down;  // seconds of work before the fault; the host stays down or frozen
   long long at_ns = 0;
+  long long back_ns() const { return at_ns + static_cast<long long>(down * 1e9); }
+  bool kills() const { return fault == Fault::kKillDaemon || fault == Fault::kPowerCut; }
 };
 
 // Every kind of fault at least once, then a few more, in a seeded order.
 std::vector<Event> plan(unsigned seed, const std::vector<std::string>& hosts,
                         const std::vector<std::string>& jobs) {
   std::mt19937 rng(seed);
-  auto uniform = [&](double lo, double hi) {
-    return std::uniform_real_distribution<double>(lo, hi)(rng);
-  };
+  auto uniform = [&](double lo, double hi) { return std::uniform_real_distribution(lo, hi)(rng); };
   std::vector<Fault> faults = {Fault::kKillDaemon, Fault::kPowerCut,   Fault::kFreeze,
                                Fault::kRestartJob, Fault::kKillDaemon, Fault::kPowerCut};
   std::shuffle(faults.begin(), faults.end(), rng);
@@ -65,9 +65,8 @@ std::string without_group(const std::string& tasks, const std::string& job, bool
   while (std::getline(in, line)) {
     if (!line.empty() && line[0] != '\t') inside = line.rfind(job + "\t", 0) == 0;
     if (!inside) out += line + "\n";
-    if (inside &&
-        (line.find("STARTED") != std::string::npos || line.find("RUNNING") != std::string::npos))
-      *active = true;
+    *active |= inside && (line.find("STARTED") != std::string::npos ||
+                          line.find("RUNNING") != std::string::npos);
   }
   return out;
 }
@@ -86,10 +85,8 @@ long long restart_job(FarmHosts& hosts, Farm& farm, const std::string& job, std:
           30))
     return fail("tasks still in flight 30 s after the restart:\n" + farm.read("Render_Tasks"));
   if (!take_lock(farm, "Render_Job_Control")) return fail("the job file's lock was never free");
-  if (!take_lock(farm, "Render_Tasks")) {
-    drop_lock(farm, "Render_Job_Control");
-    return fail("the task file's lock was never free");
-  }
+  if (!take_lock(farm, "Render_Tasks"))
+    return drop_lock(farm, "Render_Job_Control"), fail("the task file's lock was never free");
   farm.write("Render_Tasks", without_group(farm.read("Render_Tasks"), job, &active));
   std::string block = job_block(farm, job), text = farm.read("Render_Job_Control");
   std::string fresh =
@@ -110,22 +107,19 @@ long long restart_job(FarmHosts& hosts, Farm& farm, const std::string& job, std:
 // continued.
 bool excused(const std::vector<Stamp>& stamps, const std::vector<Event>& events,
              std::map<std::string, int>& max_frames) {
+  // A render forked just before the kill stamps its start a moment after.
+  const long long spawn_slack = 100000000;
   for (const Stamp& s : stamps) {
     long long window = static_cast<long long>((max_frames[s.host] * kFrameSeconds + 1.0) * 1e9);
     long long seen_end = s.end_ns;
-    for (const Event& e : events) {
-      long long thaw = e.at_ns + static_cast<long long>(e.down * 1e9);
+    for (const Event& e : events)
       if (e.fault == Fault::kFreeze && e.target == s.host && e.at_ns <= s.end_ns &&
-          s.end_ns <= thaw)
-        seen_end = thaw;
-    }
-    for (const Event& e : events) {
-      // A render forked just before the kill stamps its start a moment after.
-      const long long spawn_slack = 100000000;
-      if ((e.fault == Fault::kKillDaemon || e.fault == Fault::kPowerCut) && e.target == s.host &&
-          s.start_ns <= e.at_ns + spawn_slack && seen_end >= e.at_ns - window)
+          s.end_ns <= e.back_ns())
+        seen_end = e.back_ns();
+    for (const Event& e : events)
+      if (e.kills() && e.target == s.host && s.start_ns <= e.at_ns + spawn_slack &&
+          seen_end >= e.at_ns - window)
         return true;
-    }
   }
   return false;
 }
@@ -139,24 +133,21 @@ void run(unsigned seed, const SshServer* ssh) {
   std::vector<std::string> job_names = {"alpha", "beta"};
   std::map<std::string, int> max_frames;
   std::vector<ResourceSpec> resources;
-  for (int i = 0; i < 4; ++i) {
-    max_frames[names[i]] = 1 + i % 2;
-    resources.push_back({names[i], i + 1, max_frames[names[i]], i == 0 ? 2 : 1, "AVAILABLE", ""});
-  }
+  for (int i = 0; i < 4; ++i)
+    resources.push_back({names[i], i + 1, max_frames[names[i]] = 1 + i % 2, i == 0 ? 2 : 1});
   std::vector<JobSpec> jobs;
-  for (int i = 0; i < 2; ++i)
-    jobs.push_back({.name = job_names[i],
-                    .index = i + 1,
-                    .end = kFrames,
-                    .opts = "sleep=" + std::to_string(kFrameSeconds) +
-                            " stamp=" + farm.path("../stamps." + job_names[i]),
-                    .hosts = names,
-                    .executable = "stamp_render"});
+  for (const std::string& j : job_names) {
+    jobs.push_back({.name = j, .index = int(jobs.size()) + 1, .end = kFrames, .hosts = names});
+    jobs.back().opts =
+        "sleep=" + std::to_string(kFrameSeconds) + " stamp=" + farm.path("../stamps." + j);
+    jobs.back().executable = "stamp_render";
+  }
   farm.write("Render_Resource_Control", resource_file(resources));
   farm.write("Render_Job_Control", job_file(jobs, scene));
 
   auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(int(kRunBound));
   long long begun_ns = wall_ns();
+  auto ms = [&](long long ns) { return std::to_string((ns - begun_ns) / 1000000) + " ms"; };
   for (const auto& h : names)
     ASSERT_TRUE(hosts.start(h)) << h << " did not start:\n"
                                 << read_text_file(hosts.daemon(h)->tmpdir + "/early")
@@ -168,8 +159,8 @@ void run(unsigned seed, const SshServer* ssh) {
   for (Event& e : events) {
     hosts.wait_until([] { return false; }, e.before);
     e.at_ns = wall_ns();
-    story << "  " << (e.at_ns - begun_ns) / 1000000 << " ms: " << kFaultNames[int(e.fault)] << " "
-          << e.target << " (" << e.down << " s)\n";
+    story << "  " << ms(e.at_ns) << ": " << kFaultNames[int(e.fault)] << " " << e.target << " ("
+          << e.down << " s)\n";
     Daemon* d = e.fault == Fault::kRestartJob ? nullptr : hosts.daemon(e.target);
     if (e.fault == Fault::kKillDaemon) {
       // The daemon alone: its renders run on, orphaned.
@@ -187,7 +178,7 @@ void run(unsigned seed, const SshServer* ssh) {
       EXPECT_NE(from, 0) << "restart of " << e.target << ": " << trouble;
       counts_from[e.target] = from != 0 ? from : wall_ns();
     }
-    if (e.fault == Fault::kKillDaemon || e.fault == Fault::kPowerCut) {
+    if (e.kills()) {
       hosts.wait_until([] { return false; }, e.down);
       EXPECT_TRUE(hosts.start(e.target)) << e.target << " did not start again";
     }
@@ -195,19 +186,17 @@ void run(unsigned seed, const SshServer* ssh) {
   SCOPED_TRACE("faults:\n" + story.str());
 
   double left = std::chrono::duration<double>(deadline - std::chrono::steady_clock::now()).count();
-  bool finished = hosts.wait_until(
-      [&] {
-        return job_status(farm, "alpha") == "finished" && job_status(farm, "beta") == "finished";
-      },
-      std::max(left, 0.0));
+  auto finished = [&](const std::string& j) { return job_status(farm, j) == "finished"; };
+  bool all_finished = hosts.wait_until([&] { return std::ranges::all_of(job_names, finished); },
+                                       std::max(left, 0.0));
   std::string logs;
   for (const auto& h : names) {
     std::string log = hosts.daemon(h)->log();  // one read: the log still grows
     logs += "--- " + h + " log tail:\n" + log.substr(log.size() > 600 ? log.size() - 600 : 0);
   }
-  EXPECT_TRUE(finished) << "not finished within " << kRunBound << " s: a host waited on a lock "
-                        << "left by a dead one, or work was lost\n"
-                        << farm.read("Render_Tasks") << logs;
+  EXPECT_TRUE(all_finished) << "not finished within " << kRunBound << " s: a host waited on a lock "
+                            << "left by a dead one, or work was lost\n"
+                            << farm.read("Render_Tasks") << logs;
 
   // Frames since each job's last restart; a second rendering is excused only
   // where a host died with the frame's task in flight.
@@ -217,15 +206,14 @@ void run(unsigned seed, const SshServer* ssh) {
       if (s.start_ns >= counts_from[j]) by_frame[static_cast<int>(s.frame)].push_back(s);
     std::string missing;
     for (int f = 1; f <= kFrames; ++f)
-      if (by_frame[f].empty()) missing += " " + std::to_string(f);
+      missing += by_frame[f].empty() ? " " + std::to_string(f) : "";
     EXPECT_TRUE(missing.empty()) << j << " frames never rendered since its last restart:" << missing
                                  << "\njob log:\n"
                                  << farm.read("JOBLOG/" + j) << logs;
     for (const auto& [frame, stamps] : by_frame) {
       std::string seen;
       for (const Stamp& s : stamps)
-        seen += " " + s.host + "@" + std::to_string((s.start_ns - begun_ns) / 1000000) + "-" +
-                std::to_string((s.end_ns - begun_ns) / 1000000) + "ms";
+        seen += " " + s.host + "@" + ms(s.start_ns) + "-" + ms(s.end_ns);
       EXPECT_TRUE(stamps.size() < 2 || excused(stamps, events, max_frames))
           << j << " frame " << frame << " rendered " << stamps.size()
           << " times with no host dying in flight:" << seen;
@@ -235,10 +223,7 @@ void run(unsigned seed, const SshServer* ssh) {
   std::vector<std::string> stuck = hosts.shut_down(30);
   EXPECT_TRUE(stuck.empty()) << stuck.size() << " daemon(s) did not leave within 30 s of an "
                              << "operator's stop (waiting on a lock?), first " << stuck[0];
-  std::string locks;
-  for (const std::string& name : dir_names(farm.dir()))
-    if (name.ends_with(".lock")) locks += " " + name;
-  EXPECT_EQ(locks, "") << "lock directories left";
+  EXPECT_EQ(lock_dirs(farm), std::vector<std::string>{}) << "lock directories left";
   EXPECT_TRUE(wait_for([&] { return hosts.renders_left().empty(); }, 10))
       << hosts.renders_left().size() << " render(s) left running";
 }
@@ -261,9 +246,8 @@ TEST_P(ChaosTest, JobsFinishWithEveryFrameThroughKillsPowerCutsFreezesAndRestart
     run(static_cast<unsigned>(strtoul(seed.c_str(), nullptr, 10)), network ? &ssh : nullptr);
 }
 
-INSTANTIATE_TEST_SUITE_P(Mounts, ChaosTest, ::testing::Values(false, true),
-                         [](const ::testing::TestParamInfo<bool>& info) {
-                           return info.param ? std::string("Sshfs") : std::string("Local");
-                         });
+INSTANTIATE_TEST_SUITE_P(Mounts, ChaosTest, ::testing::Values(false, true), [](const auto& info) {
+  return std::string(info.param ? "Sshfs" : "Local");
+});
 
 }  // namespace

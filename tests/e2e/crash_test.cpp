@@ -2,30 +2,25 @@
 // leaves no render running: the real daemon, killed and restarted on the
 // same control directory.
 #include <fcntl.h>
+#include <gmock/gmock.h>
 #include <signal.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdio>
 #include <cstring>
+#include <tuple>
 
 #include "tests/e2e/render_farm.h"
 #include "tests/support/task_text.h"
 
 namespace {
 
-bool any_held(Farm& farm) {
-  for (const FileRec& r : task_records(farm))
-    if (r.held()) return true;
-  return false;
-}
+using testing::HasSubstr;
 
-std::vector<std::string> lock_dirs(Farm& farm) {
-  std::vector<std::string> locks = dir_names(farm.dir());
-  std::erase_if(locks, [](const std::string& name) { return !name.ends_with(".lock"); });
-  return locks;
-}
+bool any_held(Farm& farm) { return std::ranges::any_of(task_records(farm), &FileRec::held); }
 
 // Gone, or a zombie nobody has reaped yet.
 bool process_gone(int pid) {
@@ -36,10 +31,6 @@ bool process_gone(int pid) {
 
 class CrashTest : public ::testing::Test {
  protected:
-  void SetUp() override {
-    host_ = this_host_name();
-    scene_ = make_project(farm_);
-  }
   // This host's resource and a job of frames 1 to 6 on it.
   void write_farm(const std::string& opts) {
     farm_.write("Render_Resource_Control", resource_file({{host_, 1, 6, 1}}));
@@ -48,24 +39,30 @@ class CrashTest : public ::testing::Test {
   std::string image(int frame) { return farm_.path("project/pix/spin." + std::to_string(frame)); }
   bool rendered(int frame) { return access(image(frame).c_str(), F_OK) == 0; }
   bool finished(Daemon& d) {
-    return wait_for([&] { return job_status(farm_, "spin") == "finished" || d.ended(); }, 120,
-                    &d) &&
-           job_status(farm_, "spin") == "finished";
+    wait_for([&] { return job_status(farm_, "spin") == "finished" || d.ended(); }, 120, &d);
+    return job_status(farm_, "spin") == "finished";
   }
   // The one render program the daemon runs, once its task is RUNNING.
   int running_render(Daemon& d) {
-    bool running = wait_for(
-        [&] {
-          std::string t = farm_.read("Render_Tasks");
-          return t.find("RUNNING") != std::string::npos && !children_of(d.pid).empty();
-        },
-        60, &d);
+    auto running = [&] { return farm_.read("Render_Tasks").find("RUNNING") != std::string::npos; };
+    bool ran = wait_for([&] { return running() && !children_of(d.pid).empty(); }, 60, &d);
     std::vector<int> kids = children_of(d.pid);
-    return running && kids.size() == 1 ? kids[0] : -1;
+    return ran && kids.size() == 1 ? kids[0] : -1;
+  }
+
+  // Inode and change time of the images before frame `end` (a frame painted again has others).
+  std::vector<std::tuple<ino_t, time_t, long>> images_before(int end) {
+    std::vector<std::tuple<ino_t, time_t, long>> out;
+    for (int frame = 1; frame < end; ++frame) {
+      struct stat st {};
+      stat(image(frame).c_str(), &st);
+      out.emplace_back(st.st_ino, st.st_mtim.tv_sec, st.st_mtim.tv_nsec);
+    }
+    return out;
   }
 
   Farm farm_;
-  std::string host_, scene_;
+  std::string host_ = this_host_name(), scene_ = make_project(farm_);
 };
 
 TEST_F(CrashTest, ARestartedDaemonEndsTheOldRenderAndRendersTheRestFromTheFrameReached) {
@@ -79,24 +76,16 @@ TEST_F(CrashTest, ARestartedDaemonEndsTheOldRenderAndRendersTheRestFromTheFrameR
   ASSERT_TRUE(wait_for([&] { return rendered(2); }, 60)) << first.log();
   utimensat(AT_FDCWD, farm_.path(host_ + ".pid").c_str(), nullptr, 0);
   float reached = 0;
-  ASSERT_TRUE(wait_for(
-      [&] {
-        for (const FileRec& r : task_records(farm_))
-          if (r.status == "RUNNING" && r.current > r.start) reached = r.current;
-        return reached > 0 && lock_dirs(farm_).empty();
-      },
-      30))
-      << farm_.read("Render_Tasks");
-  kill(first.pid, SIGKILL);
-  ASSERT_TRUE(wait_for([&] { return first.ended(); }, 10));
+  auto recorded = [&] {
+    for (const FileRec& r : task_records(farm_))
+      if (r.status == "RUNNING" && r.current > r.start) reached = r.current;
+    return reached > 0 && lock_dirs(farm_).empty();
+  };
+  ASSERT_TRUE(wait_for(recorded, 30)) << farm_.read("Render_Tasks");
+  ASSERT_TRUE(kill(first.pid, SIGKILL) == 0 && wait_for([&] { return first.ended(); }, 10));
   EXPECT_FALSE(process_gone(render)) << "the render outlives its daemon";
   // Frames the task file counts as done must not be painted again.
-  std::vector<struct stat> done;
-  for (int frame = 1; frame < static_cast<int>(reached); ++frame) {
-    struct stat st {};
-    EXPECT_EQ(stat(image(frame).c_str(), &st), 0) << frame;
-    done.push_back(st);
-  }
+  auto done = images_before(static_cast<int>(reached));
 
   // The same host again, with the same temporary directory.
   Daemon& second = farm_.start_on_farm({}, "", {render_env()[0], "DRCTMPDIR=" + first.tmpdir});
@@ -105,17 +94,11 @@ TEST_F(CrashTest, ARestartedDaemonEndsTheOldRenderAndRendersTheRestFromTheFrameR
   ASSERT_TRUE(finished(second)) << second.log() << farm_.read("Render_Tasks");
 
   for (int frame = 1; frame <= 6; ++frame) EXPECT_TRUE(rendered(frame)) << frame;
-  for (size_t i = 0; i < done.size(); ++i) {
-    struct stat st {};
-    ASSERT_EQ(stat(image(static_cast<int>(i) + 1).c_str(), &st), 0);
-    EXPECT_TRUE(st.st_ino == done[i].st_ino && st.st_mtim.tv_sec == done[i].st_mtim.tv_sec &&
-                st.st_mtim.tv_nsec == done[i].st_mtim.tv_nsec)
-        << "frame " << i + 1 << " was rendered again";
-  }
+  EXPECT_EQ(images_before(static_cast<int>(reached)), done) << "a done frame was rendered again";
   // The old task was cut where it had got to: done frames stay done.
-  std::string log = farm_.read("JOBLOG/spin");
-  EXPECT_EQ(log.find(" 1.000000 - 6.000000\t"), std::string::npos) << log;
-  EXPECT_NE(log.find("\t0\t 1.000000 - "), std::string::npos) << log;
+  EXPECT_THAT(farm_.read("JOBLOG/spin"),
+              testing::AllOf(HasSubstr("\t0\t 1.000000 - "),
+                             testing::Not(HasSubstr(" 1.000000 - 6.000000\t"))));
   EXPECT_FALSE(any_held(farm_)) << farm_.read("Render_Tasks");
   // Only the live daemon's own passes may still take a lock now and then.
   EXPECT_TRUE(wait_for([&] { return lock_dirs(farm_).empty(); }, 30));
@@ -129,11 +112,10 @@ TEST_F(CrashTest, ACleanExitEndsItsRenderAndPutsTheTaskBack) {
   ASSERT_GT(render, 0) << d.log();
 
   ASSERT_EQ(unlink(farm_.path(host_ + ".pid").c_str()), 0);
-  d.wake();
-  ASSERT_TRUE(wait_for([&] { return d.ended(); }, 30));
+  ASSERT_TRUE((d.wake(), wait_for([&] { return d.ended(); }, 30)));
   EXPECT_TRUE(wait_for([&] { return process_gone(render); }, 30));
-  EXPECT_FALSE(any_held(farm_)) << farm_.read("Render_Tasks");
-  EXPECT_NE(farm_.read("Render_Tasks").find("PENDING"), std::string::npos);
+  EXPECT_TRUE(!any_held(farm_) && farm_.read("Render_Tasks").find("PENDING") != std::string::npos)
+      << farm_.read("Render_Tasks");
   EXPECT_TRUE(lock_dirs(farm_).empty()) << "the exit left a lock behind";
 }
 
@@ -145,8 +127,7 @@ TEST_F(CrashTest, AFatalExitOnABadControlFileLeavesNoLockBehind) {
   Daemon& d = farm_.start_on_farm({}, "", render_env());
   ASSERT_TRUE(wait_for([&] { return d.ended(); }, 60)) << d.log();
   EXPECT_TRUE(WIFSIGNALED(d.status) || d.exit_code() != 0) << d.status;
-  std::string said = read_text_file(d.tmpdir + "/early") + d.log();
-  EXPECT_NE(said.find("Syntax error: line 4 of "), std::string::npos) << said;
+  EXPECT_THAT(read_text_file(d.tmpdir + "/early") + d.log(), HasSubstr("Syntax error: line 4 of "));
   EXPECT_EQ(lock_dirs(farm_), std::vector<std::string>{});
 }
 
@@ -165,10 +146,8 @@ TEST_F(CrashTest, TasksOfAHostWhoseHeartbeatStoppedAreCutAndRenderedHere) {
   ASSERT_TRUE(finished(d)) << d.log() << farm_.read("Render_Tasks");
   EXPECT_TRUE(rendered(3) && rendered(4));
   EXPECT_FALSE(rendered(1)) << "frames the ghost had done are not rendered again";
-  std::string access = farm_.read("Render_Access");
-  EXPECT_NE(access.find("* put back task 0 of \"spin\" from host ghost: no heartbeat for 36"),
-            std::string::npos)
-      << access;
+  EXPECT_THAT(farm_.read("Render_Access"),
+              HasSubstr("* put back task 0 of \"spin\" from host ghost: no heartbeat for 36"));
 }
 
 }  // namespace

@@ -13,19 +13,16 @@
 #include <thread>
 
 std::string this_host_name() {
-  char host[64];
-  if (gethostname(host, sizeof host) != 0) return "";
-  host[sizeof host - 1] = '\0';
-  return host;
+  char host[64] = {};
+  return gethostname(host, sizeof host - 1) == 0 ? host : "";
 }
 
 bool Daemon::in_loop() const {
   if (pid <= 0 || reaped) return false;
   std::string status = read_text_file("/proc/" + std::to_string(pid) + "/status");
   size_t at = status.find("SigCgt:");
-  if (at == std::string::npos) return false;
-  unsigned long long caught = strtoull(status.c_str() + at + 7, nullptr, 16);
-  return (caught & (1ULL << (SIGALRM - 1))) != 0;
+  return at != std::string::npos &&
+         (strtoull(status.c_str() + at + 7, nullptr, 16) & 1ULL << (SIGALRM - 1)) != 0;
 }
 
 void Daemon::wake() const {
@@ -53,33 +50,21 @@ void Daemon::stop() {
   if (pid <= 0 || reaped) return;
   std::vector<int> killed;
   kill_tree(pid, &killed);
-  if (waitpid(pid, &status, 0) == pid) reaped = true;
+  reaped = waitpid(pid, &status, 0) == pid;
   // Orphans are reaped by someone else: wait until they are really gone, so
   // that a probe of their pid no longer finds them.
-  wait_for(
-      [&] {
-        return std::none_of(killed.begin(), killed.end(), [](int p) {
-          return access(("/proc/" + std::to_string(p)).c_str(), F_OK) == 0;
-        });
-      },
-      10);
+  wait_for([&] { return std::ranges::all_of(killed, pid_gone); }, 10);
 }
 
 Farm::Farm() {
   const char* tmp = getenv("TMPDIR");
   std::string base = std::string(tmp != nullptr ? tmp : "/tmp") + "/rndctl_e2e_XXXXXX";
-  if (mkdtemp(base.data()) != nullptr) {
-    scratch_ = base;
-    dir_ = scratch_ + "/ctl";
-    mkdir(dir_.c_str(), 0777);
-  }
+  if (mkdtemp(base.data()) != nullptr) scratch_ = base, dir_ = base + "/ctl";
+  mkdir(dir_.c_str(), 0777);
 }
 
 Farm::~Farm() {
-  for (Daemon* d : daemons_) {
-    d->stop();  // with its renders, in process groups of their own
-    delete d;
-  }
+  for (auto& d : daemons_) d->stop();  // with its renders, in process groups of their own
   if (!scratch_.empty() && getenv("RJ_KEEP_TEST_DIRS") == nullptr) remove_tree(scratch_);
 }
 
@@ -92,8 +77,7 @@ Daemon& Farm::start(const std::vector<std::string>& args, const std::string& hos
   std::vector<std::string> argv;
   if (!host.empty() && host != this_host_name()) {
     argv = uts_unshare();
-    for (const char* a : {"/bin/sh", "-c", "hostname \"$0\" && exec \"$@\""}) argv.push_back(a);
-    argv.push_back(host);
+    argv.insert(argv.end(), {"/bin/sh", "-c", "hostname \"$0\" && exec \"$@\"", host});
   }
   argv.push_back(DAEMON_PATH);
   argv.insert(argv.end(), args.begin(), args.end());
@@ -102,23 +86,16 @@ Daemon& Farm::start(const std::vector<std::string>& args, const std::string& hos
 
 Daemon& Farm::run(std::vector<std::string> argv, const std::string& host,
                   const std::vector<std::string>& env) {
-  auto* d = new Daemon();
-  daemons_.push_back(d);
-  d->host = host;
-  d->tmpdir = scratch_ + "/tmp" + std::to_string(counter_++);
+  std::string tmpdir = scratch_ + "/tmp" + std::to_string(counter_++);
+  Daemon* d = daemons_.emplace_back(new Daemon{.host = host, .tmpdir = tmpdir}).get();
   mkdir(d->tmpdir.c_str(), 0777);
-  std::string early = d->tmpdir + "/early";
-
-  pid_t pid = fork();
-  if (pid == 0) {
+  d->pid = fork();
+  if (d->pid == 0) {
     setenv("DRCTMPDIR", d->tmpdir.c_str(), 1);
     unsetenv("RNDCTL_DEBUG");
     for (const auto& e : env) putenv(const_cast<char*>(e.c_str()));
-    int fd = open(early.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-    if (fd >= 0) {
-      dup2(fd, 1);
-      dup2(fd, 2);
-    }
+    int fd = open((d->tmpdir + "/early").c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    if (fd >= 0) dup2(fd, 1), dup2(fd, 2);
     // The daemon starts as from a boot script, with the three streams only:
     // what the test runner holds open is not the daemon's to pass on.
     for (int other = 3; other < 1024; ++other) close(other);
@@ -128,7 +105,6 @@ Daemon& Farm::run(std::vector<std::string> argv, const std::string& host,
     execv(cargv[0], cargv.data());
     _exit(127);
   }
-  d->pid = pid;
   return *d;
 }
 
@@ -141,15 +117,16 @@ Daemon& Farm::start_on_farm(const std::vector<std::string>& extra, const std::st
 
 bool wait_for(const std::function<bool()>& done, double seconds, Daemon* wake) {
   auto deadline = std::chrono::steady_clock::now() + std::chrono::duration<double>(seconds);
-  int round = 0;
-  while (std::chrono::steady_clock::now() < deadline) {
+  for (int round = 1; std::chrono::steady_clock::now() < deadline; ++round) {
     if (done()) return true;
     // Before its loop a daemon would die of SIGALRM: wake it only from then on.
-    if (wake != nullptr && ++round % 25 == 0 && wake->in_loop()) wake->wake();
+    if (wake != nullptr && round % 25 == 0 && wake->in_loop()) wake->wake();
     std::this_thread::sleep_for(std::chrono::milliseconds(10));
   }
   return done();
 }
+
+bool pid_gone(int pid) { return access(("/proc/" + std::to_string(pid)).c_str(), F_OK) != 0; }
 
 int count_of(const std::string& text, const std::string& needle) {
   int n = 0;
@@ -193,11 +170,9 @@ std::vector<int> children_of(int pid, int* zombies) {
     size_t close = stat.rfind(')');
     char state = 0;
     int ppid = 0;
-    if (atoi(name.c_str()) <= 0 || close == std::string::npos ||
-        sscanf(stat.c_str() + close + 1, " %c %d", &state, &ppid) != 2 || ppid != pid)
-      continue;
-    kids.push_back(atoi(name.c_str()));
-    z += state == 'Z';
+    if (atoi(name.c_str()) > 0 && close != std::string::npos &&
+        sscanf(stat.c_str() + close + 1, " %c %d", &state, &ppid) == 2 && ppid == pid)
+      kids.push_back(atoi(name.c_str())), z += state == 'Z';
   }
   if (zombies != nullptr) *zombies = z;
   return kids;

@@ -5,6 +5,7 @@
 #include <sys/types.h>
 
 #include <functional>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -67,7 +68,7 @@ class Farm {
   std::string dir_;
   std::string scratch_;
   int counter_ = 0;
-  std::vector<Daemon*> daemons_;
+  std::vector<std::unique_ptr<Daemon>> daemons_;
 };
 
 /// Polls `done` every few milliseconds, waking `daemon` (when given) now and
@@ -76,6 +77,9 @@ bool wait_for(const std::function<bool()>& done, double seconds, Daemon* wake = 
 
 /// Counts the occurrences of `needle` in `text`.
 int count_of(const std::string& text, const std::string& needle);
+
+/// True once no process of that pid exists (a zombie still does).
+bool pid_gone(int pid);
 
 /// Pids of a process's children, and how many of them are zombies.
 std::vector<int> children_of(int pid, int* zombies = nullptr);

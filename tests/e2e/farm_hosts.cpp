@@ -14,7 +14,8 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <thread>
+#include <fstream>
+#include <sstream>
 
 #include "tests/e2e/render_farm.h"
 
@@ -28,9 +29,8 @@ bool shell(const std::string& command) {
 int free_port() {
   int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
   if (fd < 0) return 0;
-  sockaddr_in addr{};
-  addr.sin_family = AF_INET;
-  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  sockaddr_in addr{
+      .sin_family = AF_INET, .sin_port = 0, .sin_addr = {htonl(INADDR_LOOPBACK)}, .sin_zero = {}};
   socklen_t len = sizeof addr;
   int port = 0;
   if (bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0 &&
@@ -53,26 +53,20 @@ std::vector<int> pids_where(const std::function<bool(int)>& keep) {
   return pids;
 }
 
-bool gone(int pid) { return access(("/proc/" + std::to_string(pid)).c_str(), F_OK) != 0; }
-
 }  // namespace
 
 long long wall_ns() {
-  struct timespec ts;
-  clock_gettime(CLOCK_REALTIME, &ts);
-  return static_cast<long long>(ts.tv_sec) * 1000000000LL + ts.tv_nsec;
+  auto since_epoch = std::chrono::system_clock::now().time_since_epoch();  // CLOCK_REALTIME
+  return std::chrono::duration_cast<std::chrono::nanoseconds>(since_epoch).count();
 }
 
 std::vector<Stamp> read_stamps(const std::string& path) {
   std::vector<Stamp> stamps;
-  FILE* fp = fopen(path.c_str(), "r");
-  if (fp == nullptr) return stamps;
-  char line[512], host[128];
-  Stamp s;
-  while (fgets(line, sizeof line, fp) != nullptr)
-    if (sscanf(line, "%127s %f %lld %lld", host, &s.frame, &s.start_ns, &s.end_ns) == 4)
-      stamps.push_back({host, s.frame, s.start_ns, s.end_ns});
-  fclose(fp);
+  std::ifstream in(path);
+  for (std::string line; std::getline(in, line);) {
+    std::istringstream fields(line);
+    if (Stamp s; fields >> s.host >> s.frame >> s.start_ns >> s.end_ns) stamps.push_back(s);
+  }
   return stamps;
 }
 
@@ -95,37 +89,30 @@ bool SshServer::start(std::string* why) {
   dir_ = base;
   mkdir("/run/sshd", 0755);  // sshd's privilege separation directory
   port_ = free_port();
-  if (port_ == 0 ||
-      !shell("ssh-keygen -q -t ed25519 -N '' -f '" + dir_ + "/host_key' </dev/null") ||
-      !shell("ssh-keygen -q -t ed25519 -N '' -f '" + dir_ + "/client_key' </dev/null") ||
-      !shell("cp '" + dir_ + "/client_key.pub' '" + dir_ + "/authorized_keys'")) {
-    *why = "could not make throw-away ssh keys";
-    return false;
-  }
-  std::string config = dir_ + "/sshd_config";
-  write_text_file(config, "ListenAddress 127.0.0.1\nPort " + std::to_string(port_) + "\nHostKey " +
-                              dir_ + "/host_key\nAuthorizedKeysFile " + dir_ +
-                              "/authorized_keys\nPermitRootLogin prohibit-password\n"
+  std::string keygen = "ssh-keygen -q -t ed25519 -N '' -f ";
+  if (port_ == 0 || !shell("cd '" + dir_ + "' && " + keygen + "host_key </dev/null && " + keygen +
+                           "client_key </dev/null && cp client_key.pub authorized_keys"))
+    return *why = "could not make throw-away ssh keys", false;
+  std::string config = dir_ + "/sshd_config", d = dir_;
+  write_text_file(config, "Port " + std::to_string(port_) + "\nHostKey " + d +
+                              "/host_key\nPidFile " + d + "/sshd.pid\nAuthorizedKeysFile " + d +
+                              "/authorized_keys\n" +
+                              "ListenAddress 127.0.0.1\nPermitRootLogin prohibit-password\n"
                               "PasswordAuthentication no\nKbdInteractiveAuthentication no\n"
-                              "UsePAM no\nStrictModes no\nPidFile " +
-                              dir_ +
-                              "/sshd.pid\nSubsystem sftp internal-sftp\nMaxStartups 200\n"
-                              "MaxSessions 200\nLogLevel ERROR\n");
+                              "UsePAM no\nStrictModes no\nSubsystem sftp internal-sftp\n"
+                              "MaxStartups 200\nMaxSessions 200\nLogLevel ERROR\n");
   std::string log = dir_ + "/sshd.log";
   pid_ = fork();
   if (pid_ == 0) {
     int fd = open(log.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-    dup2(fd, 1);
-    dup2(fd, 2);
+    dup2(fd, 1), dup2(fd, 2);
     execl("/usr/sbin/sshd", "/usr/sbin/sshd", "-D", "-e", "-f", config.c_str(),
           static_cast<char*>(nullptr));
     _exit(127);
   }
   // sshd writes its pid file once it listens.
-  if (!wait_for([&] { return access((dir_ + "/sshd.pid").c_str(), F_OK) == 0; }, 10)) {
-    *why = "sshd did not come up: " + read_text_file(log);
-    return false;
-  }
+  if (!wait_for([&] { return access((dir_ + "/sshd.pid").c_str(), F_OK) == 0; }, 10))
+    return *why = "sshd did not come up: " + read_text_file(log), false;
   // A trial mount in a throw-away mount namespace: FUSE may be there and
   // still refuse (no privileges in a container, say).
   std::string trial = dir_ + "/trial";
@@ -134,10 +121,8 @@ bool SshServer::start(std::string* why) {
                   sshfs_command(dir_, trial) + " &\nfor i in $(seq 200); do\n  [ -e '" + trial +
                       "/sshd_config' ] && exit 0\n  sleep 0.05\ndone\nexit 1\n");
   if (!shell("timeout 30 unshare -m --propagation private sh '" + dir_ + "/trial.sh' >'" + dir_ +
-             "/trial.log' 2>&1")) {
-    *why = "an sshfs trial mount failed: " + read_text_file(dir_ + "/trial.log");
-    return false;
-  }
+             "/trial.log' 2>&1"))
+    return *why = "an sshfs trial mount failed: " + read_text_file(dir_ + "/trial.log"), false;
   return true;
 }
 
@@ -149,7 +134,8 @@ std::string SshServer::sshfs_command(const std::string& remote_dir,
          " " + mount_point;
 }
 
-FarmHosts::FarmHosts(Farm& farm, const SshServer* ssh) : farm_(farm), ssh_(ssh) {
+FarmHosts::FarmHosts(Farm& farm, const SshServer* ssh)
+    : farm_(farm), ssh_(ssh), env_(render_env()) {
   // Probes of another host's pid go through a remote shell; every host of
   // this farm shares this machine's pids, so the shim runs the probe here.
   std::string rsh = farm.path("../rsh_here");
@@ -157,7 +143,6 @@ FarmHosts::FarmHosts(Farm& farm, const SshServer* ssh) : farm_(farm), ssh_(ssh) 
                   "#!/bin/sh\n# rsh HOST -n COMMAND\nshift\n[ \"$1\" = -n ] && shift\n"
                   "exec /bin/sh -c \"$1\"\n");
   chmod(rsh.c_str(), 0755);
-  env_ = render_env();
   env_.push_back("ZARNO_RSH=" + rsh);
 }
 
@@ -187,8 +172,7 @@ bool FarmHosts::start(const std::string& name) {
   }
   argv.insert(argv.end(),
               {"/bin/sh", "-c", script + "exec \"$@\"", name, DAEMON_PATH, "-l", dir, "-d", "1"});
-  Daemon* started = &farm_.run(argv, name, env_);
-  host.starts.push_back(started);
+  Daemon* started = host.starts.emplace_back(&farm_.run(argv, name, env_));
   bool up =
       wait_for([&] { return started->in_loop() || started->ended(); }, 30) && !started->ended();
   if (std::string ns = up ? uts_of(started->pid) : ""; !ns.empty()) host.namespaces.insert(ns);
@@ -204,23 +188,21 @@ void FarmHosts::power_cut(const std::string& name) {
       pids_where([&](int pid) { return host.namespaces.count(uts_of(pid)) != 0; });
   for (int pid : victims) kill(pid, SIGKILL);
   if (d != nullptr) d->stop();
-  wait_for([&] { return std::all_of(victims.begin(), victims.end(), gone); }, 10);
+  wait_for([&] { return std::ranges::all_of(victims, pid_gone); }, 10);
 }
 
 bool FarmHosts::wait_until(const std::function<bool()>& done, double seconds) {
-  auto deadline = std::chrono::steady_clock::now() + std::chrono::duration<double>(seconds);
   auto next_wake = std::chrono::steady_clock::now() + std::chrono::seconds(1);
-  while (std::chrono::steady_clock::now() < deadline) {
-    if (done()) return true;
-    if (std::chrono::steady_clock::now() >= next_wake) {
-      // A stopped daemon keeps the wake-up for when it continues.
-      for (auto& [name, host] : hosts_)
-        if (Daemon* d = daemon(name); d != nullptr && !d->ended() && d->in_loop()) d->wake();
-      next_wake += std::chrono::seconds(1);
-    }
-    std::this_thread::sleep_for(std::chrono::milliseconds(20));
-  }
-  return done();
+  return wait_for(
+      [&] {
+        if (std::chrono::steady_clock::now() < next_wake) return done();
+        // A stopped daemon keeps the wake-up for when it continues.
+        for (auto& [name, host] : hosts_)
+          if (Daemon* d = daemon(name); d != nullptr && !d->ended() && d->in_loop()) d->wake();
+        next_wake += std::chrono::seconds(1);
+        return done();
+      },
+      seconds);
 }
 
 void FarmHosts::touch_pid_files() const {

@@ -66,6 +66,12 @@ std::vector<FileRec> task_records(Farm& farm) {
   return recs;
 }
 
+std::vector<std::string> lock_dirs(Farm& farm) {
+  std::vector<std::string> locks = dir_names(farm.dir());
+  std::erase_if(locks, [](const std::string& name) { return !name.ends_with(".lock"); });
+  return locks;
+}
+
 std::string make_project(Farm& farm) {
   std::string project = farm.path("project"), scene = project + "/sdl/scene.sdl";
   for (const char* dir : {"", "/sdl", "/pix"}) mkdir((project + dir).c_str(), 0777);

@@ -51,6 +51,9 @@ std::string make_project(Farm& farm);
 /// Environment for daemons that run the demo or the stamping render program.
 std::vector<std::string> render_env();
 
+/// The lock directories ("NAME.lock") in the control directory.
+std::vector<std::string> lock_dirs(Farm& farm);
+
 /// The state text of a job in the job file ("" when absent).
 std::string job_status(Farm& farm, const std::string& job);
 /// The job block of a job in the job file ("" when absent).
