@@ -154,8 +154,10 @@ run_setting() {
       script+="sshfs -f -o cache=no,StrictHostKeyChecking=no,UserKnownHostsFile=/dev/null,LogLevel=ERROR,IdentityFile=$ssh_dir/client_key,port=$sshd_port root@127.0.0.1:$ctl $dir & "
       script+="for i in \$(seq 600); do [ -e $dir/Render_Job_Control ] && break; sleep 0.05; done; "
     fi
+    # A host starts when its daemon does: the mount before it is the
+    # machine's, not the queue's.
+    script+="echo \"\$0 \$(date +%s%N)\" >>$farm/starts; "
     script+='exec "$@"'
-    echo "fb$i $(date +%s%N)" >>"$farm/starts"
     DRCTMPDIR=$farm/tmp$i STAMP_FILE=$farm/stamps PATH=$render_bin:$PATH \
       unshare "${ns[@]}" /bin/sh -c "$script" "fb$i" "$daemon" -l "$dir" ${FARM_BENCH_DEBUG:+-d 1} >"$farm/tmp$i/early" 2>&1 &
     pids+=($!)
