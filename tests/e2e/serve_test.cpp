@@ -48,8 +48,13 @@ struct Server {
                    "", {})) {
     wait_for([&] { return banner().find("read-only on") != std::string::npos || d.ended(); }, 30);
   }
+  bool stopped = false;
+  // A server that ended by itself has crashed: what it printed says why (a sanitizer's report
+  // too), where the requests after the crash only see no answer.
+  ~Server() { EXPECT_TRUE(stopped || !d.ended()) << "the server ended by itself:\n" << banner(); }
   std::string banner() const { return read_text_file(d.tmpdir + "/early"); }
   int stop() {  // its exit code, -1 when it had ended before or does not end
+    stopped = true;
     bool ends = !d.ended() && kill(d.pid, SIGTERM) == 0 && wait_for([&] { return d.ended(); }, 30);
     return ends ? d.exit_code() : -1;
   }
