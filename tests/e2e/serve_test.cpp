@@ -166,7 +166,8 @@ TEST_F(ServeTest, FramesAreServedOnlyAsPngFromTheJobsDirectory) {
   for (std::string row : {"404 /api/jobs/2/frames/half.0002", "404 /api/jobs/2/frames/half.0003",
                           "404 /api/jobs/2/frames/spin.0001", "400 /api/jobs/2/frames/%2e%2e",
                           "400 /api/jobs/2/frames/..%2F..%2Fsecret.png", "404 /api/jobs/99",
-                          "404 /api/jobs/99/thumb", "404 /api/jobs/3/thumb", "404 /api/nothing"})
+                          "404 /api/jobs/99999999999", "404 /api/jobs/99/thumb",
+                          "404 /api/jobs/3/thumb", "404 /api/nothing"})
     EXPECT_EQ(s.status(row.substr(4)), atoi(row.c_str())) << row;
   EXPECT_EQ(s.status("/" + std::string(20000, 'a')), 414);
   EXPECT_EQ(status_of_get_with_body(s.port, 1 << 20), 413);
