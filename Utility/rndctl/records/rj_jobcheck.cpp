@@ -128,7 +128,8 @@ char* get_strstr(const char* key, char* line) {
 int Job_check_sdlfields(Job* job) {
   ScopedFILE fp = open_scene(job);
   if (fp == nullptr) return 0;
-  // Fields not TRUE end the scan: the odd and even lines after it do not count.
+  // Ends once all three were read, or at fields not TRUE: the odd and even
+  // lines after that do not count.
   static constexpr SceneKey kKeys[] = {
       {"fields",
        [](Job* j, const char* value) {
@@ -153,7 +154,7 @@ int Job_check_sdlfields(Job* job) {
 int Job_set_frame_range(Job* job) {
   ScopedFILE fp = open_scene(job);
   if (fp == nullptr) return 0;
-  // Read to the end: a key set twice takes its last value.
+  // Read to the end (or animation not ON): a key set twice takes its last value.
   static constexpr SceneKey kKeys[] = {
       {"animation", take_animation},
       {"startframe", [](Job* j, const char* value) { return take_float(&j->frames[0], value); }},
