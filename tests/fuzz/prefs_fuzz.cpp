@@ -14,6 +14,7 @@
 #include <string>
 
 #include "General/pst/pst.h"
+#include "Utility/rndctl/base/rj_text.h"
 
 namespace {
 
@@ -24,12 +25,7 @@ bool name_char(char c) {
 // What the file defines, by its documented format.
 std::map<std::string, std::string> defined(const std::string& text) {
   std::map<std::string, std::string> out;
-  size_t at = 0;
-  while (at < text.size()) {
-    size_t end = text.find('\n', at);
-    if (end == std::string::npos) end = text.size();
-    std::string line = text.substr(at, end - at);
-    at = end + 1;
+  for (const std::string& line : Text_lines(text)) {
     if (line.size() >= 4095) continue;
     size_t p = line.find_first_not_of(" \t");
     if (p == std::string::npos || !name_char(line[p])) continue;

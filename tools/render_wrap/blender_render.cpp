@@ -164,10 +164,8 @@ struct BlenderRun {
 
 int main(int argc, char** argv) {
   RwArgs args;
-  RwParse parsed = Rw_parse(argc, argv, kUsage, &args);
-  if (parsed != RwParse::kOk) return Rw_parse_exit(parsed);
-
-  std::vector<RwFrame> frames = Rw_frames(args);
+  std::vector<RwFrame> frames;
+  if (int status = Rw_start(argc, argv, kUsage, &args, &frames); status >= 0) return status;
   for (const RwFrame& f : frames) {
     if (args.animate && f.frame != std::floor(f.frame)) {
       Rw_error("blender_render: Blender renders whole frames only, not frame %g", f.frame);

@@ -93,10 +93,8 @@ std::string only_file(const std::string& dir) {
 
 int main(int argc, char** argv) {
   RwArgs args;
-  RwParse parsed = Rw_parse(argc, argv, kUsage, &args);
-  if (parsed != RwParse::kOk) return Rw_parse_exit(parsed);
-
-  std::vector<RwFrame> frames = Rw_frames(args);
+  std::vector<RwFrame> frames;
+  if (int status = Rw_start(argc, argv, kUsage, &args, &frames); status >= 0) return status;
   size_t slash = args.pix.rfind('/');
   std::string dir = slash == std::string::npos ? "." : args.pix.substr(0, slash);
   std::string base = slash == std::string::npos ? args.pix : args.pix.substr(slash + 1);

@@ -187,6 +187,13 @@ int Rw_parse_exit(RwParse result) {
   return 1;
 }
 
+int Rw_start(int argc, char** argv, const char* usage, RwArgs* args, std::vector<RwFrame>* frames) {
+  RwParse parsed = Rw_parse(argc, argv, usage, args);
+  if (parsed != RwParse::kOk) return Rw_parse_exit(parsed);
+  *frames = Rw_frames(*args);
+  return -1;
+}
+
 std::vector<float> Rw_frame_values(float start, float end, float by) {
   std::vector<float> values;
   float f = start;

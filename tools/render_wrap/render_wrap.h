@@ -98,6 +98,11 @@ enum class RwParse {
 [[nodiscard]] RwParse Rw_parse(int argc, char** argv, const char* usage, RwArgs* out);
 /// The exit status for a parse result other than kOk.
 int Rw_parse_exit(RwParse result);
+/// The opening of a wrapper's main: Rw_parse with `usage`, then Rw_frames
+/// into *frames.  -1 when the wrapper goes on to render, else the status it
+/// is to exit with (as Rw_parse_exit gives it).
+[[nodiscard]] int Rw_start(int argc, char** argv, const char* usage, RwArgs* args,
+                           std::vector<RwFrame>* frames);
 
 /// A whole decimal number (from -1e9 to 1e9) or a finite float: the whole
 /// text or false.

@@ -28,33 +28,28 @@ bool grid_empty(const int* grid) {
   return true;
 }
 
-// Finds the job and refuses one an editor holds, unless forced.
+// `found` (a job or host, null when there is none) unless an editor holds
+// it and the change is not forced; else null with the reason in *why.
+template <typename Record>
+Record* editable(Record* found, const char* kind, const std::string& key, bool force,
+                 std::string* why) {
+  std::string what = std::string(kind) + " \"" + key + "\"";
+  if (found == nullptr) {
+    *why = "no " + what;
+  } else if (!force && Ctl_held(found->lock_pid)) {
+    *why = what + " is held by editor pid " + std::to_string(found->lock_pid) + " (use --force)";
+  } else {
+    return found;
+  }
+  return nullptr;
+}
+
 Job* editable_job(const std::string& key, bool force, std::string* why) {
-  Job* job = Ctl_find_job(key);
-  if (job == nullptr) {
-    *why = "no job \"" + key + "\"";
-    return nullptr;
-  }
-  if (!force && Ctl_held(job->lock_pid)) {
-    *why = "job \"" + key + "\" is held by editor pid " + std::to_string(job->lock_pid) +
-           " (use --force)";
-    return nullptr;
-  }
-  return job;
+  return editable(Ctl_find_job(key), "job", key, force, why);
 }
 
 Dev* editable_dev(const std::string& name, bool force, std::string* why) {
-  Dev* dev = Dev_by_name(name.c_str());
-  if (dev == nullptr) {
-    *why = "no host \"" + name + "\"";
-    return nullptr;
-  }
-  if (!force && Ctl_held(dev->lock_pid)) {
-    *why = "host \"" + name + "\" is held by editor pid " + std::to_string(dev->lock_pid) +
-           " (use --force)";
-    return nullptr;
-  }
-  return dev;
+  return editable(Dev_by_name(name.c_str()), "host", name, force, why);
 }
 
 bool load(std::string* why) { return Ctl_load(why); }

@@ -85,8 +85,11 @@ void not_found(httplib::Response& res) {
 }
 
 bool job_of(const httplib::Request& req, const ServeSnapshot& snap, int* index) {
+  // `end` points into this text, so it must outlive the check of *end: a
+  // temporary from str() would be gone by then (only a sanitizer notices).
+  const std::string text = req.matches[1].str();
   char* end = nullptr;
-  long n = strtol(req.matches[1].str().c_str(), &end, 10);
+  long n = strtol(text.c_str(), &end, 10);
   if (*end != '\0' || n < 0 || n > 1000000000) return false;
   *index = static_cast<int>(n);
   return snap.jobs->files.count(*index) != 0;

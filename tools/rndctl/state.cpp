@@ -108,12 +108,7 @@ std::vector<std::string> host_lines(const std::string& log, const std::string& h
 nlohmann::json host_status(const std::string& host) {
   nlohmann::json out = nlohmann::json::array();
   std::string text = State_tail(location() + "/TSKSTAT/" + host, 1 << 16);
-  size_t at = 0;
-  while (at < text.size()) {
-    size_t end = text.find('\n', at);
-    if (end == std::string::npos) end = text.size();
-    std::string line = text.substr(at, end - at);
-    at = end + 1;
+  for (const std::string& line : Text_lines(text)) {
     char job[256], output[1024];
     int index = 0, status = 0;
     if (sscanf(line.c_str(), "%255s %d %d %1023s", job, &index, &status, output) != 4) continue;

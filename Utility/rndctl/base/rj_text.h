@@ -5,9 +5,13 @@
 /// none, so a Text passes straight into the printf family where the formats
 /// say "%s" of a value that is known to be set.  Setting a Text frees the old
 /// value first; copying a Text copies the text.
+///
+/// Text_lines cuts a whole text (a file read at once) into its lines.
 #pragma once
 
 #include <cstring>
+#include <string>
+#include <vector>
 
 class Text {
  public:
@@ -60,3 +64,7 @@ class Text {
  private:
   char* p_ = nullptr;
 };
+
+/// The lines of `text` without their '\n'; a last line without one counts
+/// too, so "" has no lines and "\n" one empty line.
+std::vector<std::string> Text_lines(const std::string& text);

@@ -9,6 +9,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <memory>
+#include <span>
 #include <vector>
 
 #include "Utility/rndctl/base/rj_control.h"
@@ -38,6 +39,60 @@ ScopedFILE open_scene(const Job* job) {
 }
 
 const char* name_of(const Text& name) { return name.or_else("noname"); }
+
+// A key a scene scan looks for, and what takes its value (the text after
+// '=', cut at ';').  `take` returns false to end the scan there.
+struct SceneKey {
+  const char* key;
+  bool (*take)(Job* job, const char* value);
+};
+
+// Reads the scene line by line up to the environment section and hands each
+// line to the first of `keys` it holds (the order matters: keys match inside
+// longer words).  With `until_all_seen` the scan also ends once every key has
+// been taken.
+void scan_scene(FILE* fp, Job* job, std::span<const SceneKey> keys, bool until_all_seen) {
+  // A bit a key: the tables are a handful of keys long.
+  const unsigned all = (1u << keys.size()) - 1u;
+  unsigned seen = 0;
+  char line[kSceneLine];
+  while (fgets(line, sizeof line, fp) != nullptr) {
+    if (stops_scan(line)) break;
+    for (size_t i = 0; i < keys.size(); i++) {
+      char* value = get_strstr(keys[i].key, line);
+      if (value == nullptr) continue;
+      if (!keys[i].take(job, value)) return;
+      seen |= 1u << i;
+      break;
+    }
+    if (until_all_seen && seen == all) break;
+  }
+}
+
+bool take_float(float* to, const char* value) {
+  *to = static_cast<float>(atof(value));
+  return true;
+}
+
+bool take_int(int* to, const char* value) {
+  *to = atoi(value);
+  return true;
+}
+
+// Animation not ON ends the scan: the frame settings after it do not count.
+bool take_animation(Job* job, const char* value) {
+  job->animate = strstr(value, "ON") != nullptr ? 1 : 0;
+  return job->animate != 0;
+}
+
+bool take_ext_start(Job* job, const char* value) { return take_int(&job->ext_start, value); }
+bool take_ext_by(Job* job, const char* value) { return take_int(&job->ext_by, value); }
+
+int count_frames(Job* job) {
+  job->totalframes =
+      job->animate != 0 ? Calc_frame_range(job->frames[0], job->frames[1], job->frames[2]) : 1;
+  return job->totalframes;
+}
 
 }  // namespace
 
@@ -73,57 +128,44 @@ char* get_strstr(const char* key, char* line) {
 int Job_check_sdlfields(Job* job) {
   ScopedFILE fp = open_scene(job);
   if (fp == nullptr) return 0;
-  char line[kSceneLine];
-  bool seen_fields = false, seen_odd = false, seen_even = false;
-  while (fgets(line, sizeof line, fp.get()) != nullptr) {
-    if (stops_scan(line)) break;
-    char* value;
-    if ((value = get_strstr("fields", line)) != nullptr) {
-      job->fields = 0;
-      if (strstr(value, "TRUE") == nullptr) break;
-      seen_fields = true;
-    } else if ((value = get_strstr("odd", line)) != nullptr) {
-      if (strstr(value, "FALSE") == nullptr) job->fields |= 1;
-      seen_odd = true;
-    } else if ((value = get_strstr("even", line)) != nullptr) {
-      if (strstr(value, "FALSE") == nullptr) job->fields |= 2;
-      seen_even = true;
-    }
-    if (seen_fields && seen_odd && seen_even) break;
-  }
+  // Ends once all three were read, or at fields not TRUE: the odd and even
+  // lines after that do not count.
+  static constexpr SceneKey kKeys[] = {
+      {"fields",
+       [](Job* j, const char* value) {
+         j->fields = 0;
+         return strstr(value, "TRUE") != nullptr;
+       }},
+      {"odd",
+       [](Job* j, const char* value) {
+         if (strstr(value, "FALSE") == nullptr) j->fields |= 1;
+         return true;
+       }},
+      {"even",
+       [](Job* j, const char* value) {
+         if (strstr(value, "FALSE") == nullptr) j->fields |= 2;
+         return true;
+       }},
+  };
+  scan_scene(fp.get(), job, kKeys, true);
   return job->fields;
 }
 
 int Job_set_frame_range(Job* job) {
   ScopedFILE fp = open_scene(job);
   if (fp == nullptr) return 0;
-  char line[kSceneLine];
-  while (fgets(line, sizeof line, fp.get()) != nullptr) {
-    if (stops_scan(line)) break;
-    char* value;
-    if ((value = get_strstr("animation", line)) != nullptr) {
-      if (strstr(value, "ON") == nullptr) {
-        job->animate = 0;
-        break;
-      }
-      job->animate = 1;
-    } else if ((value = get_strstr("startframe", line)) != nullptr) {
-      job->frames[0] = static_cast<float>(atof(value));
-    } else if ((value = get_strstr("endframe", line)) != nullptr) {
-      job->frames[1] = static_cast<float>(atof(value));
-    } else if ((value = get_strstr("byframe", line)) != nullptr) {
-      job->frames[2] = static_cast<float>(atof(value));
-    } else if ((value = get_strstr("start_extension", line)) != nullptr) {
-      job->ext_start = atoi(value);
-    } else if ((value = get_strstr("by_extension", line)) != nullptr) {
-      job->ext_by = atoi(value);
-    } else if ((value = get_strstr("extensionsize", line)) != nullptr) {
-      job->ext_size = atoi(value);
-    }
-  }
-  job->totalframes =
-      job->animate != 0 ? Calc_frame_range(job->frames[0], job->frames[1], job->frames[2]) : 1;
-  return job->totalframes;
+  // Read to the end (or animation not ON): a key set twice takes its last value.
+  static constexpr SceneKey kKeys[] = {
+      {"animation", take_animation},
+      {"startframe", [](Job* j, const char* value) { return take_float(&j->frames[0], value); }},
+      {"endframe", [](Job* j, const char* value) { return take_float(&j->frames[1], value); }},
+      {"byframe", [](Job* j, const char* value) { return take_float(&j->frames[2], value); }},
+      {"start_extension", take_ext_start},
+      {"by_extension", take_ext_by},
+      {"extensionsize", [](Job* j, const char* value) { return take_int(&j->ext_size, value); }},
+  };
+  scan_scene(fp.get(), job, kKeys, false);
+  return count_frames(job);
 }
 
 int Calc_frame_range(float start, float end, float step) {
@@ -149,36 +191,19 @@ int Calc_frame_range(float start, float end, float step) {
 int Job_check_sdl(Job* job) {
   ScopedFILE fp = open_scene(job);
   if (fp == nullptr) return 0;
-  const bool own_extension = job->extension != 0;
-  if (!own_extension) {
+  static constexpr SceneKey kAnimation[] = {{"animation", take_animation}};
+  static constexpr SceneKey kWithExtension[] = {{"animation", take_animation},
+                                                {"start_extension", take_ext_start},
+                                                {"by_extension", take_ext_by}};
+  // A job with its own extension settings keeps them: the scene's are not read.
+  if (job->extension != 0) {
+    scan_scene(fp.get(), job, kAnimation, true);
+  } else {
     job->ext_by = 1;
     job->ext_start = static_cast<int>(job->frames[0]);
+    scan_scene(fp.get(), job, kWithExtension, true);
   }
-  bool seen_animation = false;
-  bool seen_start = own_extension, seen_by = own_extension;
-  char line[kSceneLine];
-  while (fgets(line, sizeof line, fp.get()) != nullptr) {
-    if (stops_scan(line)) break;
-    char* value;
-    if ((value = get_strstr("animation", line)) != nullptr) {
-      if (strstr(value, "ON") == nullptr) {
-        job->animate = 0;
-        break;
-      }
-      job->animate = 1;
-      seen_animation = true;
-    } else if (!own_extension && (value = get_strstr("start_extension", line)) != nullptr) {
-      job->ext_start = atoi(value);
-      seen_start = true;
-    } else if (!own_extension && (value = get_strstr("by_extension", line)) != nullptr) {
-      job->ext_by = atoi(value);
-      seen_by = true;
-    }
-    if (seen_animation && seen_start && seen_by) break;
-  }
-  job->totalframes =
-      job->animate != 0 ? Calc_frame_range(job->frames[0], job->frames[1], job->frames[2]) : 1;
-  return job->totalframes;
+  return count_frames(job);
 }
 
 void Job_field_check() {
