@@ -34,14 +34,11 @@ std::string block(const char* text) {
   std::string why, fills;
   if (!Ctl_parse_block(text, &b, &why)) return "refused";
   Ctl_apply_block(b, [&](int s, int e, const char* f, const char* l) {
-    fills += (fills.empty() ? "" : ", ") + std::to_string(s) + "-" + std::to_string(e) + " " + f +
-             "-" + l;
+    fills += std::to_string(s) + "-" + std::to_string(e) + " " + f + "-" + l + ", ";
   });
-  return fills;
+  return fills.substr(0, fills.size() - 2);
 }
 
-// What the tool takes in, refusing what the reader could not read back, and
-// its drawing in fixed widths.
 TEST(RndctlText, ParsesOrRefusesInputAndKeepsWidths) {
   const std::vector<std::pair<const char*, const char*>> ranges = {
       {"1-10", "1-10:1"},    {"1-10:2", "1-10:2"},           {"-5--1", "-5--1:1"},
@@ -75,10 +72,9 @@ TEST(RndctlText, ParsesOrRefusesInputAndKeepsWidths) {
             (std::vector<std::string>{"[.....]", "[#####.....]", "[#####]", "abc~", "abc"}));
 }
 
-// The tables and the JSON a user reads, on a farm of three hosts and three
-// jobs: one part rendered on a live host, one paused with names too long for
-// their columns, one finished on every host.  Regenerate the tables with
-// RNDCTL_GOLDEN_UPDATE=1.
+// The tables and the JSON a user reads, on a farm of three hosts and three jobs: one part rendered
+// on a live host, one paused with names too long for their columns, one finished on every host.
+// Regenerate the tables with RNDCTL_GOLDEN_UPDATE=1.
 using RndctlTables = ControlDirTest;
 
 TEST_F(RndctlTables, MatchTheirGoldenTextAndJsonCarriesEveryField) {
