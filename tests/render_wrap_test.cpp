@@ -5,89 +5,63 @@
 
 #include <gtest/gtest.h>
 
-#include <string>
-#include <vector>
-
 namespace {
 
 using Words = std::vector<std::string>;
 
-enum class Rules { kWrapper, kPainter, kStamp };
-
-RwScanRules rules_of(Rules which) {
-  return which == Rules::kWrapper ? RwScanRules{} : Rw_first_rules(which == Rules::kPainter);
-}
-
-struct ScanCase {
-  Rules rules;
-  Words words;  // after the program name
-  RwScanResult result;
-  const char* word;  // the option at fault, or null
-};
-
-class RwScanTable : public ::testing::TestWithParam<ScanCase> {};
-
-TEST_P(RwScanTable, StopsWhereTheProgramsRulesSay) {
-  const ScanCase& c = GetParam();
-  Words all = {"prog"};
-  all.insert(all.end(), c.words.begin(), c.words.end());
+// The programs' results for "prog" and `words`; `args` gets the wrappers' reading.
+std::string scan(Words words, RwArgs* args = nullptr) {
+  static const char* const kNames[] = {"ok",        "help",     "unknown",  "no value",
+                                       "bad value", "no scene", "too many", "no pix"};
+  words.insert(words.begin(), "prog");
   std::vector<char*> argv;
-  for (std::string& w : all) argv.push_back(w.data());
+  for (std::string& w : words) argv.push_back(w.data());
   argv.push_back(nullptr);
-  RwArgs args;
-  RwScan scan = Rw_scan(static_cast<int>(all.size()), argv.data(), rules_of(c.rules), &args);
-  EXPECT_EQ(scan.result, c.result);
-  EXPECT_STREQ(scan.word, c.word);
+  std::string out;
+  for (const RwScanRules& rules : {RwScanRules{}, Rw_first_rules(true), Rw_first_rules(false)}) {
+    RwArgs read;
+    const RwScan s = Rw_scan(static_cast<int>(words.size()), argv.data(), rules, &read);
+    if (out.empty() && args != nullptr) *args = read;
+    out += kNames[static_cast<int>(s.result)] + (s.word ? std::string(" ") + s.word : "") + " | ";
+  }
+  return out.substr(0, out.size() - 3);
 }
 
-// clang-format off
-INSTANTIATE_TEST_SUITE_P(Rules, RwScanTable, testing::Values(
-    // The options argument may start with a dash only for the wrappers.
-    ScanCase{Rules::kWrapper, {"-p", "x", "-t 2", "s"}, RwScanResult::kOk, nullptr},
-    ScanCase{Rules::kPainter, {"-p", "x", "-t 2", "s"}, RwScanResult::kUnknown, "-t 2"},
-    // -n0 and -n+4: a count for the wrappers, digits for the others.
-    ScanCase{Rules::kWrapper, {"-p", "x", "-n0", "s"}, RwScanResult::kUnknown, "-n0"},
-    ScanCase{Rules::kStamp, {"-p", "x", "-n0", "s"}, RwScanResult::kOk, nullptr},
-    ScanCase{Rules::kWrapper, {"-p", "x", "-n+4", "s"}, RwScanResult::kOk, nullptr},
-    ScanCase{Rules::kPainter, {"-p", "x", "-n+4", "s"}, RwScanResult::kUnknown, "-n+4"},
-    ScanCase{Rules::kPainter, {"-p", "x", "-n", "s"}, RwScanResult::kUnknown, "-n"},
-    // A step of 0 is refused by the wrappers only.
-    ScanCase{Rules::kWrapper, {"-p", "x", "-b", "0", "s"}, RwScanResult::kBadValue, "-b"},
-    ScanCase{Rules::kPainter, {"-p", "x", "-b", "0", "s"}, RwScanResult::kOk, nullptr},
-    // "--" and "--help" are long options, which stamp_render never had.
-    ScanCase{Rules::kPainter, {"-p", "x", "--", "-s"}, RwScanResult::kOk, nullptr},
-    ScanCase{Rules::kStamp, {"-p", "x", "--", "s"}, RwScanResult::kUnknown, "--"},
-    ScanCase{Rules::kPainter, {"--help"}, RwScanResult::kHelp, nullptr},
-    ScanCase{Rules::kStamp, {"--help"}, RwScanResult::kUnknown, "--help"},
-    // The first fault wins, whatever follows it.
-    ScanCase{Rules::kWrapper, {"-h", "-x"}, RwScanResult::kHelp, nullptr},
-    ScanCase{Rules::kStamp, {"-x", "-h"}, RwScanResult::kUnknown, "-x"},
-    ScanCase{Rules::kWrapper, {"-pp", "x", "s"}, RwScanResult::kUnknown, "-pp"},
-    ScanCase{Rules::kWrapper, {"-p", "x", "-s"}, RwScanResult::kNoValue, "-s"},
-    ScanCase{Rules::kStamp, {"-p", "x", "-s", "1e40", "s"}, RwScanResult::kBadValue, "-s"},
-    ScanCase{Rules::kPainter, {"-p", "x", "-E", "33", "s"}, RwScanResult::kBadValue, "-E"},
-    ScanCase{Rules::kWrapper, {"-p", "x", "-S", "2.5", "s"}, RwScanResult::kBadValue, "-S"},
-    // The words that are not options: the scene, after the options argument.
-    ScanCase{Rules::kWrapper, {"-p", "x"}, RwScanResult::kNoScene, nullptr},
-    ScanCase{Rules::kWrapper, {"-p", "x", "a", "b", "c"}, RwScanResult::kTooMany, nullptr},
-    ScanCase{Rules::kStamp, {"s"}, RwScanResult::kNoPix, nullptr},
-    ScanCase{Rules::kStamp, {"-", "s"}, RwScanResult::kNoPix, nullptr}));
-// clang-format on
+// Wrappers | frame_painter | stamp_render.  Only the wrappers let the options argument
+// start with a dash, read -nN as a count and refuse a step of 0; stamp_render never had
+// "--" and "--help".  The first fault wins, whatever follows it.
+TEST(RwScan, StopsWhereEachProgramsRulesSay) {
+  const std::vector<std::pair<Words, std::string>> cases = {
+      {{"-p", "x", "-t 2", "s"}, "ok | unknown -t 2 | unknown -t 2"},
+      {{"-p", "x", "-n0", "s"}, "unknown -n0 | ok | ok"},
+      {{"-p", "x", "-n+4", "s"}, "ok | unknown -n+4 | unknown -n+4"},
+      {{"-p", "x", "-b", "0", "s"}, "bad value -b | ok | ok"},
+      {{"-p", "x", "--", "-s"}, "ok | ok | unknown --"},
+      {{"--help"}, "help | help | unknown --help"},
+      {{"-p", "x", "-n", "s"}, "unknown -n | unknown -n | unknown -n"},
+      {{"-h", "-x"}, "help | help | help"},
+      {{"-x", "-h"}, "unknown -x | unknown -x | unknown -x"},
+      {{"-pp", "x", "s"}, "unknown -pp | unknown -pp | unknown -pp"},
+      {{"-p", "x", "-s"}, "no value -s | no value -s | no value -s"},
+      {{"-p", "x", "-s", "1e40", "s"}, "bad value -s | bad value -s | bad value -s"},
+      {{"-p", "x", "-E", "33", "s"}, "bad value -E | bad value -E | bad value -E"},
+      {{"-p", "x", "-S", "2.5", "s"}, "bad value -S | bad value -S | bad value -S"},
+      {{"-p", "x"}, "no scene | no scene | no scene"},
+      {{"-p", "x", "a", "b", "c"}, "too many | too many | too many"},
+      {{"s"}, "no pix | no pix | no pix"},
+      {{"-", "s"}, "no pix | no pix | no pix"},
+  };
+  for (const auto& [words, want] : cases)
+    EXPECT_EQ(scan(words), want) << testing::PrintToString(words);
+}
 
 TEST(RwScan, KeepsWhatWasGivenAndWhatWasNot) {
-  Words all = {"prog", "-A", "-s", "2", "-b",  "0.5",       "-S",   "7",
-               "-m",   "m",  "-p", "p", "-n3", "fail_at=2", "scene"};
-  std::vector<char*> argv;
-  for (std::string& w : all) argv.push_back(w.data());
+  const Words given = {"-A", "-s", "2",  "-b", "0.5", "-S",        "7",
+                       "-m", "m",  "-p", "p",  "-n3", "fail_at=2", "scene"};
   RwArgs a;
-  ASSERT_EQ(Rw_scan(static_cast<int>(argv.size()), argv.data(), RwScanRules{}, &a).result,
-            RwScanResult::kOk);
-  EXPECT_EQ(a.pix, "p");
-  EXPECT_EQ(a.matte, "m");
-  EXPECT_EQ(a.scene, "scene");
-  EXPECT_EQ(a.options, "fail_at=2");
-  EXPECT_TRUE(a.animate && a.have_by && a.have_first_ext);
-  EXPECT_FALSE(a.have_end || a.have_ext_size);
+  ASSERT_EQ(scan(given, &a), "ok | ok | ok");
+  EXPECT_EQ(Words({a.pix, a.matte, a.scene, a.options}), Words({"p", "m", "scene", "fail_at=2"}));
+  EXPECT_TRUE(a.animate && a.have_by && a.have_first_ext && !a.have_end && !a.have_ext_size);
   EXPECT_EQ(a.end, 1.0f);  // no end is made up: each program has its own
   EXPECT_EQ(a.processors, 3);
 }

@@ -12,112 +12,80 @@ bool exists(const std::string& path) { return access(path.c_str(), F_OK) == 0; }
 
 class RenderTest : public ::testing::Test {
  protected:
-  void SetUp() override {
-    host_ = this_host_name();
-    scene_ = make_project(farm_);
-  }
-  // Writes both control files and starts this host's daemon.
-  Daemon& start(const std::vector<ResourceSpec>& resources, const std::vector<JobSpec>& jobs,
-                const std::vector<std::string>& wrapper_env = {}) {
-    farm_.write("Render_Resource_Control", resource_file(resources));
-    farm_.write("Render_Job_Control", job_file(jobs, scene_));
+  void SetUp() override { scene_ = make_project(farm_); }
+  // Writes the control files of one job "spin", frames 1 to `end`, on this
+  // host, and starts the host's daemon.  A `wrapper` script, when given, runs
+  // in place of the render program with the daemon's arguments.
+  Daemon& start(int max_frames, int processors, float end, const std::string& opts = "",
+                const std::string& wrapper = "") {
+    farm_.write(
+        "Render_Resource_Control",
+        resource_file({{.name = host_, .max_frames = max_frames, .num_processors = processors}}));
+    farm_.write("Render_Job_Control",
+                job_file({{.end = end, .opts = opts, .hosts = {host_}}}, scene_));
     std::vector<std::string> env = render_env();
-    for (const auto& e : wrapper_env) env.push_back(e);
+    if (!wrapper.empty()) {
+      mkdir(farm_.path("wrapped").c_str(), 0777);
+      farm_.write("wrapped/frame_painter", "#!/bin/sh\n" + wrapper);
+      chmod(farm_.path("wrapped/frame_painter").c_str(), 0755);
+      env[0] = "PATH=" + farm_.path("wrapped") + ":" + env[0].substr(5);
+    }
     return farm_.start_on_farm({}, "", env);
   }
-  ResourceSpec here(int max_frames, int processors) {
-    ResourceSpec r;
-    r.name = host_;
-    r.max_frames = max_frames;
-    r.num_processors = processors;
-    return r;
+  bool finishes(Daemon& d) {
+    auto done = [&] { return job_status(farm_, "spin") == "finished"; };
+    return wait_for([&] { return done() || d.ended(); }, 120, &d) && done();
   }
-  JobSpec job(const std::string& name, int index, float start, float end) {
-    JobSpec j;
-    j.name = name;
-    j.index = index;
-    j.start = start;
-    j.end = end;
-    j.hosts = {host_};
-    return j;
-  }
-  bool status_becomes(Daemon& d, const std::string& job, const std::string& status,
-                      double seconds = 120) {
-    return wait_for([&] { return job_status(farm_, job) == status || d.ended(); }, seconds, &d) &&
-           job_status(farm_, job) == status;
-  }
-  // PATH entry for a shell script named as the render program, that runs
-  // `body` with the daemon's arguments.
-  std::string wrapped(const std::string& body) {
-    std::string dir = farm_.path("wrapped");
-    mkdir(dir.c_str(), 0777);
-    farm_.write("wrapped/frame_painter", "#!/bin/sh\n" + body);
-    chmod((dir + "/frame_painter").c_str(), 0755);
-    return "PATH=" + dir + ":" + render_env()[0].substr(5);
-  }
-  std::string image(const std::string& job, int frame) {
-    char name[64];
-    snprintf(name, sizeof name, "/project/pix/%s.%d", job.c_str(), frame);
-    return farm_.dir() + name;
+  // '#' for each of frames 1 to `last` whose image is there, '-' for each missing.
+  std::string images(int last) {
+    std::string out;
+    for (int f = 1; f <= last; ++f)
+      out += exists(farm_.path("project/pix/spin." + std::to_string(f))) ? '#' : '-';
+    return out;
   }
 
   Farm farm_;
-  std::string host_;
+  std::string host_ = this_host_name();
   std::string scene_;
 };
 
 TEST_F(RenderTest, AJobIsRenderedToFinished) {
-  JobSpec spin = job("spin", 1, 1, 7);
-  Daemon& d = start({here(3, 2)}, {spin});
-  ASSERT_TRUE(status_becomes(d, "spin", "finished")) << d.log();
-
-  for (int frame = 1; frame <= 7; ++frame) EXPECT_TRUE(exists(image("spin", frame))) << frame;
-  EXPECT_FALSE(exists(image("spin", 8)));
-
+  Daemon& d = start(3, 2, 7);
+  ASSERT_TRUE(finishes(d)) << d.log();
+  EXPECT_EQ(images(8), "#######-");
   // The finished job's group has left the task file.
   EXPECT_EQ(farm_.read("Render_Tasks").find("spin"), std::string::npos)
       << farm_.read("Render_Tasks");
 }
 
 TEST_F(RenderTest, RenderProgramsEndingTogetherAreAllJudged) {
-  JobSpec spin = job("spin", 1, 1, 4);
-  spin.opts = "slow=1";
-  Daemon& d = start({here(1, 2)}, {spin});
+  Daemon& d = start(1, 2, 4, "slow=1");
   // Two render programs at work; stop the daemon so that both end while it
   // cannot react, and their two SIGCHLDs arrive as one.
   ASSERT_TRUE(wait_for([&] { return children_of(d.pid).size() == 2; }, 30)) << d.log();
   kill(d.pid, SIGSTOP);
   int zombies = 0;
-  bool both_ended = wait_for(
-      [&] {
-        children_of(d.pid, &zombies);
-        return zombies == 2;
-      },
-      30);
+  const bool both_ended = wait_for([&] { return children_of(d.pid, &zombies), zombies == 2; }, 30);
   kill(d.pid, SIGCONT);
   ASSERT_TRUE(both_ended);
-  ASSERT_TRUE(status_becomes(d, "spin", "finished")) << d.log();
+  ASSERT_TRUE(finishes(d)) << d.log();
   EXPECT_TRUE(children_of(d.pid).empty());
   EXPECT_EQ(count_of(d.log(), "UNKNOWN"), 0) << d.log();
-  for (int frame = 1; frame <= 4; ++frame) EXPECT_TRUE(exists(image("spin", frame))) << frame;
+  EXPECT_EQ(images(4), "####");
 }
 
 // The render program is a wrapper that runs the real renderer as its own
 // child, as studio wrappers do: an abort must end both.
 TEST_F(RenderTest, AnAbortedJobHasItsWholeRenderKilled) {
-  JobSpec spin = job("spin", 1, 1, 6);
-  spin.opts = "slow=20";
-  Daemon& d = start({here(6, 1)}, {spin},
-                    {wrapped(std::string(FRAME_PAINTER_PATH) + " \"$@\" &\necho $! > " +
-                             farm_.path("child") + "\nwait\n")});
+  Daemon& d = start(6, 1, 6, "slow=20",
+                    FRAME_PAINTER_PATH " \"$@\" &\necho $! > " + farm_.path("child") + "\nwait\n");
   ASSERT_TRUE(wait_for([&] { return !farm_.read("child").empty(); }, 30)) << d.log();
-  int wrapper = children_of(d.pid)[0];
-  int renderer = atoi(farm_.read("child").c_str());
+  const int wrapper = children_of(d.pid)[0], renderer = atoi(farm_.read("child").c_str());
   ASSERT_TRUE(set_job_status(farm_, "spin", "aborted", host_)) << farm_.read("Render_Job_Control");
   ASSERT_TRUE(wait_for([&] { return kill(-wrapper, 0) != 0 && errno == ESRCH; }, 30, &d))
       << d.log();
   EXPECT_FALSE(exists("/proc/" + std::to_string(renderer)));
-  EXPECT_FALSE(exists(image("spin", 6)));
+  EXPECT_EQ(images(6).back(), '-');  // the last frame was never reached
   EXPECT_EQ(job_status(farm_, "spin"), "aborted");
 }
 
@@ -125,11 +93,10 @@ TEST_F(RenderTest, AnAbortedJobHasItsWholeRenderKilled) {
 // render program must get none of them.  The listing's own directory shows
 // as one more descriptor, so a clean start lists exactly 0 to 3.
 TEST_F(RenderTest, RenderProgramsInheritOnlyTheirThreeStreams) {
-  JobSpec spin = job("spin", 1, 1, 2);
-  Daemon& d = start({here(1, 2)}, {spin},
-                    {wrapped("ls /proc/self/fd >> " + farm_.path("fds") + "\nexec " +
-                             FRAME_PAINTER_PATH + " \"$@\"\n")});
-  ASSERT_TRUE(status_becomes(d, "spin", "finished")) << d.log();
+  Daemon& d =
+      start(1, 2, 2, "",
+            "ls /proc/self/fd >> " + farm_.path("fds") + "\nexec " FRAME_PAINTER_PATH " \"$@\"\n");
+  ASSERT_TRUE(finishes(d)) << d.log();
   EXPECT_EQ(farm_.read("fds"), "0\n1\n2\n3\n0\n1\n2\n3\n");
 }
 

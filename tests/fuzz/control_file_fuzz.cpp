@@ -10,14 +10,9 @@
 // read back as the writer's forms of them and write the same again.
 #include <unistd.h>
 
-#include <cstdint>
-#include <cstdio>
-#include <cstdlib>
-#include <cstring>
-#include <string>
 #include <vector>
 
-#include "Utility/rndctl/rndctl.h"
+#include "tests/fuzz/fuzz_support.h"
 #include "tests/support/text_records.h"
 
 namespace {
@@ -32,12 +27,9 @@ const char kResources[] =
 
 bool failed = false;
 
-void note_failure(int) { failed = true; }
-
 bool parse(const std::string& text, const char* file) {
   failed = false;
-  int result = RJC_parse_string(text.data(), text.size(), file);
-  return result == 0 && !failed;
+  return RJC_parse_string(text.data(), text.size(), file) == 0 && !failed;
 }
 
 // Reads both texts into empty lists and writes them again.
@@ -49,52 +41,37 @@ bool reread(std::string& devs, std::string& jobs) {
   return true;
 }
 
-void setup() {
-  // Blocks with index 0 ask for a fresh index, which lives in a file of the
-  // control directory.
-  static char dir[] = "/tmp/rjc_fuzz_XXXXXX";
-  if (mkdtemp(dir) == nullptr) abort();
-  rndctl.location.set(dir);
-  rndctl.host.set("fuzzhost");
-  rndctl.user.set("fuzzer");
-  rndctl.pid = getpid();
-  RJC_fatal_exit = note_failure;
-}
-
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
-  static bool ready = (setup(), true);
-  (void)ready;
+  [[maybe_unused]] static const bool ready = [] {
+    // Blocks with index 0 ask for a fresh index, which lives in a file of the
+    // control directory.
+    rndctl.location.set(fuzz::scratch_dir("rjc_fuzz").c_str());
+    rndctl.host.set("fuzzhost");
+    rndctl.user.set("fuzzer");
+    rndctl.pid = getpid();
+    RJC_fatal_exit = [](int) { failed = true; };
+    return true;
+  }();
+  const std::string input(reinterpret_cast<const char*>(data), size);
 
   text_records::delete_lists();
   std::vector<std::string> texts(1);
-  for (size_t i = 0; i < size; ++i) {
-    if (data[i] == '\0')
-      texts.emplace_back();
-    else
-      texts.back() += static_cast<char>(data[i]);
-  }
+  for (char c : input) c == '\0' ? texts.emplace_back() : texts.back() += c;
   failed = false;
-  std::string failure = text_records::check(texts);
-  if (!failure.empty() || failed) {
-    fprintf(stderr, "%s\n", failure.c_str());
-    abort();
-  }
+  const std::string failure = text_records::check(texts);
+  fuzz::require(failure.empty() && !failed, failure.c_str());
 
-  if (!parse(kResources, "Render_Resource_Control")) abort();
-  if (!parse(std::string(reinterpret_cast<const char*>(data), size), "Render_Job_Control")) {
-    text_records::delete_lists();
-    return 0;
+  fuzz::require(parse(kResources, "Render_Resource_Control"), "the resources do not read");
+  if (parse(input, "Render_Job_Control")) {
+    std::string devs = text_records::written(Resource_control_write_dev);
+    std::string jobs = text_records::written(Job_control_write_dev);
+    fuzz::require(reread(devs, jobs), "the writer wrote what the reader refuses");
+    const std::string devs_once = devs, jobs_once = jobs;
+    fuzz::require(reread(devs, jobs) && devs == devs_once && jobs == jobs_once,
+                  "the rewrite did not settle");
   }
-
-  std::string devs = text_records::written(Resource_control_write_dev);
-  std::string jobs = text_records::written(Job_control_write_dev);
-  if (!reread(devs, jobs)) abort();  // the writer wrote what the reader refuses
-  std::string devs_once = devs;
-  std::string jobs_once = jobs;
-  if (!reread(devs, jobs)) abort();
-  if (devs != devs_once || jobs != jobs_once) abort();  // the rewrite did not settle
   text_records::delete_lists();
   return 0;
 }

@@ -3,17 +3,13 @@
 // start, length), the rest is what the program wrote.  Nothing may crash or
 // overrun; the frame reached stays inside the task; a second look at a
 // stream with nothing new on it changes nothing.
-#include <cstdint>
-#include <cstdio>
-#include <cstdlib>
-#include <string>
-
 #include "Utility/rndctl/rndctl.h"
+#include "tests/fuzz/fuzz_support.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   static Job* job = Add_a_job(nullptr, "fuzz.sdl", 1);
   static Dev* dev = Add_a_dev(nullptr, "render1", 1);
-  if (job == nullptr || dev == nullptr) abort();
+  fuzz::require(job != nullptr && dev != nullptr, "no records");
   if (size < 4) return 0;
   job->animate = data[0] & 1;
   job->extension = (data[0] & 2) != 0 ? 291 : 0;
@@ -22,9 +18,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   job->frames[0] = 1.0f;
   job->frames[2] = 0.5f * static_cast<float>(1 + data[1] % 4);
   TaskRec rec;
-  rec.start = static_cast<float>(data[2] % 50);
+  rec.current = rec.start = static_cast<float>(data[2] % 50);
   rec.end = rec.start + job->frames[2] * static_cast<float>(data[3] % 20);
-  rec.current = rec.start;
   rec.dev = dev;
   job->frames[1] = rec.end + 10.0f;
 
@@ -33,13 +28,11 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   entry.job = job;
   entry.rec = &rec;
   entry.stream = fmemopen(text.data(), text.size() + 1, "r");  // +1: empty text
-  if (entry.stream == nullptr) abort();
-  int changed = set_image_percentage_done(&entry);
-  if (changed != 0 && changed != 1) abort();
-  if (rec.current < rec.start || rec.current > rec.end) abort();
-  if (set_image_percentage_done(&entry) != 0) abort();
+  fuzz::require(entry.stream != nullptr, "fmemopen failed");
+  const int changed = set_image_percentage_done(&entry);
+  fuzz::require(changed == 0 || changed == 1, "not a yes or no");
+  fuzz::require(rec.current >= rec.start && rec.current <= rec.end, "the frame left the task");
+  fuzz::require(set_image_percentage_done(&entry) == 0, "a second look changed the task");
   fclose(entry.stream);
-  entry.stream = nullptr;
-  entry.rec = nullptr;
   return 0;
 }
