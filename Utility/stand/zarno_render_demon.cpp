@@ -129,27 +129,47 @@ int interval_seconds() { return static_cast<int>(rndctl.interval_min * 60 + rndc
 // How a wait ended.
 enum class Wake { kSignal, kTouched };
 
+// Whether the update time last seen can still hide a touch: a file server
+// that keeps whole seconds gives a touch within the second of the last
+// reload the same stamp.  Asked of the server's clock about once a second
+// (by this host's monotonic clock, however often signals end a wait).
+struct Settle {
+  bool settled;
+  int64_t next_ask_ns = 0;
+};
+
+int64_t monotonic_ns() {
+  struct timespec now;
+  clock_gettime(CLOCK_MONOTONIC, &now);
+  return static_cast<int64_t>(now.tv_sec) * 1000000000 + now.tv_nsec;
+}
+
+// True when the server's second has moved on past a whole-second stamp that
+// was not yet settled: the reload must then be the reconciling one, which
+// takes the files as they stand, as for any other touch.
+bool unsettled_second_passed(Settle* settle) {
+  if (settle->settled || monotonic_ns() < settle->next_ask_ns) return false;
+  settle->next_ask_ns = monotonic_ns() + 1000000000;
+  if (!rj_update_time_settled(rndctl.last_update, rj_heartbeat())) return false;
+  settle->settled = true;
+  rndctl.last_update = -1;  // forget the stamp
+  return true;
+}
+
 // One wait of the service loop: until the 20-second alarm or another signal,
 // or until the pid file's update time moves (a touch by an editor or another
-// daemon, looked at every 200 ms).  `settled` is false while the last reload
-// saw a whole-second stamp in the file server's current second: a touch in
-// that same second leaves the same stamp, so the wait asks the server's
-// clock about once a second and ends for one more reload when it has moved on.
-Wake wait_for_wake(const char* host, bool* settled) {
+// daemon, looked at every 200 ms), or an unsettled whole-second stamp is
+// settled.  A render that ended is news of its own: its record is to be
+// written and its processor is free, whatever the pid file's stamp says.
+Wake wait_for_wake(const char* host, Settle* settle) {
   RJ_alarm(20);
-  for (int polls = 1;; ++polls) {
+  for (;;) {
     if (RJ_pause_for(200) != 0) {
-      Task_judge_exits();
+      if (Task_judge_exits() != 0) return Wake::kTouched;
       return Wake::kSignal;
     }
     if (daemon_updatetime_get(host) != rndctl.last_update) return Wake::kTouched;
-    if (!*settled && polls % 5 == 0 && rj_update_time_settled(rndctl.last_update, rj_heartbeat())) {
-      *settled = true;
-      // Forget the stamp: the reload must be the reconciling one, which
-      // takes the files as they stand, as for any other touch.
-      rndctl.last_update = -1;
-      return Wake::kTouched;
-    }
+    if (unsettled_second_passed(settle)) return Wake::kTouched;
   }
 }
 
@@ -241,13 +261,13 @@ enum class After { kReload, kExit };
 // Waits between passes until a reload is due, or until the daemon is to
 // exit (then the access log says why).
 After wait_for_reload(Loop* loop) {
-  bool settled = rj_update_time_settled(rndctl.last_update, rj_heartbeat());
+  Settle settle{rj_update_time_settled(rndctl.last_update, rj_heartbeat())};
   time_t start = time(nullptr);
   if (daemon_updatetime_get(loop->host) != rndctl.last_update || loop->interval < 0) {
     return After::kReload;
   }
   for (;;) {
-    Wake wake = wait_for_wake(loop->host, &settled);
+    Wake wake = wait_for_wake(loop->host, &settle);
     if (!Pidfile_self_check()) {
       wrt_logfile("Exiting due to self check failure");
       return After::kExit;

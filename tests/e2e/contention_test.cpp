@@ -1,5 +1,7 @@
 // Eight hosts race for the one-frame tasks of one job of very short frames:
 // the task file's lock is all that keeps two hosts from taking the same task.
+// Once on a local directory, once with every host on its own network mount
+// (own attribute cache, whole-second stamps).
 #include <map>
 
 #include "tests/e2e/farm_hosts.h"
@@ -7,13 +9,18 @@
 
 namespace {
 
-TEST(Contention, EightHostsRenderEveryFrameOfOneJobExactlyOnce) {
+class Contention : public ::testing::TestWithParam<bool> {};
+
+TEST_P(Contention, EightHostsRenderEveryFrameOfOneJobExactlyOnce) {
   if (!can_name_hosts())
     GTEST_SKIP() << "needs root or user namespaces: daemons run under other host names";
+  SshServer ssh;
+  std::string why;
+  if (GetParam() && !ssh.start(&why)) GTEST_SKIP() << "no network mounts here: " << why;
   constexpr int kFrames = 64;
   Farm farm;
   std::string scene = make_project(farm);
-  FarmHosts hosts(farm, nullptr);
+  FarmHosts hosts(farm, GetParam() ? &ssh : nullptr);
   std::vector<std::string> names;
   std::vector<ResourceSpec> resources;
   for (int i = 0; i < 8; ++i) {
@@ -49,5 +56,9 @@ TEST(Contention, EightHostsRenderEveryFrameOfOneJobExactlyOnce) {
   EXPECT_TRUE(missing.empty()) << "frames never rendered:" << missing;
   EXPECT_TRUE(hosts.shut_down(30).empty()) << "a daemon did not leave when stopped";
 }
+
+INSTANTIATE_TEST_SUITE_P(Mounts, Contention, ::testing::Values(false, true), [](const auto& info) {
+  return std::string(info.param ? "Sshfs" : "Local");
+});
 
 }  // namespace
