@@ -102,9 +102,10 @@ void TaskAfterLock::run() {
 }
 
 std::vector<const Dev*> Task_full_devs(const TaskGroup* groups, const std::vector<Job*>& jobs) {
-  // Only the resources of the jobs to be woken are counted: a walk of a
-  // large file with a hash look-up a record would cost more than the cycle
-  // it follows.
+  // Only the resources of the jobs to be woken are counted, and only in
+  // those jobs' groups: a walk of the whole of a large file would cost the
+  // selection cycle several per cent.  A host busy with another job's
+  // renders counts as free; waking it costs it one look.
   std::vector<const Dev*> devs;
   for (const Job* job : jobs) {
     for (const RndDevList* e = job != nullptr ? job->resources : nullptr; e != nullptr;
@@ -116,6 +117,7 @@ std::vector<const Dev*> Task_full_devs(const TaskGroup* groups, const std::vecto
   }
   std::vector<int> busy(devs.size(), 0);
   for (const TaskGroup* g = groups; g != nullptr && !devs.empty(); g = g->next) {
+    if (std::find(jobs.begin(), jobs.end(), g->job) == jobs.end()) continue;
     for (const TaskRec* rec = g->tasks; rec != nullptr; rec = rec->next) {
       if (rec->status != TASK_STARTED && rec->status != TASK_RUNNING) continue;
       auto at = std::find(devs.begin(), devs.end(), rec->dev);

@@ -72,8 +72,9 @@ struct TaskAfterLock {
   void run();
 };
 
-/// Of the resources that `jobs` name, those that records of `groups` show
-/// STARTED or RUNNING on as many times as they have processors (at least 1).
+/// Of the resources that `jobs` name, those that the jobs' records in
+/// `groups` show STARTED or RUNNING on as many times as they have processors
+/// (at least 1).
 /// Such a host has nothing to take now and looks for work itself when one of
 /// its renders ends, so waking it would only make it read the files for
 /// nothing.
