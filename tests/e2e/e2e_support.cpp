@@ -184,11 +184,6 @@ int read_pid_file(const std::string& path) {
   return pid;
 }
 
-void write_pid_file(const std::string& path, int pid) {
-  int32_t value = pid;
-  write_text_file(path, std::string(reinterpret_cast<const char*>(&value), sizeof value));
-}
-
 std::vector<int> children_of(int pid, int* zombies) {
   std::vector<int> kids;
   int z = 0;

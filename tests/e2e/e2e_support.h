@@ -101,5 +101,3 @@ bool can_name_hosts();
 
 /// The 4-byte native pid stored in a pid file, or 0.
 int read_pid_file(const std::string& path);
-/// Writes a 4-byte native pid file.
-void write_pid_file(const std::string& path, int pid);

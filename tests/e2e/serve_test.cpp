@@ -103,7 +103,7 @@ class ServeTest : public ::testing::Test {
         {.name = "done", .index = 3, .status = "finished"}};
     farm_.write("Render_Job_Control", with_markup_note(job_file(jobs, scene_), "half 2 {\n"));
     // This host's daemon is gone: a pid file naming an ended process.
-    write_pid_file(farm_.path(host_ + ".pid"), exited_pid());
+    write_text_file(farm_.path(host_ + ".pid"), pid_bytes(exited_pid()));
   }
   Farm farm_;
   std::string host_ = this_host_name();
