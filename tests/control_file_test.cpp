@@ -281,25 +281,4 @@ INSTANTIATE_TEST_SUITE_P(Outputs, ErrorLineTest, testing::Values(
     std::string(300, '*') + "/Error frame 12 failed\n"));
 // clang-format on
 
-// The task status file is read back by "%s": a job name with blanks must
-// not shift the fields after it.
-TEST_F(ControlFileTest, StatusFileNamesAreOneToken) {
-  Job* job = Add_a_job(nullptr, "x.sdl", 5);
-  Job* other = Add_a_job(nullptr, "y.sdl", 6);
-  Dev* dev = Add_a_dev(nullptr, "box", 1);
-  ASSERT_TRUE(job && other && dev);
-  job->name.set("my shot\tv2\n");
-  other->name.set("");
-  dev->host_name.set("testhost");
-  for (auto [owner, output] : {std::pair{job, "/pix/a.0001"}, {other, "/pix/b.0001"}}) {
-    TASK* e = Task_add(owner, TaskRec_alloc(nullptr, 0, 0, 0, dev, TASK_RUNNING, nullptr, 0));
-    ASSERT_NE(e, nullptr);
-    e->output.set(output);
-  }
-  Task_update_status();
-  EXPECT_EQ(read_file("TSKSTAT/testhost"), "my_shot_v2_ 5 2 /pix/a.0001\n- 6 2 /pix/b.0001\n");
-  EXPECT_STREQ(Task_current_filenames(other, dev), "/pix/b.0001 ");
-  EXPECT_EQ(RJC_label_form("caf\xc3\xa9"), "caf\xc3\xa9");
-}
-
 }  // namespace

@@ -183,12 +183,7 @@ TEST_F(FileopTest, ReleaseRemovesOnlyLocksThisProcessHolds) {
                                        {FILE_TASKS, 1},     {FILE_DEV_INDEX, 1},
                                        {FILE_JOB_INDEX, 1}, {FILE_JOB_INDEX, 0}};
   for (auto [index, take] : steps) ASSERT_EQ(lock_fileop(index, take), 1) << index << " " << take;
-  // A syntax error ends the process; on its way out it lets go of its locks.
-  void (*saved_exit)(int) = std::exchange(RJC_fatal_exit, [](int) {});
-  testing::internal::CaptureStdout();
-  RJC_parse_string("RenderJobControl {{{", 20, "Render_Job_Control");
-  testing::internal::GetCapturedStdout();
-  RJC_fatal_exit = saved_exit;
+  fileop_release_held_locks();  // what a fatal exit does on its way out
   EXPECT_EQ(
       std::tuple(entries(), dir_names(lock_dir(FILE_JOBS)), dir_names(lock_dir(FILE_RESOURCES))),
       std::tuple(Names{"Render_Job_Control.lock", "Render_Resource_Control.lock"},

@@ -50,33 +50,18 @@ class ReclaimTest : public TaskFixture {
 
 // Nothing done goes back pending, whole, for any host; midway keeps the done
 // frames; at the last frame that frame stays pending.  Retries are kept.
-TEST_F(ReclaimTest, PutBackCutsAtTheFrameReached) {
-  for (auto [current, expected] : {std::pair<float, const char*>{1, "2 1 6 1 0 3 PENDING"},
-                                   {4, "2 1 3 3 1 3 FINISHED, 5 4 6 4 0 3 PENDING"},
-                                   {6, "2 1 5 5 1 3 FINISHED, 5 6 6 6 0 3 PENDING"}}) {
-    TaskGroup* groups = TaskGroup_alloc(job_, 5);
-    TaskRec* rec = TaskRec_alloc(groups, 1, 6, current, dev_, TASK_RUNNING, nullptr, 2);
-    rec->retries = 3;
-    Task_put_back(&groups, groups, rec);
-    std::string got;
-    for (TaskRec* r = groups->tasks; r != nullptr; r = r->next)
-      got += rec_line(r->id, r->start, r->end, r->current, r->dev ? r->dev->index : 0, r->retries,
-                      GetTaskStatusStr(r->status));
-    EXPECT_EQ(got, rec_lines(expected)) << current;
-    TaskGroup_free_all(&groups);
-  }
-}
-
 TEST_F(ReclaimTest, StartUpPutsBackOnlyThisHostsHeldTasks) {
   std::string name = job_->name.c_str();
   write_file("Render_Tasks",
-             group_line(name, 1, 4, 4) + rec_lines("0 1 2 1 1 0 STARTED, 1 3 6 5 1 1 RUNNING, "
-                                                   "2 7 8 7 2 0 RUNNING, 3 9 10 9 0 0 PENDING"));
-  EXPECT_EQ(Task_reclaim_this_host(), 2);
+             group_line(name, 1, 5, 5) + rec_lines("0 1 2 1 1 0 STARTED, 1 3 6 5 1 1 RUNNING, "
+                                                   "2 7 8 7 2 0 RUNNING, 3 9 10 9 0 0 PENDING, "
+                                                   "4 11 12 12 1 0 RUNNING"));
+  EXPECT_EQ(Task_reclaim_this_host(), 3);
   EXPECT_EQ(read_file("Render_Tasks"),
-            group_line(name, 1, 5, 5) + rec_lines("0 1 2 1 0 0 PENDING, 1 3 4 4 1 1 FINISHED, "
+            group_line(name, 1, 7, 7) + rec_lines("0 1 2 1 0 0 PENDING, 1 3 4 4 1 1 FINISHED, "
                                                   "2 7 8 7 2 0 RUNNING, 3 9 10 9 0 0 PENDING, "
-                                                  "4 5 6 5 0 1 PENDING"));
+                                                  "4 11 11 11 1 0 FINISHED, 5 5 6 5 0 1 PENDING, "
+                                                  "6 12 12 12 0 0 PENDING"));
   EXPECT_EQ(access(path("Render_Tasks.lock").c_str(), F_OK), -1);
 }
 

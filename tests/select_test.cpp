@@ -289,8 +289,6 @@ INSTANTIATE_TEST_SUITE_P(
         OwnerCase{"still_ours", "0 1 3 1 1 0 STARTED, 1 4 10 4 0 0 PENDING", TASK_RUNNING, true, 2,
                   "0 1 3 1 1 0 RUNNING, 1 4 10 4 0 0 PENDING"},
         OwnerCase{"put_back", "0 1 3 1 1 0 PENDING, 1 4 10 4 0 0 PENDING", TASK_PENDING, false, 2},
-        OwnerCase{"taken_by_another_host", "0 1 3 1 2 0 RUNNING, 1 4 10 4 0 0 PENDING",
-                  TASK_RUNNING, false, 2},
         OwnerCase{"rebuilt_from_id_0", "0 1 10 1 0 0 PENDING", TASK_PENDING, false, 1},
         OwnerCase{"lost_elsewhere_and_left_by_an_earlier_daemon",
                   "0 1 3 1 2 0 FINISHED, 1 4 6 4 1 0 RUNNING, 2 7 10 7 0 0 PENDING", TASK_FINISHED,

@@ -157,20 +157,6 @@ INSTANTIATE_TEST_SUITE_P(
                     EndCase{"killed_fails_keeping_saved_output", 9, 1, TASK_FAILED, true}),
     label_of);
 
-TEST_F(StatusTest, RenderOfADeletedJobIsKilledAndEndedOnceReaped) {
-  TASK* entry = entry_with_stream(1, 10, "", "rendering\n");
-  const int pid = sleeper();
-  entry->pid = pid;
-  entry->job = nullptr;  // the reload found the job gone
-  UpdateRunningTasks();
-  EXPECT_EQ(wait_for(pid), SIGKILL);  // the wait status of a kill
-  ASSERT_EQ(rndctl.tasks, entry);     // still there until reaped
-  entry->pid = 0;                     // as the reaping side leaves it
-  UpdateRunningTasks();
-  EXPECT_TRUE(rndctl.tasks == nullptr && !exists(path("stream")) && !exists(path("out")));
-  EXPECT_EQ(read_file("TSKSTAT/testhost"), "");
-}
-
 TEST_F(StatusTest, FailedTaskOfThisHostsJobEndsInTheJobFileWithItsError) {
   // The resource is named after the host, as the reload matches them.
   Dev* host_dev = Dev_new(nullptr, nullptr, "testhost", 3);

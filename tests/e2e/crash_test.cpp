@@ -38,10 +38,6 @@ class CrashTest : public ::testing::Test {
   }
   std::string image(int frame) { return farm_.path("project/pix/spin." + std::to_string(frame)); }
   bool rendered(int frame) { return access(image(frame).c_str(), F_OK) == 0; }
-  bool finished(Daemon& d) {
-    wait_for([&] { return job_status(farm_, "spin") == "finished" || d.ended(); }, 120, &d);
-    return job_status(farm_, "spin") == "finished";
-  }
   // The one render program the daemon runs, once its task is RUNNING.
   int running_render(Daemon& d) {
     auto running = [&] { return farm_.read("Render_Tasks").find("RUNNING") != std::string::npos; };
@@ -91,7 +87,7 @@ TEST_F(CrashTest, ARestartedDaemonEndsTheOldRenderAndRendersTheRestFromTheFrameR
   Daemon& second = farm_.start_on_farm({}, "", {render_env()[0], "DRCTMPDIR=" + first.tmpdir});
   second.tmpdir = first.tmpdir;
   EXPECT_TRUE(wait_for([&] { return process_gone(render); }, 30));
-  ASSERT_TRUE(finished(second)) << second.log() << farm_.read("Render_Tasks");
+  ASSERT_TRUE(job_finishes(farm_, second)) << second.log() << farm_.read("Render_Tasks");
 
   for (int frame = 1; frame <= 6; ++frame) EXPECT_TRUE(rendered(frame)) << frame;
   EXPECT_EQ(images_before(static_cast<int>(reached)), done) << "a done frame was rendered again";
@@ -143,7 +139,7 @@ TEST_F(CrashTest, TasksOfAHostWhoseHeartbeatStoppedAreCutAndRenderedHere) {
   ASSERT_EQ(utimensat(AT_FDCWD, farm_.path("TSKSTAT/ghost").c_str(), old, 0), 0);
 
   Daemon& d = farm_.start_on_farm({}, "", {render_env()[0], "ZARNO_RNDCTL_HOST_TIMEOUT=60"});
-  ASSERT_TRUE(finished(d)) << d.log() << farm_.read("Render_Tasks");
+  ASSERT_TRUE(job_finishes(farm_, d)) << d.log() << farm_.read("Render_Tasks");
   EXPECT_TRUE(rendered(3) && rendered(4));
   EXPECT_FALSE(rendered(1)) << "frames the ghost had done are not rendered again";
   EXPECT_THAT(farm_.read("Render_Access"),

@@ -132,7 +132,7 @@ TEST_F(DaemonLifecycle, ATouchOfThePidFileWakesAnIdleDaemonWithoutASignal) {
   ASSERT_TRUE(wait_for([&] { return taken() || job_status(farm, "spin") == "finished"; }, 120))
       << d.log();
   EXPECT_LT(std::chrono::steady_clock::now() - touched, std::chrono::seconds(15)) << d.log();
-  ASSERT_TRUE(wait_for([&] { return job_status(farm, "spin") == "finished"; }, 120)) << d.log();
+  ASSERT_TRUE(job_finishes(farm, d)) << d.log();
 }
 
 TEST_F(DaemonLifecycle, DebugOptionWinsOverTheEnvironment) {

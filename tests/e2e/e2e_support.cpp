@@ -1,7 +1,10 @@
 #include "tests/e2e/e2e_support.h"
 
+#include <arpa/inet.h>
 #include <fcntl.h>
+#include <netinet/in.h>
 #include <signal.h>
+#include <sys/socket.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -126,6 +129,30 @@ bool wait_for(const std::function<bool()>& done, double seconds, Daemon* wake) {
   return done();
 }
 
+int free_port() {
+  int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_in a{
+      .sin_family = AF_INET, .sin_port = 0, .sin_addr = {htonl(INADDR_LOOPBACK)}, .sin_zero = {}};
+  socklen_t len = sizeof a;
+  if (bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof a) != 0 ||
+      getsockname(fd, reinterpret_cast<sockaddr*>(&a), &len) != 0)
+    a.sin_port = 0;
+  close(fd);
+  return ntohs(a.sin_port);
+}
+
+bool stop_between_locks(const Farm& farm, const Daemon& d, double seconds) {
+  return wait_for(
+      [&] {
+        kill(d.pid, SIGSTOP);
+        for (const std::string& name : dir_names(farm.dir()))
+          if (name.ends_with(".lock") && access(farm.path(name + "/" + d.host).c_str(), F_OK) == 0)
+            return kill(d.pid, SIGCONT), false;
+        return true;
+      },
+      seconds);
+}
+
 bool pid_gone(int pid) { return access(("/proc/" + std::to_string(pid)).c_str(), F_OK) != 0; }
 
 int count_of(const std::string& text, const std::string& needle) {
@@ -155,11 +182,6 @@ int read_pid_file(const std::string& path) {
   int32_t pid = 0;
   if (data.size() >= sizeof pid) memcpy(&pid, data.data(), sizeof pid);
   return pid;
-}
-
-void write_pid_file(const std::string& path, int pid) {
-  int32_t value = pid;
-  write_text_file(path, std::string(reinterpret_cast<const char*>(&value), sizeof value));
 }
 
 std::vector<int> children_of(int pid, int* zombies) {

@@ -75,6 +75,15 @@ class Farm {
 /// then, until it holds or `seconds` have passed.  Returns whether it held.
 bool wait_for(const std::function<bool()>& done, double seconds, Daemon* wake = nullptr);
 
+/// A loopback port nobody listens on now, or 0 (a race with another program
+/// shows as a failed start).
+int free_port();
+
+/// Stops `d` (SIGSTOP) at a moment it holds no lock of the control directory:
+/// a stopped holder keeps every other host waiting until the lock counts as
+/// stale.  False, the daemon running, when no such moment came in `seconds`.
+bool stop_between_locks(const Farm& farm, const Daemon& d, double seconds = 60);
+
 /// Counts the occurrences of `needle` in `text`.
 int count_of(const std::string& text, const std::string& needle);
 
@@ -92,5 +101,3 @@ bool can_name_hosts();
 
 /// The 4-byte native pid stored in a pid file, or 0.
 int read_pid_file(const std::string& path);
-/// Writes a 4-byte native pid file.
-void write_pid_file(const std::string& path, int pid);

@@ -19,8 +19,7 @@ TEST(MultiHost, TwoHostsShareAJobWithoutRenderingAFrameTwice) {
       job_file({{.end = 12, .opts = "slow=1", .hosts = {"hostA", "hostB"}}}, make_project(farm)));
   Daemon& da = farm.start_on_farm({}, "hostA", render_env());
   Daemon& db = farm.start_on_farm({}, "hostB", render_env());
-  ASSERT_TRUE(wait_for([&] { return job_status(farm, "spin") == "finished"; }, 120, &da))
-      << da.log() << db.log();
+  ASSERT_TRUE(job_finishes(farm, da)) << da.log() << db.log();
   EXPECT_FALSE(da.ended() || db.ended());
 
   // The job log lists every task with the host that rendered it.  Frame f is

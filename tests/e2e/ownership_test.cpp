@@ -55,14 +55,7 @@ TEST_F(Ownership, RestartWhileAHostIsStoppedRendersEveryFrameAgain) {
 
   // hostA misses the whole restart window, stopped while it holds no lock: a stopped
   // holder would keep the editor (and hostB) waiting until the lock counts as stale.
-  ASSERT_TRUE(wait_for(
-      [&] {
-        kill(da.pid, SIGSTOP);
-        for (const std::string& name : dir_names(farm_.dir()))
-          if (name.ends_with(".lock")) return kill(da.pid, SIGCONT), false;
-        return true;
-      },
-      60));
+  ASSERT_TRUE(stop_between_locks(farm_, da));
   const size_t restart_at = farm_.read("frame_painter.log").size();
   // A daemon writing back its own view of the job before it reads the edit undoes it: say it again.
   for (int attempt = 0;; ++attempt) {
@@ -78,8 +71,7 @@ TEST_F(Ownership, RestartWhileAHostIsStoppedRendersEveryFrameAgain) {
   ASSERT_EQ(kill(da.pid, SIGCONT), 0);
   utimensat(AT_FDCWD, farm_.path("hostA.pid").c_str(), nullptr, 0);
 
-  ASSERT_TRUE(wait_for([&] { return job_status(farm_, "spin") == "finished"; }, 240, &da))
-      << da.log() << db.log();
+  ASSERT_TRUE(job_finishes(farm_, da, 240)) << da.log() << db.log();
   std::string rendered(12, '-');
   renders(restart_at, &rendered);
   EXPECT_EQ(rendered, std::string(12, '#'));  // every frame, since the restart

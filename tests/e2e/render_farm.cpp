@@ -66,6 +66,11 @@ std::vector<FileRec> task_records(Farm& farm) {
   return recs;
 }
 
+bool job_finishes(Farm& farm, Daemon& d, double seconds, const std::string& job) {
+  auto done = [&] { return job_status(farm, job) == "finished"; };
+  return wait_for([&] { return done() || d.ended(); }, seconds, &d) && done();
+}
+
 std::vector<std::string> lock_dirs(Farm& farm) {
   std::vector<std::string> locks = dir_names(farm.dir());
   std::erase_if(locks, [](const std::string& name) { return !name.ends_with(".lock"); });

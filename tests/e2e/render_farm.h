@@ -51,6 +51,10 @@ std::string make_project(Farm& farm);
 /// Environment for daemons that run the demo or the stamping render program.
 std::vector<std::string> render_env();
 
+/// Waits up to `seconds`, waking `d`, for `job` to be "finished"; false when
+/// it is not (or `d` ended first).
+bool job_finishes(Farm& farm, Daemon& d, double seconds = 120, const std::string& job = "spin");
+
 /// The lock directories ("NAME.lock") in the control directory.
 std::vector<std::string> lock_dirs(Farm& farm);
 

@@ -32,10 +32,6 @@ class RenderTest : public ::testing::Test {
     }
     return farm_.start_on_farm({}, "", env);
   }
-  bool finishes(Daemon& d) {
-    auto done = [&] { return job_status(farm_, "spin") == "finished"; };
-    return wait_for([&] { return done() || d.ended(); }, 120, &d) && done();
-  }
   // '#' for each of frames 1 to `last` whose image is there, '-' for each missing.
   std::string images(int last) {
     std::string out;
@@ -49,15 +45,6 @@ class RenderTest : public ::testing::Test {
   std::string scene_;
 };
 
-TEST_F(RenderTest, AJobIsRenderedToFinished) {
-  Daemon& d = start(3, 2, 7);
-  ASSERT_TRUE(finishes(d)) << d.log();
-  EXPECT_EQ(images(8), "#######-");
-  // The finished job's group has left the task file.
-  EXPECT_EQ(farm_.read("Render_Tasks").find("spin"), std::string::npos)
-      << farm_.read("Render_Tasks");
-}
-
 TEST_F(RenderTest, RenderProgramsEndingTogetherAreAllJudged) {
   Daemon& d = start(1, 2, 4, "slow=1");
   // Two render programs at work; stop the daemon so that both end while it
@@ -68,10 +55,12 @@ TEST_F(RenderTest, RenderProgramsEndingTogetherAreAllJudged) {
   const bool both_ended = wait_for([&] { return children_of(d.pid, &zombies), zombies == 2; }, 30);
   kill(d.pid, SIGCONT);
   ASSERT_TRUE(both_ended);
-  ASSERT_TRUE(finishes(d)) << d.log();
+  ASSERT_TRUE(job_finishes(farm_, d)) << d.log();
   EXPECT_TRUE(children_of(d.pid).empty());
   EXPECT_EQ(count_of(d.log(), "UNKNOWN"), 0) << d.log();
-  EXPECT_EQ(images(4), "####");
+  EXPECT_EQ(images(5), "####-");
+  // The finished job's group has left the task file.
+  EXPECT_EQ(farm_.read("Render_Tasks").find("spin"), std::string::npos);
 }
 
 // The render program is a wrapper that runs the real renderer as its own
@@ -96,7 +85,7 @@ TEST_F(RenderTest, RenderProgramsInheritOnlyTheirThreeStreams) {
   Daemon& d =
       start(1, 2, 2, "",
             "ls /proc/self/fd >> " + farm_.path("fds") + "\nexec " FRAME_PAINTER_PATH " \"$@\"\n");
-  ASSERT_TRUE(finishes(d)) << d.log();
+  ASSERT_TRUE(job_finishes(farm_, d)) << d.log();
   EXPECT_EQ(farm_.read("fds"), "0\n1\n2\n3\n0\n1\n2\n3\n");
 }
 

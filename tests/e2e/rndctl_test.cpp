@@ -41,9 +41,6 @@ class RndctlTest : public ::testing::Test {
     return {"submit",       scene_,          "--name", name,          "--frames", frames,
             "--executable", "frame_painter", "--pix",  "pix/" + name, "--hosts",  host_};
   }
-  bool finished(Daemon& d) {
-    return wait_for([&] { return job_status(farm_, "spin") == "finished"; }, 120, &d);
-  }
   Farm farm_;
   std::string host_ = this_host_name(), scene_ = make_project(farm_);
 };
@@ -61,16 +58,15 @@ TEST_F(RndctlTest, ASubmittedJobPausesResumesListsRestartsAndGoes) {
   for (int i = 0; i < 5; i++) d.wake(), usleep(100000);
   EXPECT_NE(job_status(farm_, "spin"), "finished");
   ASSERT_EQ(rndctl(farm_, {"resume", "spin"}).code(), 0);
-  ASSERT_TRUE(finished(d)) << d.log();
+  ASSERT_TRUE(job_finishes(farm_, d)) << d.log();
   nlohmann::json jobs = tool_json(farm_, {"jobs", "--json"});
   ASSERT_EQ(jobs.size(), 1u) << jobs;
   EXPECT_EQ(std::tuple(jobs[0]["name"], jobs[0]["state"], jobs[0]["doneframes"], jobs[0]["hosts"]),
             std::tuple("spin", "finished", 12, nlohmann::json{host_}));
-  EXPECT_EQ(tool_json(farm_, {"hosts", "--json"})[0]["alive"], true);
   std::string image = farm_.path("project/pix/spin.1");
   ASSERT_EQ(unlink(image.c_str()), 0);
   ASSERT_EQ(rndctl(farm_, {"restart", "spin", "--timeout", "60"}).code(), 0);
-  ASSERT_TRUE(finished(d)) << d.log();
+  ASSERT_TRUE(job_finishes(farm_, d)) << d.log();
   EXPECT_EQ(access(image.c_str(), F_OK), 0);
   ASSERT_EQ(rndctl(farm_, {"delete", "spin"}).code(), 0);
   EXPECT_EQ(job_block(farm_, "spin"), "");
@@ -149,20 +145,6 @@ class RndctlFarmTest : public ::testing::Test {
       if (s.start_ns > after_ns) n[s.host]++;
     return n;
   }
-  // Cuts `host`'s power at a moment its daemon holds no lock of the control
-  // directory: a dead host's lock holds everyone else up for minutes.
-  bool power_cut_between_locks(const std::string& host) {
-    Daemon* daemon = hosts_.daemon(host);
-    for (int tries = 0; daemon != nullptr && tries < 500; ++tries, usleep(20000)) {
-      kill(daemon->pid, SIGSTOP);
-      bool holds = false;
-      for (const std::string& n : lock_dirs(farm_))
-        holds |= access(farm_.path(n + "/" + host).c_str(), F_OK) == 0;
-      if (!holds) return hosts_.power_cut(host), true;
-      kill(daemon->pid, SIGCONT);
-    }
-    return false;
-  }
   bool finished(double seconds) {
     return hosts_.wait_until([&] { return job_status(farm_, "spin") == "finished"; }, seconds);
   }
@@ -198,7 +180,9 @@ TEST_F(RndctlFarmTest, AHostLockStopsNewWorkOnThatHostAtOnce) {
 TEST_F(RndctlFarmTest, CheckPutsADeadHostsTasksBackForTheOthers) {
   make_farm({"liveA", "deadB"}, 6, 2);
   ASSERT_TRUE(hosts_.wait_until([&] { return !active_on("deadB").empty(); }, 60));
-  ASSERT_TRUE(power_cut_between_locks("deadB"));
+  // Its power cut while it holds no lock: a dead host's lock holds everyone up for minutes.
+  ASSERT_TRUE(stop_between_locks(farm_, *hosts_.daemon("deadB")));
+  hosts_.power_cut("deadB");
   EXPECT_EQ(tool_json(farm_, {"hosts", "--json"})[0]["alive"], true);
   EXPECT_EQ(tool_json(farm_, {"check", "--json"})["jobs_put_back"], 1);
   EXPECT_EQ(active_on("deadB"), std::vector<int>{}) << farm_.read("Render_Tasks");

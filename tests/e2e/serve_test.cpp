@@ -19,25 +19,6 @@ namespace {
 
 using nlohmann::json;
 
-sockaddr_in loopback(int port) {
-  return {.sin_family = AF_INET,
-          .sin_port = htons(static_cast<uint16_t>(port)),
-          .sin_addr = {htonl(INADDR_LOOPBACK)},
-          .sin_zero = {}};
-}
-
-// A port nobody listens on now (a race with another program shows as a failed start).
-int free_port() {
-  int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_in a = loopback(0);
-  socklen_t len = sizeof a;
-  if (bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof a) != 0 ||
-      getsockname(fd, reinterpret_cast<sockaddr*>(&a), &len) != 0)
-    a.sin_port = 0;
-  close(fd);
-  return ntohs(a.sin_port);
-}
-
 // `rndctl serve` on a farm, which owns the process; SIGTERM must end it cleanly.
 struct Server {
   int port = free_port();
@@ -79,7 +60,10 @@ int status_of_get_with_body(int port, size_t size) {
       "GET /api/jobs HTTP/1.1\r\nHost: x\r\nContent-Length: " + std::to_string(size) + "\r\n\r\n" +
       std::string(size, 'x');
   int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_in a = loopback(port);
+  sockaddr_in a{.sin_family = AF_INET,
+                .sin_port = htons(static_cast<uint16_t>(port)),
+                .sin_addr = {htonl(INADDR_LOOPBACK)},
+                .sin_zero = {}};
   char reply[256] = {};
   // The server may answer and close before it has read everything: a failed send is no fault.
   if (connect(fd, reinterpret_cast<sockaddr*>(&a), sizeof a) == 0)
@@ -119,7 +103,7 @@ class ServeTest : public ::testing::Test {
         {.name = "done", .index = 3, .status = "finished"}};
     farm_.write("Render_Job_Control", with_markup_note(job_file(jobs, scene_), "half 2 {\n"));
     // This host's daemon is gone: a pid file naming an ended process.
-    write_pid_file(farm_.path(host_ + ".pid"), exited_pid());
+    write_text_file(farm_.path(host_ + ".pid"), pid_bytes(exited_pid()));
   }
   Farm farm_;
   std::string host_ = this_host_name();

@@ -11,6 +11,9 @@ for f in "$build"/tests/fuzz/*_fuzz; do
   work=$(mktemp -d)
   seeds="$here/corpus/${name%_fuzz}"
   [ -d "$seeds" ] && cp -r "$seeds"/. "$work"/
+  if [ "$name" = control_file_fuzz ]; then  # the golden files seed it too
+    for g in plain lenient; do for f in "$here"/../golden/$g/*; do cp "$f" "$work/$g-$(basename "$f")"; done; done
+  fi
   echo "== $name for ${seconds}s"
   if ! (cd "$work" && "$f" -max_total_time="$seconds" -rss_limit_mb=2048 -print_final_stats=1 "$work" 2>&1 | tail -n 12); then
     status=1
