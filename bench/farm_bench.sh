@@ -39,7 +39,8 @@ pids=()
 stop_all() {
   local p
   for p in "${pids[@]}"; do kill -KILL "$p" 2>/dev/null || true; done
-  for p in "${pids[@]}"; do wait "$p" 2>/dev/null || true; done
+  # (the shell's own note of each killed job goes too)
+  { for p in "${pids[@]}"; do wait "$p" || true; done; } 2>/dev/null
   pkill_renders
   pids=()
 }

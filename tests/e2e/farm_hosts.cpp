@@ -132,6 +132,8 @@ FarmHosts::FarmHosts(Farm& farm, const SshServer* ssh)
 FarmHosts::~FarmHosts() {
   for (auto& [name, host] : hosts_) power_cut(name);
   for (int pid : renders_left()) kill(pid, SIGKILL);
+  for (auto& [name, host] : hosts_)
+    for (int fd : host.namespace_fds) close(fd);
 }
 
 Daemon* FarmHosts::daemon(const std::string& host) {
@@ -158,7 +160,17 @@ bool FarmHosts::start(const std::string& name) {
   Daemon* started = host.starts.emplace_back(&farm_.run(argv, name, env_));
   bool up =
       wait_for([&] { return started->in_loop() || started->ended(); }, 30) && !started->ended();
-  if (std::string ns = up ? uts_of(started->pid) : ""; !ns.empty()) host.namespaces.insert(ns);
+  if (std::string ns = up ? uts_of(started->pid) : ""; !ns.empty()) {
+    int fd =
+        open(("/proc/" + std::to_string(started->pid) + "/ns/uts").c_str(), O_RDONLY | O_CLOEXEC);
+    // The namespace is kept only when the file opened is still the one read.
+    if (fd >= 0 && uts_of(started->pid) == ns) {
+      host.namespaces.insert(ns);
+      host.namespace_fds.push_back(fd);
+    } else if (fd >= 0) {
+      close(fd);
+    }
+  }
   return up;
 }
 

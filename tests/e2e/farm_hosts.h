@@ -82,6 +82,10 @@ class FarmHosts {
   struct Host {
     std::vector<Daemon*> starts;       // the latest last; owned by the farm
     std::set<std::string> namespaces;  // "uts:[...]" of every start
+    // Held open until the farm goes: a namespace no longer referenced may
+    // have its number given to another one (a host of a test running
+    // beside this one), whose processes a power cut here would then kill.
+    std::vector<int> namespace_fds;
   };
 
   Farm& farm_;
