@@ -12,7 +12,9 @@ for f in "$build"/tests/fuzz/*_fuzz; do
   seeds="$here/corpus/${name%_fuzz}"
   [ -d "$seeds" ] && cp -r "$seeds"/. "$work"/
   if [ "$name" = control_file_fuzz ]; then  # the golden files seed it too
-    for g in plain lenient; do for f in "$here"/../golden/$g/*; do cp "$f" "$work/$g-$(basename "$f")"; done; done
+    for g in plain lenient; do
+      for seed in "$here"/../golden/$g/*; do cp "$seed" "$work/$g-$(basename "$seed")"; done
+    done
   fi
   echo "== $name for ${seconds}s"
   if ! (cd "$work" && "$f" -max_total_time="$seconds" -rss_limit_mb=2048 -print_final_stats=1 "$work" 2>&1 | tail -n 12); then
