@@ -56,15 +56,15 @@ TEST(StateWords, DecodeCaseSensitively) {
 TEST_F(RecordsTest, NewWorkWakesOnlyOtherHostsWithAFreeProcessor) {
   // Hosts: a (1 processor, rendering: full), b (2 processors, one render),
   // c (one full resource and one free), d (idle), and this host.
-  struct DevSpec {
+  struct DevRow {
     const char* name;
     const char* host;
     int procs;
-  } const specs[] = {{"a1", "a", 1}, {"b1", "b", 2}, {"c1", "c", 1},
-                     {"c2", "c", 1}, {"d1", "d", 1}, {"me", "testhost", 1}};
+  } const rows[] = {{"a1", "a", 1}, {"b1", "b", 2}, {"c1", "c", 1},
+                    {"c2", "c", 1}, {"d1", "d", 1}, {"me", "testhost", 1}};
   Job* job = Job_new(nullptr, nullptr, "shot", 1);
   std::vector<Dev*> devs;
-  for (const DevSpec& s : specs) {
+  for (const DevRow& s : rows) {
     Dev* dev = Dev_new(nullptr, nullptr, s.name, 0);
     dev->host_name.set(s.host);
     dev->num_processors = s.procs;

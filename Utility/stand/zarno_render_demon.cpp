@@ -23,6 +23,7 @@
 #include "Utility/rndctl/base/rj_control.h"
 #include "Utility/rndctl/base/rj_log.h"
 #include "Utility/rndctl/base/rj_text.h"
+#include "Utility/rndctl/ctldir/rj_fileio.h"
 #include "Utility/rndctl/ctldir/rj_pidfile.h"
 #include "Utility/rndctl/ctldir/rj_updatetime.h"
 #include "Utility/rndctl/ctlfile/rj_reload.h"
@@ -138,18 +139,13 @@ struct Settle {
   int64_t next_ask_ns = 0;
 };
 
-int64_t monotonic_ns() {
-  struct timespec now;
-  clock_gettime(CLOCK_MONOTONIC, &now);
-  return static_cast<int64_t>(now.tv_sec) * 1000000000 + now.tv_nsec;
-}
-
 // True when the server's second has moved on past a whole-second stamp that
 // was not yet settled: the reload must then be the reconciling one, which
 // takes the files as they stand, as for any other touch.
 bool unsettled_second_passed(Settle* settle) {
-  if (settle->settled || monotonic_ns() < settle->next_ask_ns) return false;
-  settle->next_ask_ns = monotonic_ns() + 1000000000;
+  const int64_t now = fileop_monotonic_ns();
+  if (settle->settled || now < settle->next_ask_ns) return false;
+  settle->next_ask_ns = now + 1000000000;
   if (!rj_update_time_settled(rndctl.last_update, rj_heartbeat())) return false;
   settle->settled = true;
   rndctl.last_update = -1;  // forget the stamp

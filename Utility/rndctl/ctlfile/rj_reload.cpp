@@ -200,6 +200,38 @@ bool unchanged(int index) {
          holds(index, seen[index].bytes);
 }
 
+// Reads the whole of file `index` into `bytes`; the caller holds its lock.
+// False when it cannot be opened or read (reported by the file operations).
+bool read_held(int index, std::string* bytes) {
+  FILE* fp = read_fileop(index);
+  if (fp == nullptr) return false;
+  char buf[1 << 16];
+  size_t n;
+  while ((n = fread(buf, 1, sizeof buf, fp)) > 0) bytes->append(buf, n);
+  const bool ok = ferror(fp) == 0;
+  (void)close_fileop(index);  // a failure is reported there; the old file stands
+  return ok;
+}
+
+// Replaces file `index` with `text`; the caller holds its lock.  Returns 1
+// written, -1 when the write failed (reported; the old file stands).
+int write_held(int index, const std::string& text) {
+  FILE* fp = update_fileop(index);
+  if (fp == nullptr) {
+    forget(index);
+    return -1;
+  }
+  rewind_fileop(index);
+  bool ok = fwrite(text.data(), 1, text.size(), fp) == text.size();
+  ok = close_and_truncate_fileop(index) == 0 && ok;
+  if (ok) {
+    remember(index, text);
+  } else {
+    forget(index);
+  }
+  return ok ? 1 : -1;
+}
+
 // The whole of one control file: the bytes held when it has not changed,
 // else read under its lock (held for the read alone; parsing happens after
 // it is released).  The file is made when it does not exist.  Null when it
@@ -210,15 +242,7 @@ const Seen* read_file(int index) {
   bool ok;
   {
     FileopLock lock(index);
-    FILE* fp = read_fileop(index);
-    ok = fp != nullptr;
-    if (fp != nullptr) {
-      char buf[1 << 16];
-      size_t n;
-      while (ok && (n = fread(buf, 1, sizeof buf, fp)) > 0) bytes.append(buf, n);
-      if (ferror(fp)) ok = false;
-      (void)close_fileop(index);  // a failure is reported there; the old file stands
-    }
+    ok = read_held(index, &bytes);
   }
   if (!ok) {
     forget(index);
@@ -263,17 +287,7 @@ std::string render(int index) {
 int write_if_unchanged(int index, const std::string& text, const std::string& expected) {
   FileopLock lock(index);
   if (!holds(index, expected)) return 0;
-  FILE* fp = update_fileop(index);
-  if (fp == nullptr) return -1;
-  rewind_fileop(index);
-  bool ok = fwrite(text.data(), 1, text.size(), fp) == text.size();
-  ok = close_and_truncate_fileop(index) == 0 && ok;
-  if (ok) {
-    remember(index, text);
-  } else {
-    forget(index);
-  }
-  return ok ? 1 : -1;
+  return write_held(index, text);
 }
 
 // Reads one control file into the control block's lists (a plain reload).
@@ -472,15 +486,7 @@ bool write_back(const std::string& resources, const std::string& jobs) {
 bool settle_jobs_locked(const std::string& resources, int editor) {
   FileopLock lock(FILE_JOBS);
   std::string jobs;
-  FILE* fp = read_fileop(FILE_JOBS);
-  if (fp == nullptr) return false;
-  char buf[1 << 16];
-  size_t n;
-  bool ok = true;
-  while ((n = fread(buf, 1, sizeof buf, fp)) > 0) jobs.append(buf, n);
-  if (ferror(fp)) ok = false;
-  (void)close_fileop(FILE_JOBS);  // a failure is reported there; the old file stands
-  if (!ok) {
+  if (!read_held(FILE_JOBS, &jobs)) {
     forget(FILE_JOBS);
     return false;
   }
@@ -488,20 +494,10 @@ bool settle_jobs_locked(const std::string& resources, int editor) {
   std::string text = render(FILE_JOBS);
   if (text == jobs) {
     remember(FILE_JOBS, jobs);
-    return true;
-  }
-  fp = update_fileop(FILE_JOBS);
-  if (fp == nullptr) {
-    forget(FILE_JOBS);
-    return true;  // reported; the old file stands, and trying again would not help
-  }
-  rewind_fileop(FILE_JOBS);
-  ok = fwrite(text.data(), 1, text.size(), fp) == text.size();
-  ok = close_and_truncate_fileop(FILE_JOBS) == 0 && ok;
-  if (ok) {
-    remember(FILE_JOBS, text);
   } else {
-    forget(FILE_JOBS);
+    // A failed write is reported; the old file stands, and trying again
+    // would not help.
+    (void)write_held(FILE_JOBS, text);
   }
   return true;
 }
