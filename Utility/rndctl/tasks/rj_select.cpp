@@ -82,26 +82,26 @@ class EntryIndex {
         continue;
       }
       if (mark_stale) e->stale = 1;
-      if (e->rec != nullptr) by_job_[e->job].push_back(e);
+      if (e->rec != nullptr) by_job_[e->job].list.push_back(e);
     }
   }
 
   /// True when `job` has entries.
   bool has(const Job* job) const {
     auto it = by_job_.find(job);
-    return it != by_job_.end() && !it->second.empty();
+    return it != by_job_.end() && !it->second.list.empty();
   }
 
   /// Forgets the entries of a job whose entries have all been freed.
   void drop(const Job* job) {
     auto it = by_job_.find(job);
-    if (it != by_job_.end()) it->second.clear();
-    entries_ = nullptr;
+    if (it != by_job_.end()) it->second = JobEntries{};
+    current_ = nullptr;
   }
 
   /// Files a new entry under its job, wherever the selection stands.
   void file(TASK* e) {
-    if (e != nullptr && e->rec != nullptr) by_job_[e->job].push_back(e);
+    if (e != nullptr && e->rec != nullptr) by_job_[e->job].list.push_back(e);
   }
 
   /// The first entry of `job` in list order whose record is `rec`'s (the
@@ -113,75 +113,84 @@ class EntryIndex {
     return e != nullptr && Task_same_rec(e->rec, rec) ? e : nullptr;
   }
 
-  /// Narrows the search to one job's entries.
+  /// Narrows the search to one job's entries.  The table of a job is made
+  /// once a cycle; entries filed after it are looked up one by one.
   void select(const Job* job) {
-    entries_ = &by_job_[job];
-    table_.clear();
-    sorted_.clear();
-    base_ = 0;
-    if (entries_->empty()) return;
-    int lo = INT_MAX, hi = INT_MIN;
-    for (TASK* e : *entries_) {
-      lo = std::min(lo, e->rec->id);
-      hi = std::max(hi, e->rec->id);
-    }
-    int64_t span = static_cast<int64_t>(hi) - lo + 1;
-    if (span <= 4 * static_cast<int64_t>(entries_->size()) + 64) {
-      base_ = lo;
-      table_.assign(static_cast<size_t>(span), nullptr);
-      for (TASK* e : *entries_) {
-        TASK*& slot = table_[static_cast<size_t>(e->rec->id - lo)];
-        if (slot == nullptr) slot = e;
-      }
-    } else {
-      // Ids scattered far apart: a damaged or hand-made file.
-      sorted_ = *entries_;
-      std::stable_sort(sorted_.begin(), sorted_.end(),
-                       [](const TASK* a, const TASK* b) { return a->rec->id < b->rec->id; });
-    }
-    indexed_ = entries_->size();
+    current_ = &by_job_[job];
+    if (!current_->indexed) index(*current_);
   }
 
   TASK* find(int id) const {
-    if (!table_.empty()) {
-      int64_t at = static_cast<int64_t>(id) - base_;
-      if (at >= 0 && at < static_cast<int64_t>(table_.size())) {
-        TASK* e = table_[static_cast<size_t>(at)];
+    const JobEntries& j = *current_;
+    if (!j.table.empty()) {
+      int64_t at = static_cast<int64_t>(id) - j.base;
+      if (at >= 0 && at < static_cast<int64_t>(j.table.size())) {
+        TASK* e = j.table[static_cast<size_t>(at)];
         if (e != nullptr) return e;
       }
-    } else if (!sorted_.empty()) {
-      auto it = std::lower_bound(sorted_.begin(), sorted_.end(), id,
+    } else if (!j.sorted.empty()) {
+      auto it = std::lower_bound(j.sorted.begin(), j.sorted.end(), id,
                                  [](const TASK* e, int i) { return e->rec->id < i; });
-      if (it != sorted_.end() && (*it)->rec->id == id) return *it;
+      if (it != j.sorted.end() && (*it)->rec->id == id) return *it;
     }
-    for (size_t i = indexed_; i < entries_->size(); ++i) {
-      if ((*entries_)[i]->rec->id == id) return (*entries_)[i];
+    for (size_t i = j.in_table; i < j.list.size(); ++i) {
+      if (j.list[i]->rec->id == id) return j.list[i];
     }
     return nullptr;
   }
 
   /// A new entry of the selected job.
-  void add(TASK* e) { entries_->push_back(e); }
+  void add(TASK* e) { current_->list.push_back(e); }
 
   /// The entries of the selected job (new ones included).
-  const std::vector<TASK*>& selected() const { return *entries_; }
+  const std::vector<TASK*>& selected() const { return current_->list; }
 
   /// Every job that has entries (the null job of entries whose job left
   /// the file included).
   template <class F>
   void for_each_job(F f) const {
     for (const auto& [job, entries] : by_job_) {
-      if (!entries.empty()) f(job);
+      if (!entries.list.empty()) f(job);
     }
   }
 
  private:
-  std::unordered_map<const Job*, std::vector<TASK*>> by_job_;
-  std::vector<TASK*>* entries_ = nullptr;
-  size_t indexed_ = 0;
-  int base_ = 0;
-  std::vector<TASK*> table_;
-  std::vector<TASK*> sorted_;
+  struct JobEntries {
+    std::vector<TASK*> list;  // in list order
+    bool indexed = false;
+    size_t in_table = 0;  // entries of `list` in `table` or `sorted`
+    int base = 0;
+    std::vector<TASK*> table;   // by id - base, the first entry of an id
+    std::vector<TASK*> sorted;  // by id, when the ids lie far apart
+  };
+
+  static void index(JobEntries& j) {
+    j.indexed = true;
+    j.in_table = j.list.size();
+    if (j.list.empty()) return;
+    int lo = INT_MAX, hi = INT_MIN;
+    for (TASK* e : j.list) {
+      lo = std::min(lo, e->rec->id);
+      hi = std::max(hi, e->rec->id);
+    }
+    int64_t span = static_cast<int64_t>(hi) - lo + 1;
+    if (span <= 4 * static_cast<int64_t>(j.list.size()) + 64) {
+      j.base = lo;
+      j.table.assign(static_cast<size_t>(span), nullptr);
+      for (TASK* e : j.list) {
+        TASK*& slot = j.table[static_cast<size_t>(e->rec->id - lo)];
+        if (slot == nullptr) slot = e;
+      }
+    } else {
+      // Ids scattered far apart: a damaged or hand-made file.
+      j.sorted = j.list;
+      std::stable_sort(j.sorted.begin(), j.sorted.end(),
+                       [](const TASK* a, const TASK* b) { return a->rec->id < b->rec->id; });
+    }
+  }
+
+  std::unordered_map<const Job*, JobEntries> by_job_;
+  JobEntries* current_ = nullptr;  // non-owning: the selected job's
 };
 
 bool held_status(int status) {
