@@ -13,13 +13,23 @@
 #   FARM_BENCH_SETTINGS="H:N:T:P ..."   other settings (P: processors a host)
 #   FARM_BENCH_SSHFS=1       also run the 4-host settings with each host on
 #                            its own sshfs mount and report both efficiencies
+#   FARM_BENCH_FS=build      keep the farms in the build directory instead of
+#                            on a journaled ext4 file system of their own
+#
+# The control directories lie on a fresh journaled ext4 file system in an
+# image file (loop device), as on a file server's disk.  The root file system
+# of the virtual machines this runs on has no journal; there ext4 skips, for
+# every file it makes, each inode freed in the last minutes, and a farm whose
+# every lock makes and removes a directory and two files spends most of its
+# processor time in that scan, the more the longer benchmarks have run.
 set -euo pipefail
 
 here=$(cd "$(dirname "$0")" && pwd)
 build=$(cd "${1:-build}" && pwd)
 daemon=$build/zarno_render_demon
 render_bin=$build/bin
-for exe in "$daemon" "$render_bin/stamp_render"; do
+farm_host=$build/bench/farm_host
+for exe in "$daemon" "$render_bin/stamp_render" "$farm_host"; do
   [ -x "$exe" ] || { echo "farm_bench: $exe is missing; build first" >&2; exit 1; }
 done
 if [ "$(id -u)" != 0 ] || ! command -v unshare >/dev/null; then
@@ -33,6 +43,8 @@ else
   settings=${FARM_BENCH_SETTINGS:-"1:120:0.5:2 4:40:1:1 4:20:5:1 16:64:5:1 50:500:10:1 100:1000:10:1"}
 fi
 root=$build/farm_bench
+image=$build/farm_bench.img
+mounted=0
 sshd_pid=""
 pids=()
 
@@ -56,7 +68,15 @@ pkill_renders() {
 cleanup() {
   stop_all
   [ -n "$sshd_pid" ] && kill "$sshd_pid" 2>/dev/null || true
-  [ -n "${FARM_BENCH_KEEP:-}" ] || rm -rf "$root"
+  if [ -n "${FARM_BENCH_KEEP:-}" ]; then
+    [ "$mounted" = 1 ] && echo "farm_bench: kept on $image, mounted at $root"
+    return 0
+  fi
+  if [ "$mounted" = 1 ]; then
+    umount "$root" 2>/dev/null || umount -l "$root" 2>/dev/null || true
+    rm -f "$image"
+  fi
+  rm -rf "$root"
 }
 trap cleanup EXIT
 
@@ -146,21 +166,24 @@ run_setting() {
     'BEGIN { printf "%d", 5 * n * t / (h * p) + 120 }')
   for ((i = 0; i < hosts; i++)); do
     mkdir -p "$farm/tmp$i"
-    local dir=$ctl script='hostname "$0" || exit 1; '
-    local ns=(-u)
+    # A host starts when its daemon does (farm_host notes the time): the
+    # mount before it is the machine's, not the queue's.
+    local dir=$ctl
+    local host=("$farm_host" "fb$i" "$farm/starts" "$daemon" -l)
+    local debug=(${FARM_BENCH_DEBUG:+-d 1})
     if [ "$mode" = sshfs ]; then
       dir=$farm/mnt$i
       mkdir -p "$dir"
-      ns=(-u -m --propagation private)
-      script+="sshfs -f -o cache=no,StrictHostKeyChecking=no,UserKnownHostsFile=/dev/null,LogLevel=ERROR,IdentityFile=$ssh_dir/client_key,port=$sshd_port root@127.0.0.1:$ctl $dir & "
+      local script="sshfs -f -o cache=no,StrictHostKeyChecking=no,UserKnownHostsFile=/dev/null,LogLevel=ERROR,IdentityFile=$ssh_dir/client_key,port=$sshd_port root@127.0.0.1:$ctl $dir & "
       script+="for i in \$(seq 600); do [ -e $dir/Render_Job_Control ] && break; sleep 0.05; done; "
+      script+='exec "$0" "$@"'
+      DRCTMPDIR=$farm/tmp$i STAMP_FILE=$farm/stamps PATH=$render_bin:$PATH \
+        unshare -u -m --propagation private /bin/sh -c "$script" "${host[@]}" "$dir" "${debug[@]}" \
+        >"$farm/tmp$i/early" 2>&1 &
+    else
+      DRCTMPDIR=$farm/tmp$i STAMP_FILE=$farm/stamps PATH=$render_bin:$PATH \
+        unshare -u "${host[@]}" "$dir" "${debug[@]}" >"$farm/tmp$i/early" 2>&1 &
     fi
-    # A host starts when its daemon does: the mount before it is the
-    # machine's, not the queue's.
-    script+="echo \"\$0 \$(date +%s%N)\" >>$farm/starts; "
-    script+='exec "$@"'
-    DRCTMPDIR=$farm/tmp$i STAMP_FILE=$farm/stamps PATH=$render_bin:$PATH \
-      unshare "${ns[@]}" /bin/sh -c "$script" "fb$i" "$daemon" -l "$dir" ${FARM_BENCH_DEBUG:+-d 1} >"$farm/tmp$i/early" 2>&1 &
     pids+=($!)
   done
   start=$(date +%s)
@@ -223,7 +246,19 @@ run_setting() {
 }
 
 mkdir -p "$root"
+where="the build directory's file system"
+if [ "${FARM_BENCH_FS:-}" != build ] && command -v mkfs.ext4 >/dev/null; then
+  rm -f "$image"
+  if truncate -s 2G "$image" && mkfs.ext4 -q -F "$image" >/dev/null 2>&1 &&
+    mount -o loop "$image" "$root" 2>/dev/null; then
+    mounted=1
+    where="a journaled ext4 file system of its own (loop device)"
+  else
+    rm -f "$image"
+  fi
+fi
 echo "farm: H daemons (own UTS namespaces) on one control directory, 1 frame a task"
+echo "  control directories on $where"
 status=0
 want_sshfs=0
 if [ "${FARM_BENCH_SSHFS:-0}" = 1 ]; then
