@@ -121,7 +121,7 @@ TEST_F(ServeTest, ApiShowsJobsHostsAndFollowsChanges) {
                  R"(/jobs/1/comment "<script>alert(1)</script>")", R"(/jobs/2/percent 100.0)",
                  "/hosts/0/alive false", "/hosts/0/locked_now false", R"(/hosts/1/lock "SCHEDULE")",
                  "/hosts/1/locked_now true", R"(/hosts/1/schedule "0-2400 Sunday-Saturday")",
-                 "/one/frames []", "/one/tasks []"});
+                 "/one/frames [1.0,6.0,1.0]", "/one/images []", "/one/tasks []"});
 
   // A change to the job file shows, and moves the generation the page polls.
   uint64_t gen = s.get("/api/changed")["generation"];
@@ -139,7 +139,7 @@ TEST_F(ServeTest, FramesAreServedOnlyAsPngFromTheJobsDirectory) {
   ASSERT_EQ(symlink(farm_.path("secret.png").c_str(), (pix + "half.0003").c_str()), 0);
   write_text_file(pix + "spin.0001", kPng);  // another job's frame
   Server s(farm_);
-  EXPECT_EQ(s.get("/api/jobs/2")["frames"], json::array({"half.0001"}));
+  EXPECT_EQ(s.get("/api/jobs/2")["images"], json::array({"half.0001"}));
   auto r = s.client().Get("/api/jobs/2/frames/half.0001");
   ASSERT_TRUE(r);
   EXPECT_EQ(std::make_tuple(r->status, r->get_header_value("Content-Type"), r->body),

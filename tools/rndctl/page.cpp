@@ -107,7 +107,7 @@ async function showJob(view, index) {
   const t = table(["id", "frames", "status", "host", "at", "retries"], "tasks");
   for (const k of j.tasks) t.appendChild(row([k.id, k.start + "-" + k.end, k.status, k.host, k.current, k.retries]));
   const strip = el("div", null, "strip");
-  for (const f of j.frames) {
+  for (const f of j.images) {
     const img = el("img"); img.alt = f; img.title = f;
     img.src = "/api/jobs/" + index + "/frames/" + encodeURIComponent(f) + "?g=" + generation;
     strip.appendChild(img);

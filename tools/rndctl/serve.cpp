@@ -109,8 +109,10 @@ void job_detail(const ServeSnapshot& snap, int index, httplib::Response& res) {
   }
   out += ",\"outputs\":" + outputs.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace);
   std::string newest;
-  nlohmann::json frames = State_frames(files, &newest);
-  out += ",\"frames\":" + frames.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace);
+  // The rendered images under a name of their own: "frames" is the job's
+  // frame range, and a second key of one name is lost by most readers.
+  nlohmann::json images = State_frames(files, &newest);
+  out += ",\"images\":" + images.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace);
   out += ",\"generation\":" + std::to_string(snap.generation) + "}";
   res.set_content(out, kJson);
 }
