@@ -152,7 +152,7 @@ job_state() {
 # run_setting H N T P MODE  (MODE: local or sshfs); prints one report block
 # and sets `efficiency`.
 run_setting() {
-  local hosts=$1 frames=$2 seconds=$3 procs=$4 mode=$5 i ctl start limit
+  local hosts=$1 frames=$2 seconds=$3 procs=$4 mode=$5 i ctl start limit failed=0
   farm=$root/$hosts-$frames-$seconds-$mode
   rm -rf "$farm"
   mkdir -p "$farm/ctl" "$farm/project/sdl" "$farm/project/pix"
@@ -232,17 +232,29 @@ run_setting() {
       else if (H == 50) target = ">= 90%"
       else if (H == 100) target = ">= 85%"
       else target = "(quick: proves the benchmark runs)"
-      printf "  %d x (%d x %g s, %d proc) %s: %d frames stamped (%d distinct needed)\n", H, N, T, P, mode, n_r, N
+      printf "  %d x (%d x %g s, %d proc) %s: %d renders stamped (%d frames)\n", H, N, T, P, mode, n_r, N
       printf "    makespan %.2f s, ideal %.2f s, efficiency %.1f%% (target %s)\n", makespan, ideal, eff, target
       printf "    first frame after start: max %.2f s, median %.2f s (target within 1 s)\n", firsts[nf-1], pct(firsts, nf, 0.5)
       printf "    slot gap over %d renders: median %.1f ms, p95 %.1f ms\n", ng, pct(gaps, ng, 0.5), pct(gaps, ng, 0.95)
       printf "    frames per host: min %d, max %d\n", mn, mx
     }' "$farm/starts" "$farm/stamps"
+  # Every frame exactly once: a frame rendered twice or never is a fault of
+  # the queue, whatever the figures say.
+  local once
+  once=$(awk -v N="$frames" '
+    { n[$2]++ }
+    END { for (f = 1; f <= N; f++) { if (!(f in n)) missing = missing " " f; else if (n[f] > 1) twice = twice " " f "(" n[f] "x)" }
+          if (missing != "" || twice != "") printf "%s%s", (missing != "" ? "never rendered:" missing "; " : ""), (twice != "" ? "rendered more than once:" twice : "") }' "$farm/stamps")
+  if [ -n "$once" ]; then
+    echo "    FAULT: $once"
+    failed=1
+  fi
   efficiency=$(awk -v H="$hosts" -v N="$frames" -v T="$seconds" -v P="$procs" '
     FNR == NR { if (first == "" || $2 < first) first = $2; next }
     { if ($4 > last) last = $4 }
     END { printf "%.1f", 100 * (N * T / (H * P)) / ((last - first) / 1e9) }' "$farm/starts" "$farm/stamps")
   [ -n "${FARM_BENCH_KEEP:-}" ] || rm -rf "$farm"
+  [ "$failed" = 0 ]
 }
 
 mkdir -p "$root"
