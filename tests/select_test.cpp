@@ -264,17 +264,6 @@ TEST_F(SelectTest, HeldRecordOfThisHostThatNoDaemonHereTookGoesBack) {
   EXPECT_EQ(tasks(), scene("0 1 3 1 2 0 FINISHED, 1 4 6 4 1 0 PENDING, 2 7 10 7 0 0 PENDING"));
 }
 
-// How long each lock state sleeps is the scheduler's; here only that the sleep is set.
-TEST_F(SelectTest, LockedHostPicksNothingAndSleepsUntilTheLockEnds) {
-  make_job(1, "scene.sdl", 0, {here_});
-  here_->status = LOCK_LOCKED;  // to the next half hour
-  alarm(0);
-  EXPECT_EQ(GetaPendingTask(), nullptr);
-  unsigned left = alarm(0);
-  EXPECT_TRUE(left <= 1800 && left + 2 >= 1800) << left;
-  EXPECT_TRUE(tasks().empty() && rndctl.tasks == nullptr);
-}
-
 TEST_F(SelectTest, PickedTaskGetsAnEmptyStreamFileThatALinkCannotRedirect) {
   here_->num_processors = 3;
   make_job(1, "scene.sdl", 0, {here_});

@@ -45,24 +45,6 @@ class RenderTest : public ::testing::Test {
   std::string scene_;
 };
 
-TEST_F(RenderTest, RenderProgramsEndingTogetherAreAllJudged) {
-  Daemon& d = start(1, 2, 4, "slow=1");
-  // Two render programs at work; stop the daemon so that both end while it
-  // cannot react, and their two SIGCHLDs arrive as one.
-  ASSERT_TRUE(wait_for([&] { return children_of(d.pid).size() == 2; }, 30)) << d.log();
-  kill(d.pid, SIGSTOP);
-  int zombies = 0;
-  const bool both_ended = wait_for([&] { return children_of(d.pid, &zombies), zombies == 2; }, 30);
-  kill(d.pid, SIGCONT);
-  ASSERT_TRUE(both_ended);
-  ASSERT_TRUE(job_finishes(farm_, d)) << d.log();
-  EXPECT_TRUE(children_of(d.pid).empty());
-  EXPECT_EQ(count_of(d.log(), "UNKNOWN"), 0) << d.log();
-  EXPECT_EQ(images(5), "####-");
-  // The finished job's group has left the task file.
-  EXPECT_EQ(farm_.read("Render_Tasks").find("spin"), std::string::npos);
-}
-
 // The render program is a wrapper that runs the real renderer as its own
 // child, as studio wrappers do: an abort must end both.
 TEST_F(RenderTest, AnAbortedJobHasItsWholeRenderKilled) {
