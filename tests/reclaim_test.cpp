@@ -27,7 +27,6 @@ class ReclaimTest : public TaskFixture {
     // Kills what the test registered, in its own registry: the default one lists other tests'.
     rj_render_kill_leftovers();
     unsetenv("DRCTMPDIR");
-    unsetenv("ZARNO_RSH");
     TaskFixture::TearDown();
   }
   // Against `now` when given, so that a second passing in the test shifts nothing.
@@ -66,11 +65,7 @@ TEST_F(ReclaimTest, StartUpPutsBackOnlyThisHostsHeldTasks) {
 }
 
 TEST_F(ReclaimTest, AnotherHostsTaskIsPutBackOnlyWhenItsHeartbeatIsOldAndItsDaemonGone) {
-  // A stand-in remote shell: runs the probe here, so this process counts
-  // as farhost's daemon when the pid file names it.
-  write_file("fake_rsh", "#!/bin/sh\nshift; shift\nexec /bin/sh -c \"$1\"\n");
-  chmod(path("fake_rsh").c_str(), 0755);
-  setenv("ZARNO_RSH", path("fake_rsh").c_str(), 1);
+  use_local_rsh();  // this process counts as farhost's daemon when the pid file names it
   mkdir(path("TSKSTAT").c_str(), 0775);
   const std::string name = job_->name.c_str(),
                     held = group_line(name, 1, 1, 1) + rec_line(0, 1, 4, 1, 2, 0, "STARTED");

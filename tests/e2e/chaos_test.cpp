@@ -231,8 +231,7 @@ void run(unsigned seed, const SshServer* ssh) {
 class ChaosTest : public ::testing::TestWithParam<bool> {};
 
 TEST_P(ChaosTest, JobsFinishWithEveryFrameThroughKillsPowerCutsFreezesAndRestarts) {
-  if (!can_name_hosts())
-    GTEST_SKIP() << "needs root or user namespaces: daemons run under other host names";
+  if (!can_name_hosts()) GTEST_SKIP() << kCannotNameHosts;
   bool network = GetParam();
   // Over sshfs a run takes one to two and a half minutes and its time bound
   // is still too tight to hold every time on a busy machine: run by hand.

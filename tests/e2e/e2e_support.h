@@ -98,6 +98,9 @@ std::vector<int> children_of(int pid, int* zombies = nullptr);
 std::vector<std::string> uts_unshare();
 /// True when daemons can run under other host names here.
 bool can_name_hosts();
+/// Why a test that needs them is skipped.
+inline constexpr const char* kCannotNameHosts =
+    "needs root or user namespaces: daemons run under other host names";
 
 /// The 4-byte native pid stored in a pid file, or 0.
 int read_pid_file(const std::string& path);

@@ -125,8 +125,7 @@ TEST_F(RndctlTest, TheWatchViewDrawsAndQuitsCleanlyInTmux) {
 class RndctlFarmTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    if (!can_name_hosts())
-      GTEST_SKIP() << "needs root or user namespaces: daemons run under other host names";
+    if (!can_name_hosts()) GTEST_SKIP() << kCannotNameHosts;
   }
   void make_farm(const std::vector<std::string>& names, int frames, double sleep) {
     std::vector<ResourceSpec> resources;

@@ -3,6 +3,7 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <ftw.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -113,7 +114,14 @@ void ControlDirTest::SetUp() {
   rndctl.pid = getpid();
 }
 
+void ControlDirTest::use_local_rsh() const {
+  write_file("local_rsh", "#!/bin/sh\nshift; shift\nexec /bin/sh -c \"$1\"\n");
+  chmod(path("local_rsh").c_str(), 0755);
+  setenv("ZARNO_RSH", path("local_rsh").c_str(), 1);
+}
+
 void ControlDirTest::TearDown() {
+  unsetenv("ZARNO_RSH");
   rndctl_reset();
   if (!dir_.empty() && getenv("RJ_KEEP_TEST_DIRS") == nullptr) remove_tree(dir_);
 }

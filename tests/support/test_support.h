@@ -66,6 +66,9 @@ class ControlDirTest : public ::testing::Test {
     ASSERT_TRUE(write_text_file(path(name), content)) << name;
   }
   std::string read_file(const std::string& name) const { return read_text_file(path(name)); }
+  /// Makes probes of other hosts go through a stand-in remote shell that runs the command here
+  /// (until the test ends).
+  void use_local_rsh() const;
 
   std::string dir_;
 };
