@@ -50,10 +50,8 @@ bool woken(Daemon& d) {
   return wait_for(
       [&] {
         std::string status = read_text_file("/proc/" + std::to_string(d.pid) + "/status");
-        size_t at = status.find("\nSigPnd:"), shared = status.find("\nShdPnd:");
-        if (at == std::string::npos || shared == std::string::npos) return d.ended();
-        unsigned long long pending = strtoull(status.c_str() + at + 8, nullptr, 16) |
-                                     strtoull(status.c_str() + shared + 8, nullptr, 16);
+        if (status.empty()) return d.ended();
+        auto pending = signal_mask(status, "\nSigPnd:") | signal_mask(status, "\nShdPnd:");
         return (pending & 1ULL << (SIGALRM - 1)) == 0;
       },
       10);

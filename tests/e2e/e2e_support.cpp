@@ -23,9 +23,7 @@ std::string this_host_name() {
 bool Daemon::in_loop() const {
   if (pid <= 0 || reaped) return false;
   std::string status = read_text_file("/proc/" + std::to_string(pid) + "/status");
-  size_t at = status.find("SigCgt:");
-  return at != std::string::npos &&
-         (strtoull(status.c_str() + at + 7, nullptr, 16) & 1ULL << (SIGALRM - 1)) != 0;
+  return (signal_mask(status, "SigCgt:", 0) & 1ULL << (SIGALRM - 1)) != 0;
 }
 
 void Daemon::wake() const {

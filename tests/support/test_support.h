@@ -5,6 +5,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cstdlib>
+#include <cstring>
 #include <string>
 #include <vector>
 
@@ -31,6 +33,14 @@ inline pid_t sleeper() {
     for (setpgid(0, 0);;) pause();
   setpgid(pid, pid);
   return pid;
+}
+/// The hexadecimal signal mask after `key` ("SigCgt:", ...) in a /proc status text, or
+/// `absent` when the text has none.
+inline unsigned long long signal_mask(const std::string& status, const char* key,
+                                      unsigned long long absent = ~0ULL) {
+  size_t at = status.find(key);
+  return at == std::string::npos ? absent
+                                 : strtoull(status.c_str() + at + strlen(key), nullptr, 16);
 }
 /// The sorted names in `dir`, without "." and "..".
 std::vector<std::string> dir_names(const std::string& dir);
