@@ -34,14 +34,11 @@ class PerformTest : public TaskFixture {
     mkdir_p("bin");
     write_file("bin/myrender", kReporter);
     chmod(path("bin/myrender").c_str(), 0755);
-    // Its renders go in a registry of its own, not the machine's shared one.
-    setenv("DRCTMPDIR", dir_.c_str(), 1);
     old_path_ = getenv("PATH") != nullptr ? getenv("PATH") : "";
     setenv("PATH", (path("bin") + ":" + old_path_).c_str(), 1);
   }
   void TearDown() override {
     setenv("PATH", old_path_.c_str(), 1);
-    unsetenv("DRCTMPDIR");
     TaskFixture::TearDown();
   }
 

@@ -19,14 +19,12 @@ class ReclaimTest : public TaskFixture {
  protected:
   void SetUp() override {
     TaskFixture::SetUp();
-    setenv("DRCTMPDIR", dir_.c_str(), 1);
     far_ = Dev_new(nullptr, nullptr, "far1", 2);
     far_->host_name.set("farhost");
   }
   void TearDown() override {
     // Kills what the test registered, in its own registry: the default one lists other tests'.
     rj_render_kill_leftovers();
-    unsetenv("DRCTMPDIR");
     TaskFixture::TearDown();
   }
   // Against `now` when given, so that a second passing in the test shifts nothing.

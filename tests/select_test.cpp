@@ -31,7 +31,6 @@ class SelectTest : public ControlDirTest {
     tzset();
     saved_clock_ = rj_clock;
     rj_clock = [] { return time_t{1704099600}; };  // Monday 2024-01-01 09:00 UTC
-    setenv("DRCTMPDIR", dir_.c_str(), 1);
     here_ = Add_a_dev(nullptr, "render1", 1);
     there_ = Add_a_dev(nullptr, "render2", 2);
     ASSERT_TRUE(here_ && there_);
@@ -42,7 +41,6 @@ class SelectTest : public ControlDirTest {
   void TearDown() override {
     alarm(0);
     rj_clock = saved_clock_;
-    unsetenv("DRCTMPDIR");
     ControlDirTest::TearDown();
   }
 

@@ -90,7 +90,6 @@ TEST_F(Ownership, JobDeletedWhileRenderingLeavesNothingRunningOrListed) {
   EXPECT_TRUE(wait_for([&] { return !listed(); }, 120, &da))
       << farm_.read("TSKSTAT/hostA") << da.log();
   EXPECT_FALSE(da.ended());
-  EXPECT_NE(da.log().find("Crash Alert - task->job is NULL"), std::string::npos);
 }
 
 }  // namespace

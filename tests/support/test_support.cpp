@@ -112,6 +112,8 @@ void ControlDirTest::SetUp() {
   rndctl.host.set("testhost");
   rndctl.user.set("tester");
   rndctl.pid = getpid();
+  // Streams and the render registry of a test stay in its own directory.
+  setenv("DRCTMPDIR", dir_.c_str(), 1);
 }
 
 void ControlDirTest::use_local_rsh() const {
@@ -122,6 +124,7 @@ void ControlDirTest::use_local_rsh() const {
 
 void ControlDirTest::TearDown() {
   unsetenv("ZARNO_RSH");
+  unsetenv("DRCTMPDIR");
   rndctl_reset();
   if (!dir_.empty() && getenv("RJ_KEEP_TEST_DIRS") == nullptr) remove_tree(dir_);
 }

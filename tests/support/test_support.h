@@ -65,7 +65,7 @@ Ran run_program(std::vector<std::string> args, const std::string& scratch,
 void remove_tree(const std::string& path);
 
 /// A fresh control directory under the temporary directory, made the control
-/// block's control directory, with the host name "testhost" and this pid.
+/// block's control directory and DRCTMPDIR, with the host name "testhost" and this pid.
 class ControlDirTest : public ::testing::Test {
  protected:
   void SetUp() override;
