@@ -247,9 +247,8 @@ class ErrorLineTest : public ControlFileTest, public testing::WithParamInterface
 
 TEST_P(ErrorLineTest, CommentReadsBack) {
   Job* job = Add_a_job(nullptr, "e.sdl", 5);
-  Dev* dev = Add_a_dev(nullptr, "box", 1);
+  Dev* dev = host_dev("box", 1, "boxhost");
   ASSERT_TRUE(job && dev);
-  dev->host_name.set("boxhost");
   job->comment.set("earlier */ note");
   write_file("out.log", GetParam());
   TaskRec rec;

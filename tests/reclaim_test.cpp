@@ -19,8 +19,7 @@ class ReclaimTest : public TaskFixture {
  protected:
   void SetUp() override {
     TaskFixture::SetUp();
-    far_ = Dev_new(nullptr, nullptr, "far1", 2);
-    far_->host_name.set("farhost");
+    far_ = host_dev("far1", 2, "farhost");
   }
   void TearDown() override {
     // Kills what the test registered, in its own registry: the default one lists other tests'.

@@ -31,11 +31,9 @@ class SelectTest : public ControlDirTest {
     tzset();
     saved_clock_ = rj_clock;
     rj_clock = [] { return time_t{1704099600}; };  // Monday 2024-01-01 09:00 UTC
-    here_ = Add_a_dev(nullptr, "render1", 1);
-    there_ = Add_a_dev(nullptr, "render2", 2);
+    here_ = host_dev("render1", 1, "testhost");
+    there_ = host_dev("render2", 2, "otherhost");
     ASSERT_TRUE(here_ && there_);
-    here_->host_name.set("testhost");
-    there_->host_name.set("otherhost");
     std::tie(here_->max_frames, here_->num_processors) = std::pair(3, 4);
   }
   void TearDown() override {

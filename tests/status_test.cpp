@@ -33,11 +33,7 @@ class StatusTest : public TaskFixture {
     entry->out_path.set(path("out").c_str());
     return entry;
   }
-  static Dev* other_host() {
-    Dev* other = Dev_new(nullptr, nullptr, "render2", 2);
-    other->host_name.set("otherhost");
-    return other;
-  }
+  static Dev* other_host() { return host_dev("render2", 2, "otherhost"); }
 };
 
 // The last progress line sets the frame and the percentage: the stream, the step, the job's
@@ -159,13 +155,12 @@ INSTANTIATE_TEST_SUITE_P(
 
 TEST_F(StatusTest, FailedTaskOfThisHostsJobEndsInTheJobFileWithItsError) {
   // The resource is named after the host, as the reload matches them.
-  Dev* host_dev = Dev_new(nullptr, nullptr, "testhost", 3);
-  host_dev->host_name.set("testhost");
-  RndDevList_add(job_, host_dev);
+  Dev* named = host_dev("testhost", 3, "testhost");
+  RndDevList_add(job_, named);
   RJC_out();
   TASK* entry = entry_with_stream(1, 10, "", "loading scene\nshader did not build\nexiting\n");
   // No more retries: it stays failed.
-  std::tie(entry->rec->dev, entry->rec->retries, entry->waitstatus) = std::tuple(host_dev, 10, 1);
+  std::tie(entry->rec->dev, entry->rec->retries, entry->waitstatus) = std::tuple(named, 10, 1);
   write_task_file();
 
   EXPECT_EQ(UpdateRunningTasks(), 0);

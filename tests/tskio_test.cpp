@@ -22,11 +22,9 @@ class TaskFileTest : public ControlDirTest {
     ControlDirTest::SetUp();
     alpha_ = Add_a_job(nullptr, "alpha.sdl", 1);
     beta_ = Add_a_job(nullptr, "beta.sdl", 2);
-    here_ = Add_a_dev(nullptr, "render1", 1);
-    there_ = Add_a_dev(nullptr, "render2", 2);
+    here_ = host_dev("render1", 1, "testhost");
+    there_ = host_dev("render2", 2, "otherhost");
     ASSERT_TRUE(alpha_ && beta_ && here_ && there_);
-    here_->host_name.set("testhost");
-    there_->host_name.set("otherhost");
   }
 
   /// An entry of `job` for frames 1..10, owning a fresh record in no group.

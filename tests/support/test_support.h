@@ -42,6 +42,12 @@ inline unsigned long long signal_mask(const std::string& status, const char* key
   return at == std::string::npos ? absent
                                  : strtoull(status.c_str() + at + strlen(key), nullptr, 16);
 }
+/// A resource `name` of `host`, added to the control block's list as a file's would be.
+inline Dev* host_dev(const char* name, int index, const char* host) {
+  Dev* dev = Add_a_dev(nullptr, name, index);
+  if (dev != nullptr) dev->host_name.set(host);
+  return dev;
+}
 /// The sorted names in `dir`, without "." and "..".
 std::vector<std::string> dir_names(const std::string& dir);
 /// Forks `n` children that each run `body(i)` and _exit with its result,
