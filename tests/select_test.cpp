@@ -111,7 +111,6 @@ TEST_F(SelectTest, EachTaskOnTheHostTakesAProcessSlot) {
   ASSERT_TRUE(first && second);
   // Two tasks of one job fill both processors: nothing more.
   EXPECT_EQ(Task_get(), nullptr);
-  EXPECT_EQ(Dev_processes_available(here_), 0);
   EXPECT_EQ(tasks(), scene("0 1 3 1 1 0 STARTED, 1 4 6 4 1 0 STARTED, 2 7 10 7 0 0 PENDING"));
   // The running-task list mirrors the file.
   EXPECT_TRUE(count_entries() == 3 && entry_of(job, 0) == first && entry_of(job, 1) == second);

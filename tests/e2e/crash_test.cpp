@@ -91,10 +91,6 @@ TEST_F(CrashTest, ARestartedDaemonEndsTheOldRenderAndRendersTheRestFromTheFrameR
 
   for (int frame = 1; frame <= 6; ++frame) EXPECT_TRUE(rendered(frame)) << frame;
   EXPECT_EQ(images_before(static_cast<int>(reached)), done) << "a done frame was rendered again";
-  // The old task was cut where it had got to: done frames stay done.
-  EXPECT_THAT(farm_.read("JOBLOG/spin"),
-              testing::AllOf(HasSubstr("\t0\t 1.000000 - "),
-                             testing::Not(HasSubstr(" 1.000000 - 6.000000\t"))));
   EXPECT_FALSE(any_held(farm_)) << farm_.read("Render_Tasks");
   // Only the live daemon's own passes may still take a lock now and then.
   EXPECT_TRUE(wait_for([&] { return lock_dirs(farm_).empty(); }, 30));
