@@ -169,7 +169,7 @@ TEST_F(ControlFileTest, NullStreamReadsNothingNotStandardInput) {
 // A file the grammar cannot read ends the process with three messages; with
 // the process kept alive, the parse is abandoned.
 struct BadFile {
-  const char *name, *file, *text;
+  const char *label, *file, *text;
   int line;
 };
 
@@ -197,7 +197,7 @@ INSTANTIATE_TEST_SUITE_P(Files, SyntaxErrorTest, testing::Values(
     BadFile{"StringRunsToEnd", "Render_Job_Control", "RenderJobControl 1 1\na.sdl 3 {\n\tstatus = \"abc\n\ndef", 5},
     BadFile{"LinesCountFromHeader", "Render_Job_Control", "\n\n\nRenderJobControl 1 1\nfoo;\n", 2},
     BadFile{"TextAfterEnd", "Render_Resource_Control", "RenderResourceControl\nEnd\nh 1 { status = LOCKED; }\n", 3}),
-    [](const testing::TestParamInfo<BadFile>& info) { return std::string(info.param.name); });
+    by_label);
 // clang-format on
 
 TEST_F(ControlFileTest, LexicalErrorExitsWithMinusOne) {

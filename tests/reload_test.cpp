@@ -35,7 +35,7 @@ class ReloadTest : public ControlDirTest {
 };
 
 struct Case {
-  const char* name;
+  const char* label;
   int editor;
   const char *in_file, *in_memory, *expected;
 };
@@ -64,7 +64,7 @@ INSTANTIATE_TEST_SUITE_P(
                       Case{"started_over_pending", 1, "started", "pending", "started"},
                       Case{"keyword_kept_over_keyword", 1, "pending", "started", "started"},
                       Case{"number_over_started", 1, "12.5", "started", "12.5"}),
-    [](const ::testing::TestParamInfo<Case>& info) { return std::string(info.param.name); });
+    by_label);
 
 TEST_F(ReloadTest, RunningTaskEntriesFollowTheFreshRecordsOrLoseAVanishedJob) {
   load(jobs_file("started"));

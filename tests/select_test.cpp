@@ -20,9 +20,6 @@ std::string scene(const std::string& rows) {
   return group_line("scene.sdl", 1, n, n) + records;
 }
 
-// Names each instance of a parameterised test by its case's label.
-const auto Label = [](const auto& info) { return std::string(info.param.label); };
-
 class SelectTest : public ControlDirTest {
  protected:
   void SetUp() override {
@@ -100,7 +97,7 @@ INSTANTIATE_TEST_SUITE_P(
         CutCase{"fewer_steps_than_max", 3, 1, 3, 3, 1, "0 1 3 1 1 0 STARTED"},
         CutCase{"still_image_never_cut", 3, 0, 3, 10, 1, "0 1 10 1 1 0 STARTED"},
         CutCase{"zero_step_never_cut", 3, 1, 3, 10, 0, "0 1 10 1 1 0 STARTED"}),
-    Label);
+    by_label);
 
 TEST_F(SelectTest, EachTaskOnTheHostTakesAProcessSlot) {
   here_->num_processors = 2;
@@ -148,7 +145,7 @@ INSTANTIATE_TEST_SUITE_P(Jobs, Priority,
                                          PriorityCase{"tie_goes_to_the_first", 0, 1, {2, 2}},
                                          PriorityCase{"busy_takes_priority_0", 1, 1, {0, 0, 1}},
                                          PriorityCase{"busy_host_leaves_the_rest", 1, -1, {1, 2}}),
-                         Label);
+                         by_label);
 
 TEST_F(SelectTest, JobsThisHostMayNotRenderAreLeftAlone) {
   make_job(1, "elsewhere.sdl", 0, {there_});
@@ -192,7 +189,7 @@ INSTANTIATE_TEST_SUITE_P(
                              "0 1 4 4 1 1 FINISHED, 1 5 10 5 0 0 PENDING"},
                     FailCase{"no_progress", 1, 0, TASK_PENDING, "0 1 10 1 1 1 PENDING"},
                     FailCase{"tenth_failure", 5, 10, TASK_FAILED, "0 1 10 1 1 0 STARTED"}),
-    Label);
+    by_label);
 
 struct RetryCase {
   const char* label;
@@ -219,7 +216,7 @@ INSTANTIATE_TEST_SUITE_P(
     testing::Values(RetryCase{"failed_here_other_host_waits", "1", true, "0 1 3 1 1 2 PENDING"},
                     RetryCase{"failed_here_only_host_retries", "1", false, "0 1 3 1 1 2 STARTED"},
                     RetryCase{"failed_elsewhere", "2", true, "0 1 3 1 1 2 STARTED"}),
-    Label);
+    by_label);
 
 TEST_F(SelectTest, EntriesFollowTheFileAndThisHostKeepsItsOwnStatus) {
   Job* job = make_job(1, "scene.sdl", 0, {here_, there_});

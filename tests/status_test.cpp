@@ -13,7 +13,6 @@
 namespace {
 
 using std::filesystem::exists;
-constexpr auto label_of = [](const auto& info) { return std::string(info.param.label); };
 
 class StatusTest : public TaskFixture {
  protected:
@@ -150,7 +149,7 @@ INSTANTIATE_TEST_SUITE_P(
     testing::Values(EndCase{"clean_exit_finishes", 0, 0, TASK_FINISHED, false},
                     EndCase{"clean_exit_keeps_saved_output", 0, 1, TASK_FINISHED, true},
                     EndCase{"killed_fails_keeping_saved_output", 9, 1, TASK_FAILED, true}),
-    label_of);
+    by_label);
 
 TEST_F(StatusTest, FailedTaskOfThisHostsJobEndsInTheJobFileWithItsError) {
   // The resource is named after the host, as the reload matches them.

@@ -84,7 +84,7 @@ INSTANTIATE_TEST_SUITE_P(Files, ReadDamaged, testing::Values(
     ReadCase{"garbled_group_line", "alpha.sdl\t x\t 1\t 1\n" + kBeta, ""},
     ReadCase{"over_long_names", group_line(std::string(5000, 'n'), 1, 1, 1) + rec_line(0, 1, 3, 1, 1, 0, std::string(3000, 'S')) + kBeta, kBeta + group_line("alpha.sdl", 1, 1, 1) + rec_line(0, 1, 3, 1, 1, 0, "PENDING")},
     ReadCase{"group_without_records", group_line("alpha.sdl", 1, 0, 3) + kBeta, kBeta}),
-    [](const auto& info) { return std::string(info.param.label); });
+    by_label);
 // clang-format on
 
 TEST_F(TaskFileTest, FileUpdateDropsTheGroupOfAJobThatIsOver) {
@@ -146,7 +146,7 @@ INSTANTIATE_TEST_SUITE_P(Owners, FileUpdateOwnership, testing::Values(
     OwnCase{"taken_by_another_host", 4, 2, "RUNNING", "RUNNING", 4, TASK_RUNNING, true, true},
     OwnCase{"left_by_an_earlier_daemon", 4, 1, "RUNNING", "RUNNING", 4, TASK_RUNNING, false, false},
     OwnCase{"rebuilt_group_same_id", 1, 1, "STARTED", "STARTED", 4, TASK_RUNNING, true, false}),
-    [](const auto& info) { return std::string(info.param.label); });
+    by_label);
 // clang-format on
 
 // 0: no pid file, 1: the pid of this live process, 2: the pid of one that ended.

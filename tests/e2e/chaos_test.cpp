@@ -245,8 +245,6 @@ TEST_P(ChaosTest, JobsFinishWithEveryFrameThroughKillsPowerCutsFreezesAndRestart
     run(static_cast<unsigned>(strtoul(seed.c_str(), nullptr, 10)), network ? &ssh : nullptr);
 }
 
-INSTANTIATE_TEST_SUITE_P(Mounts, ChaosTest, ::testing::Values(false, true), [](const auto& info) {
-  return std::string(info.param ? "Sshfs" : "Local");
-});
+INSTANTIATE_TEST_SUITE_P(Mounts, ChaosTest, ::testing::Values(false, true), mount_name);
 
 }  // namespace

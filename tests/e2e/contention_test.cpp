@@ -53,8 +53,6 @@ TEST_P(Contention, EightHostsRenderEveryFrameOfOneJobExactlyOnce) {
   EXPECT_TRUE(hosts.shut_down(30).empty()) << "a daemon did not leave when stopped";
 }
 
-INSTANTIATE_TEST_SUITE_P(Mounts, Contention, ::testing::Values(false, true), [](const auto& info) {
-  return std::string(info.param ? "Sshfs" : "Local");
-});
+INSTANTIATE_TEST_SUITE_P(Mounts, Contention, ::testing::Values(false, true), mount_name);
 
 }  // namespace

@@ -48,6 +48,8 @@ inline Dev* host_dev(const char* name, int index, const char* host) {
   if (dev != nullptr) dev->host_name.set(host);
   return dev;
 }
+/// Names each instance of a parameterised test by its case's `label`.
+inline constexpr auto by_label = [](const auto& info) { return std::string(info.param.label); };
 /// The sorted names in `dir`, without "." and "..".
 std::vector<std::string> dir_names(const std::string& dir);
 /// Forks `n` children that each run `body(i)` and _exit with its result,
