@@ -1,4 +1,4 @@
-// Job and resource records: their names and state words.
+// Job and resource records: their names and state words, and the owned text they hold.
 #include <fcntl.h>
 #include <sys/stat.h>
 
@@ -91,4 +91,18 @@ TEST_F(RecordsTest, NewWorkWakesOnlyOtherHostsWithAFreeProcessor) {
     if (daemon_updatetime_get(h) != before[static_cast<size_t>(i++)]) woken += h;
   }
   EXPECT_EQ(woken, "bcd");
+}
+
+TEST(Text, HoldsACopyOrNoneAndReplacesOnSet) {
+  char source[] = "alpha";
+  Text t(source);
+  source[0] = 'X';
+  EXPECT_STREQ(t.c_str(), "alpha");
+  t.set(t.c_str() + 1);  // overlapping: the copy is taken before the free
+  EXPECT_STREQ(t.c_str(), "lpha");
+  Text copy = t;
+  t.set(nullptr);
+  EXPECT_TRUE(t.none());
+  EXPECT_STREQ(t.or_else("noname"), "noname");
+  EXPECT_TRUE(copy.is("lpha"));
 }

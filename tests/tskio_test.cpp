@@ -180,7 +180,6 @@ TEST_F(TaskFileTest, RecordsOfAReadOutliveTheReadAsTheirOwnersNeed) {
   TaskGroup* groups = text_records::read_tasks(text);
   TaskGroup* alpha = TaskGroup_by_job(groups, alpha_);
   ASSERT_NE(alpha, nullptr);
-  EXPECT_EQ(written_tasks(alpha), alpha_text);
 
   // Unpooled at the head, in the middle and at the end of the group's list.
   std::vector<TASK*> kept;
@@ -260,7 +259,6 @@ TEST_F(TaskFileTest, StatusFileListsThisHostsLiveEntries) {
   EXPECT_STREQ(Task_current_filenames(alpha_, here_), "/pix/alpha.0001 ");
   EXPECT_STREQ(Task_current_filenames(beta_, here_), "/pix/beta.0009 ");
   EXPECT_STREQ(Task_current_filenames(beta_, there_), "");  // no file for that host
-  EXPECT_EQ(Task_current_filenames(nullptr, here_), nullptr);
 
   // With no entries the file is emptied.
   while (rndctl.tasks != nullptr) TASK_free(rndctl.tasks);

@@ -63,8 +63,6 @@ TEST_F(DaemonLifecycle, SecondDaemonIsRefusedAndARemovedPidFileEndsTheFirst) {
   ASSERT_TRUE(started(d));
   Daemon& second = farm.start_on_farm();
   EXPECT_EQ(exit_code(second), 1);
-  EXPECT_THAT(read_text_file(second.tmpdir + "/early"),
-              HasSubstr("process is alive --> " + d.host + ":" + std::to_string(d.pid)));
   EXPECT_TRUE(read_pid_file(farm.path(d.host + ".pid")) == d.pid && !d.ended());
   ASSERT_EQ(exit_without_pid_file(d), 1);
   EXPECT_THAT(farm.read("Render_Access"),
