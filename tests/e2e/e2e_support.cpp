@@ -26,10 +26,6 @@ bool Daemon::in_loop() const {
   return (signal_mask(status, "SigCgt:", 0) & 1ULL << (SIGALRM - 1)) != 0;
 }
 
-void Daemon::wake() const {
-  if (pid > 0 && !reaped) kill(pid, SIGALRM);
-}
-
 bool Daemon::ended() {
   if (!reaped && pid > 0 && waitpid(pid, &status, WNOHANG) == pid) reaped = true;
   return reaped || pid <= 0;
@@ -67,10 +63,6 @@ Farm::Farm() {
 Farm::~Farm() {
   for (auto& d : daemons_) d->stop();  // with its renders, in process groups of their own
   if (!scratch_.empty() && getenv("RJ_KEEP_TEST_DIRS") == nullptr) remove_tree(scratch_);
-}
-
-void Farm::write(const std::string& name, const std::string& content) const {
-  write_text_file(path(name), content);
 }
 
 Daemon& Farm::start(const std::vector<std::string>& args, const std::string& host,

@@ -2,6 +2,7 @@
 // daemon processes started on it, woken with SIGALRM instead of waiting.
 #pragma once
 
+#include <signal.h>
 #include <sys/types.h>
 
 #include <functional>
@@ -27,7 +28,9 @@ struct Daemon {
   /// before that a SIGALRM would end it).
   bool in_loop() const;
   /// Sends SIGALRM: the daemon wakes as from its 20-second alarm.
-  void wake() const;
+  void wake() const {
+    if (pid > 0 && !reaped) kill(pid, SIGALRM);
+  }
   /// True once the process has ended (reaps it).
   bool ended();
   /// Exit code once ended (-1 when killed by a signal or still running).
@@ -46,7 +49,9 @@ class Farm {
 
   const std::string& dir() const { return dir_; }
   std::string path(const std::string& name) const { return dir_ + "/" + name; }
-  void write(const std::string& name, const std::string& content) const;
+  void write(const std::string& name, const std::string& content) const {
+    write_text_file(path(name), content);
+  }
   std::string read(const std::string& name) const { return read_text_file(path(name)); }
 
   /// Starts a daemon with `args` (the control directory is not added) and
