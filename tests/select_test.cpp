@@ -3,8 +3,6 @@
 #include <unistd.h>
 
 #include <climits>
-#include <cstdlib>
-#include <ctime>
 #include <string>
 #include <vector>
 
@@ -24,19 +22,10 @@ class SelectTest : public ControlDirTest {
  protected:
   void SetUp() override {
     ControlDirTest::SetUp();
-    setenv("TZ", "UTC", 1);
-    tzset();
-    saved_clock_ = rj_clock;
-    rj_clock = [] { return time_t{1704099600}; };  // Monday 2024-01-01 09:00 UTC
     here_ = host_dev("render1", 1, "testhost");
     there_ = host_dev("render2", 2, "otherhost");
     ASSERT_TRUE(here_ && there_);
     std::tie(here_->max_frames, here_->num_processors) = std::pair(3, 4);
-  }
-  void TearDown() override {
-    alarm(0);
-    rj_clock = saved_clock_;
-    ControlDirTest::TearDown();
   }
 
   /// A pending, animated job over frames 1..end by `by` that the given hosts may render.
@@ -65,7 +54,6 @@ class SelectTest : public ControlDirTest {
     return nullptr;
   }
 
-  time_t (*saved_clock_)() = nullptr;
   Dev *here_ = nullptr, *there_ = nullptr;
 };
 
