@@ -139,8 +139,7 @@ TEST_P(RealTextTest, ReadsAsStrtod) {
 }
 
 INSTANTIATE_TEST_SUITE_P(Texts, RealTextTest,
-                         testing::Values("0.1", "-2.500000", "3.14159265358979", "16777217.0",
-                                         "123456789.123456", "0.30000000000000004", "-0.0", "-.5",
+                         testing::Values("0.1", "16777217.0", "0.30000000000000004", "-0.0", "-.5",
                                          "1.2.3", "1-2.5", "-.",
                                          "99999999999999999999999999999999999999999.0"));
 
@@ -169,7 +168,7 @@ TEST_F(ControlFileTest, NullStreamReadsNothingNotStandardInput) {
 // A file the grammar cannot read ends the process with three messages; with
 // the process kept alive, the parse is abandoned.
 struct BadFile {
-  const char *name, *file, *text;
+  const char *label, *file, *text;
   int line;
 };
 
@@ -197,7 +196,7 @@ INSTANTIATE_TEST_SUITE_P(Files, SyntaxErrorTest, testing::Values(
     BadFile{"StringRunsToEnd", "Render_Job_Control", "RenderJobControl 1 1\na.sdl 3 {\n\tstatus = \"abc\n\ndef", 5},
     BadFile{"LinesCountFromHeader", "Render_Job_Control", "\n\n\nRenderJobControl 1 1\nfoo;\n", 2},
     BadFile{"TextAfterEnd", "Render_Resource_Control", "RenderResourceControl\nEnd\nh 1 { status = LOCKED; }\n", 3}),
-    [](const testing::TestParamInfo<BadFile>& info) { return std::string(info.param.name); });
+    by_label);
 // clang-format on
 
 TEST_F(ControlFileTest, LexicalErrorExitsWithMinusOne) {
@@ -247,9 +246,8 @@ class ErrorLineTest : public ControlFileTest, public testing::WithParamInterface
 
 TEST_P(ErrorLineTest, CommentReadsBack) {
   Job* job = Add_a_job(nullptr, "e.sdl", 5);
-  Dev* dev = Add_a_dev(nullptr, "box", 1);
+  Dev* dev = host_dev("box", 1, "boxhost");
   ASSERT_TRUE(job && dev);
-  dev->host_name.set("boxhost");
   job->comment.set("earlier */ note");
   write_file("out.log", GetParam());
   TaskRec rec;

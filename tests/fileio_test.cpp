@@ -100,7 +100,7 @@ TEST_F(FileopTest, FreeLockHoldsHostFileWithPidAndReleaseRemovesBoth) {
 
 // A busy lock as a waiter finds it, and when the waiter may break it.
 struct BusyLock {
-  const char* name;
+  const char* label;
   const char* holder;    // holder file name, or none
   std::string content;   // its content; "DEAD" = a pid that has exited
   long broken_at_age;    // server-clock age at which it is broken; 0 = at once
@@ -145,7 +145,7 @@ INSTANTIATE_TEST_SUITE_P(
         BusyLock{"OwnHostNoPid", "testhost", "garbage\n", 5, "abandoned without a holder pid"},
         // An editor between its mkdir and its holder: respected for a while.
         BusyLock{"NoHolderFile", nullptr, "", 5, "abandoned without a holder pid"}),
-    [](const testing::TestParamInfo<BusyLock>& info) { return std::string(info.param.name); });
+    by_label);
 
 // Forked waiters at one stale lock: one breaks it, all get it in turn, and
 // no two hold it at once.

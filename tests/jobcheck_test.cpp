@@ -113,8 +113,7 @@ TEST_F(JobCheckTest, FieldChecksFillOwnersAndDropDeadLocks) {
 }
 
 TEST_F(JobCheckTest, LiveJobsOnAHost) {
-  Dev* there = Dev_new(nullptr, nullptr, "there", 2);
-  there->host_name.set("elsewhere");
+  Dev* there = host_dev("there", 2, "elsewhere");
   Job* job = Job_new(nullptr, nullptr, "j", 1);
   RndDevList_add(job, there), RndDevList_add(job, Dev_new(nullptr, nullptr, "here", 1));
   for (const char* dead : {"none", "failed", "aborted", "finished"})

@@ -27,12 +27,6 @@ constexpr const char* kReporter =
     "read -r stat < /proc/$$/stat; set -- $stat; echo \"pid=$$ pgid=$5\"\n"
     "echo 'pix.0001 r 5 of 10' >&2\n";
 
-// The hexadecimal mask after `key` in a /proc status text; all ones when absent.
-unsigned long long signal_mask(const std::string& text, const char* key) {
-  size_t at = text.find(key);
-  return at == std::string::npos ? ~0ULL : strtoull(text.c_str() + at + strlen(key), nullptr, 16);
-}
-
 class PerformTest : public TaskFixture {
  protected:
   void SetUp() override {
@@ -40,14 +34,11 @@ class PerformTest : public TaskFixture {
     mkdir_p("bin");
     write_file("bin/myrender", kReporter);
     chmod(path("bin/myrender").c_str(), 0755);
-    // Its renders go in a registry of its own, not the machine's shared one.
-    setenv("DRCTMPDIR", dir_.c_str(), 1);
     old_path_ = getenv("PATH") != nullptr ? getenv("PATH") : "";
     setenv("PATH", (path("bin") + ":" + old_path_).c_str(), 1);
   }
   void TearDown() override {
     setenv("PATH", old_path_.c_str(), 1);
-    unsetenv("DRCTMPDIR");
     TaskFixture::TearDown();
   }
 

@@ -1,4 +1,4 @@
-// Job and resource records: their names and state words.
+// Job and resource records: their names and state words, and the owned text they hold.
 #include <fcntl.h>
 #include <sys/stat.h>
 
@@ -24,33 +24,23 @@ TEST_F(RecordsTest, NewRecordsTakeTheirNamesFromWhatTheyAreGiven) {
   Job* bare = Job_new(nullptr, nullptr, nullptr, 13);
   EXPECT_TRUE(bare->name.none() && bare->sdl.none());
 
-  // The editor's placeholder resource name gets the index; others are kept.
-  // The remote directory follows the temporary-directory setting.
-  setenv("DRCTMPDIR", "/scratch/tmp", 1);
-  Dev* dev = Dev_new(nullptr, nullptr, "new_resource", 7);
+  // Only the editor's exact placeholder name gets the index (the file tests show it); without a
+  // temporary-directory setting the remote directory is the default.
   unsetenv("DRCTMPDIR");
-  EXPECT_STREQ(dev->name.c_str(), "new_resource_7");
-  EXPECT_EQ(Dev_by_name("new_resource_7"), dev);
-  EXPECT_STREQ(dev->host_name.c_str(), "testhost");
-  EXPECT_STREQ(dev->remote_location.c_str(), "/scratch/tmp");
   Dev* other = Dev_new(nullptr, nullptr, "new_resourceX", 8);
   EXPECT_STREQ(other->name.c_str(), "new_resourceX");
+  EXPECT_EQ(Dev_by_name("new_resourceX"), other);
   EXPECT_STREQ(other->remote_location.c_str(), "/usr/tmp");
   EXPECT_TRUE(Dev_new(nullptr, nullptr, nullptr, 9)->name.none());
 }
 
-TEST(StateWords, DecodeCaseSensitively) {
-  struct {
-    const char* word;
-    int run, lock;
-  } const words[] = {{nullptr, 0, 0},     {"", 0, 0},         {"PAUSED", 1, 0}, {"paused", 0, 0},
-                     {"AVAILABLE", 2, 2}, {"SCHEDULE", 3, 3}, {"NOW", 4, 0},    {"LOCKED", 0, 1},
-                     {"Locked", 0, 0},    {"NOW ", 0, 0}};
-  for (const auto& w : words) {
-    SCOPED_TRACE(w.word != nullptr ? w.word : "(none)");
-    EXPECT_EQ(Job_get_runstate(w.word), w.run);
-    EXPECT_EQ(Dev_get_lockstate(w.word), w.lock);
-  }
+// The file readers' state words are exact: anything else is no state (the golden files read
+// the words themselves).
+TEST(StateWords, AnythingButTheExactWordIsNoState) {
+  for (const char* word : {static_cast<const char*>(nullptr), "", "paused", "Locked", "NOW ", "x"})
+    EXPECT_EQ(std::pair(Job_get_runstate(word), Dev_get_lockstate(word)), std::pair(0, 0))
+        << (word != nullptr ? word : "(none)");
+  EXPECT_EQ(Job_get_runstate("NOW"), RUN_NOW);  // a run state no golden file holds
 }
 
 TEST_F(RecordsTest, NewWorkWakesOnlyOtherHostsWithAFreeProcessor) {
@@ -101,4 +91,18 @@ TEST_F(RecordsTest, NewWorkWakesOnlyOtherHostsWithAFreeProcessor) {
     if (daemon_updatetime_get(h) != before[static_cast<size_t>(i++)]) woken += h;
   }
   EXPECT_EQ(woken, "bcd");
+}
+
+TEST(Text, HoldsACopyOrNoneAndReplacesOnSet) {
+  char source[] = "alpha";
+  Text t(source);
+  source[0] = 'X';
+  EXPECT_STREQ(t.c_str(), "alpha");
+  t.set(t.c_str() + 1);  // overlapping: the copy is taken before the free
+  EXPECT_STREQ(t.c_str(), "lpha");
+  Text copy = t;
+  t.set(nullptr);
+  EXPECT_TRUE(t.none());
+  EXPECT_STREQ(t.or_else("noname"), "noname");
+  EXPECT_TRUE(copy.is("lpha"));
 }

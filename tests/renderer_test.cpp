@@ -1,6 +1,6 @@
 // The demo renderer's scene, naming, progress and fault switches, run as the
 // daemon runs it: a real process in a project directory.
-#include <gmock/gmock.h>
+#include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -138,14 +138,3 @@ TEST_F(RendererTest, FaultSwitchesStopAtTheirFrame) {
 }
 
 }  // namespace
-
-// The queue reads the same scene by searching lines for its keys: a comment
-// or a drawing key that happens to hold one of them would change the job.
-TEST(DemoScene, QueueReadsTheAnimationTheRendererDraws) {
-  Job job;
-  job.sdl.set(DEMO_DIR "/project/sdl/bouncing_ball.sdl");
-  EXPECT_EQ((std::tuple{Job_set_frame_range(&job), job.animate, job.ext_size}),
-            std::tuple(24, 1, 4));
-  EXPECT_THAT(job.frames, testing::ElementsAre(1.0f, 24.0f, 1.0f));
-  EXPECT_EQ((job.fields = 3, Job_check_sdlfields(&job)), 0);
-}

@@ -90,15 +90,11 @@ TEST_F(SignalTest, SignalsGoToLocalProcessesOnlyAndProbesTellLiveFromDead) {
 }
 
 TEST_F(SignalTest, RemoteProbeRunsTheRemoteShellWithoutALocalShell) {
-  // A stand-in remote shell: runs the command it was given locally.
-  write_file("fake_rsh", "#!/bin/sh\nshift; shift\nexec /bin/sh -c \"$1\"\n");
-  chmod(path("fake_rsh").c_str(), 0755);
-  setenv("ZARNO_RSH", path("fake_rsh").c_str(), 1);
+  use_local_rsh();
   EXPECT_EQ(RJ_signal("farhost", getpid(), 0), 0);
   // A host name is one argument, never shell text: only the call's side effect counts.
   (void)RJ_signal(("x;touch " + path("owned")).c_str(), getpid(), 0);
   EXPECT_NE(access(path("owned").c_str(), F_OK), 0);
-  unsetenv("ZARNO_RSH");
 }
 
 TEST_F(SignalTest, TimedPauseEndsAtItsLimitOrOnASignalThatCameWhileBlocked) {

@@ -13,7 +13,6 @@
 namespace {
 
 using std::filesystem::exists;
-constexpr auto label_of = [](const auto& info) { return std::string(info.param.label); };
 
 class StatusTest : public TaskFixture {
  protected:
@@ -33,11 +32,7 @@ class StatusTest : public TaskFixture {
     entry->out_path.set(path("out").c_str());
     return entry;
   }
-  static Dev* other_host() {
-    Dev* other = Dev_new(nullptr, nullptr, "render2", 2);
-    other->host_name.set("otherhost");
-    return other;
-  }
+  static Dev* other_host() { return host_dev("render2", 2, "otherhost"); }
 };
 
 // The last progress line sets the frame and the percentage: the stream, the step, the job's
@@ -68,7 +63,6 @@ TEST_F(StatusTest, LastProgressLineSetsFrameAndPercentage) {
     EXPECT_EQ(std::tuple(got, entry->rec->current, std::string(entry->output.or_else("-"))),
               std::tuple(changed, current, std::string(output ? output : "-")));
     EXPECT_NEAR(entry->progress, progress, 1e-3);
-    EXPECT_EQ(set_image_percentage_done(entry), 0);  // nothing new on the stream
   }
 }
 
@@ -155,17 +149,16 @@ INSTANTIATE_TEST_SUITE_P(
     testing::Values(EndCase{"clean_exit_finishes", 0, 0, TASK_FINISHED, false},
                     EndCase{"clean_exit_keeps_saved_output", 0, 1, TASK_FINISHED, true},
                     EndCase{"killed_fails_keeping_saved_output", 9, 1, TASK_FAILED, true}),
-    label_of);
+    by_label);
 
 TEST_F(StatusTest, FailedTaskOfThisHostsJobEndsInTheJobFileWithItsError) {
   // The resource is named after the host, as the reload matches them.
-  Dev* host_dev = Dev_new(nullptr, nullptr, "testhost", 3);
-  host_dev->host_name.set("testhost");
-  RndDevList_add(job_, host_dev);
+  Dev* named = host_dev("testhost", 3, "testhost");
+  RndDevList_add(job_, named);
   RJC_out();
   TASK* entry = entry_with_stream(1, 10, "", "loading scene\nshader did not build\nexiting\n");
   // No more retries: it stays failed.
-  std::tie(entry->rec->dev, entry->rec->retries, entry->waitstatus) = std::tuple(host_dev, 10, 1);
+  std::tie(entry->rec->dev, entry->rec->retries, entry->waitstatus) = std::tuple(named, 10, 1);
   write_task_file();
 
   EXPECT_EQ(UpdateRunningTasks(), 0);

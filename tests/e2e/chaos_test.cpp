@@ -231,8 +231,7 @@ void run(unsigned seed, const SshServer* ssh) {
 class ChaosTest : public ::testing::TestWithParam<bool> {};
 
 TEST_P(ChaosTest, JobsFinishWithEveryFrameThroughKillsPowerCutsFreezesAndRestarts) {
-  if (!can_name_hosts())
-    GTEST_SKIP() << "needs root or user namespaces: daemons run under other host names";
+  if (!can_name_hosts()) GTEST_SKIP() << kCannotNameHosts;
   bool network = GetParam();
   // Over sshfs a run takes one to two and a half minutes and its time bound
   // is still too tight to hold every time on a busy machine: run by hand.
@@ -246,8 +245,6 @@ TEST_P(ChaosTest, JobsFinishWithEveryFrameThroughKillsPowerCutsFreezesAndRestart
     run(static_cast<unsigned>(strtoul(seed.c_str(), nullptr, 10)), network ? &ssh : nullptr);
 }
 
-INSTANTIATE_TEST_SUITE_P(Mounts, ChaosTest, ::testing::Values(false, true), [](const auto& info) {
-  return std::string(info.param ? "Sshfs" : "Local");
-});
+INSTANTIATE_TEST_SUITE_P(Mounts, ChaosTest, ::testing::Values(false, true), mount_name);
 
 }  // namespace

@@ -12,8 +12,7 @@ namespace {
 class Contention : public ::testing::TestWithParam<bool> {};
 
 TEST_P(Contention, EightHostsRenderEveryFrameOfOneJobExactlyOnce) {
-  if (!can_name_hosts())
-    GTEST_SKIP() << "needs root or user namespaces: daemons run under other host names";
+  if (!can_name_hosts()) GTEST_SKIP() << kCannotNameHosts;
   SshServer ssh;
   std::string why;
   if (GetParam() && !ssh.start(&why)) GTEST_SKIP() << "no network mounts here: " << why;
@@ -25,15 +24,14 @@ TEST_P(Contention, EightHostsRenderEveryFrameOfOneJobExactlyOnce) {
   std::vector<ResourceSpec> resources;
   for (int i = 0; i < 8; ++i) {
     names.push_back("race" + std::to_string(i));
-    resources.push_back({names.back(), i + 1, 1, 1, "AVAILABLE", ""});
+    resources.push_back({names.back(), i + 1, 1, 1});
   }
   std::string stamps = farm.path("../stamps");
-  JobSpec job;
-  job.name = "race";
-  job.end = kFrames;
-  job.opts = "sleep=0.05 stamp=" + stamps;
-  job.hosts = names;
-  job.executable = "stamp_render";
+  JobSpec job{.name = "race",
+              .end = kFrames,
+              .opts = "sleep=0.05 stamp=" + stamps,
+              .hosts = names,
+              .executable = "stamp_render"};
   farm.write("Render_Resource_Control", resource_file(resources));
   farm.write("Render_Job_Control", job_file({job}, scene));
 
@@ -49,16 +47,12 @@ TEST_P(Contention, EightHostsRenderEveryFrameOfOneJobExactlyOnce) {
     if (where.count(f) != 0) twice += " " + std::to_string(f) + "(" + where[f] + "," + s.host + ")";
     where[f] += s.host;
   }
-  for (int f = 1; f <= kFrames; ++f) {
-    if (where.count(f) == 0) missing += " " + std::to_string(f);
-  }
+  for (int f = 1; f <= kFrames; ++f) missing += where.count(f) == 0 ? " " + std::to_string(f) : "";
   EXPECT_TRUE(twice.empty()) << "frames rendered twice:" << twice;
   EXPECT_TRUE(missing.empty()) << "frames never rendered:" << missing;
   EXPECT_TRUE(hosts.shut_down(30).empty()) << "a daemon did not leave when stopped";
 }
 
-INSTANTIATE_TEST_SUITE_P(Mounts, Contention, ::testing::Values(false, true), [](const auto& info) {
-  return std::string(info.param ? "Sshfs" : "Local");
-});
+INSTANTIATE_TEST_SUITE_P(Mounts, Contention, ::testing::Values(false, true), mount_name);
 
 }  // namespace

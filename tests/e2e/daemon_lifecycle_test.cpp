@@ -33,6 +33,12 @@ class DaemonLifecycle : public testing::Test {
     d.wake();
     return exit_code(d);
   }
+  // All a daemon logs when nothing traces it.
+  static std::string untraced_log() {
+    return geteuid() != 0 ? ""
+                          : "zarno_render_demon: warning: running as root; every render program "
+                            "runs as root too\n";
+  }
   Farm farm;
 };
 
@@ -44,36 +50,36 @@ bool woken(Daemon& d) {
   return wait_for(
       [&] {
         std::string status = read_text_file("/proc/" + std::to_string(d.pid) + "/status");
-        size_t at = status.find("\nSigPnd:"), shared = status.find("\nShdPnd:");
-        if (at == std::string::npos || shared == std::string::npos) return d.ended();
-        unsigned long long pending = strtoull(status.c_str() + at + 8, nullptr, 16) |
-                                     strtoull(status.c_str() + shared + 8, nullptr, 16);
+        if (status.empty()) return d.ended();
+        auto pending = signal_mask(status, "\nSigPnd:") | signal_mask(status, "\nShdPnd:");
         return (pending & 1ULL << (SIGALRM - 1)) == 0;
       },
       10);
 }
 
+// Without -d the environment's debug level holds: the first daemon traces into its log.
 TEST_F(DaemonLifecycle, SecondDaemonIsRefusedAndARemovedPidFileEndsTheFirst) {
-  Daemon& d = farm.start_on_farm();
+  Daemon& d = farm.start({"-l", farm.dir()}, "", {"RNDCTL_DEBUG=3"});
   ASSERT_TRUE(started(d));
   Daemon& second = farm.start_on_farm();
   EXPECT_EQ(exit_code(second), 1);
-  EXPECT_THAT(read_text_file(second.tmpdir + "/early"),
-              HasSubstr("process is alive --> " + d.host + ":" + std::to_string(d.pid)));
   EXPECT_TRUE(read_pid_file(farm.path(d.host + ".pid")) == d.pid && !d.ended());
   ASSERT_EQ(exit_without_pid_file(d), 1);
   EXPECT_THAT(farm.read("Render_Access"),
               testing::AllOf(HasSubstr("* Exiting due to self check failure --  " + d.host +
                                        ":zarno_render_demon(" + std::to_string(d.pid) + ") "),
                              HasSubstr("error openning \"")));
+  EXPECT_GT(d.log().size(), untraced_log().size()) << d.log();
 }
 
+// -d wins over the environment: eleven wake-ups go by untraced.
 TEST_F(DaemonLifecycle, ExitsOnTheEleventhWorklessWakeUp) {
-  Daemon& d = farm.start_on_farm();
+  Daemon& d = farm.start({"-l", farm.dir(), "-d", "0"}, "", {"RNDCTL_DEBUG=1"});
   ASSERT_TRUE(started(d));
   for (int i = 1; i <= 10; ++i) ASSERT_TRUE(woken(d)) << "wake-up " << i;
   EXPECT_FALSE(d.ended());
   EXPECT_EQ((d.wake(), exit_code(d)), 1);
+  EXPECT_EQ(d.log(), untraced_log());
 }
 
 TEST_F(DaemonLifecycle, RefusesAControlDirectoryThatIsNotThere) {
@@ -133,20 +139,6 @@ TEST_F(DaemonLifecycle, ATouchOfThePidFileWakesAnIdleDaemonWithoutASignal) {
       << d.log();
   EXPECT_LT(std::chrono::steady_clock::now() - touched, std::chrono::seconds(15)) << d.log();
   ASSERT_TRUE(job_finishes(farm, d)) << d.log();
-}
-
-TEST_F(DaemonLifecycle, DebugOptionWinsOverTheEnvironment) {
-  Daemon& traced = farm.start({"-l", farm.dir()}, "", {"RNDCTL_DEBUG=3"});
-  ASSERT_TRUE(started(traced));
-  ASSERT_NE(exit_without_pid_file(traced), -2);
-  Daemon& quiet = farm.start({"-l", farm.dir(), "-d", "0"}, "", {"RNDCTL_DEBUG=1"});
-  ASSERT_TRUE(started(quiet));
-  // Its exit proves a wake-up went by untraced: only a root daemon's warning is logged.
-  EXPECT_EQ(exit_without_pid_file(quiet), 1);
-  EXPECT_EQ(quiet.log(), geteuid() != 0
-                             ? ""
-                             : "zarno_render_demon: warning: running as root; every render "
-                               "program runs as root too\n");
 }
 
 }  // namespace

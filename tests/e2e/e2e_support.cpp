@@ -23,13 +23,7 @@ std::string this_host_name() {
 bool Daemon::in_loop() const {
   if (pid <= 0 || reaped) return false;
   std::string status = read_text_file("/proc/" + std::to_string(pid) + "/status");
-  size_t at = status.find("SigCgt:");
-  return at != std::string::npos &&
-         (strtoull(status.c_str() + at + 7, nullptr, 16) & 1ULL << (SIGALRM - 1)) != 0;
-}
-
-void Daemon::wake() const {
-  if (pid > 0 && !reaped) kill(pid, SIGALRM);
+  return (signal_mask(status, "SigCgt:", 0) & 1ULL << (SIGALRM - 1)) != 0;
 }
 
 bool Daemon::ended() {
@@ -69,10 +63,6 @@ Farm::Farm() {
 Farm::~Farm() {
   for (auto& d : daemons_) d->stop();  // with its renders, in process groups of their own
   if (!scratch_.empty() && getenv("RJ_KEEP_TEST_DIRS") == nullptr) remove_tree(scratch_);
-}
-
-void Farm::write(const std::string& name, const std::string& content) const {
-  write_text_file(path(name), content);
 }
 
 Daemon& Farm::start(const std::vector<std::string>& args, const std::string& host,

@@ -2,6 +2,7 @@
 // daemon processes started on it, woken with SIGALRM instead of waiting.
 #pragma once
 
+#include <signal.h>
 #include <sys/types.h>
 
 #include <functional>
@@ -27,7 +28,9 @@ struct Daemon {
   /// before that a SIGALRM would end it).
   bool in_loop() const;
   /// Sends SIGALRM: the daemon wakes as from its 20-second alarm.
-  void wake() const;
+  void wake() const {
+    if (pid > 0 && !reaped) kill(pid, SIGALRM);
+  }
   /// True once the process has ended (reaps it).
   bool ended();
   /// Exit code once ended (-1 when killed by a signal or still running).
@@ -46,7 +49,9 @@ class Farm {
 
   const std::string& dir() const { return dir_; }
   std::string path(const std::string& name) const { return dir_ + "/" + name; }
-  void write(const std::string& name, const std::string& content) const;
+  void write(const std::string& name, const std::string& content) const {
+    write_text_file(path(name), content);
+  }
   std::string read(const std::string& name) const { return read_text_file(path(name)); }
 
   /// Starts a daemon with `args` (the control directory is not added) and
@@ -98,6 +103,9 @@ std::vector<int> children_of(int pid, int* zombies = nullptr);
 std::vector<std::string> uts_unshare();
 /// True when daemons can run under other host names here.
 bool can_name_hosts();
+/// Why a test that needs them is skipped.
+inline constexpr const char* kCannotNameHosts =
+    "needs root or user namespaces: daemons run under other host names";
 
 /// The 4-byte native pid stored in a pid file, or 0.
 int read_pid_file(const std::string& path);

@@ -49,6 +49,10 @@ struct Stamp {
 };
 /// The stamps of a stamp file (malformed lines are skipped).
 std::vector<Stamp> read_stamps(const std::string& path);
+/// Names the instances of a test run on a local directory and on network mounts.
+inline std::string mount_name(const testing::TestParamInfo<bool>& info) {
+  return info.param ? "Sshfs" : "Local";
+}
 /// Nanoseconds of the clock the stamps use.
 long long wall_ns();
 

@@ -17,8 +17,7 @@ class Ownership : public testing::Test {
  protected:
   // Every render goes through this frame_painter: it logs "PID START END", then execs the real one.
   void SetUp() override {
-    if (!can_name_hosts())
-      GTEST_SKIP() << "needs root or user namespaces: daemons run under other host names";
+    if (!can_name_hosts()) GTEST_SKIP() << kCannotNameHosts;
     farm_.write("Render_Resource_Control", resource_file({{"hostA", 1, 2, 1}, {"hostB", 2, 2, 1}}));
     farm_.write("frame_painter",
                 "#!/bin/sh\ns=0 e=0\nfor a; do case $p in -s) s=$a;; -e) e=$a;; esac; p=$a; done\n"
@@ -91,7 +90,6 @@ TEST_F(Ownership, JobDeletedWhileRenderingLeavesNothingRunningOrListed) {
   EXPECT_TRUE(wait_for([&] { return !listed(); }, 120, &da))
       << farm_.read("TSKSTAT/hostA") << da.log();
   EXPECT_FALSE(da.ended());
-  EXPECT_NE(da.log().find("Crash Alert - task->job is NULL"), std::string::npos);
 }
 
 }  // namespace

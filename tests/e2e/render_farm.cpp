@@ -6,6 +6,7 @@
 
 #include <cstdio>
 #include <cstring>
+#include <functional>
 #include <thread>
 
 std::string resource_file(const std::vector<ResourceSpec>& resources) {
@@ -116,16 +117,27 @@ bool take_lock(Farm& farm, const std::string& file, double seconds) {
 
 void drop_lock(Farm& farm, const std::string& file) { rmdir(farm.path(file + ".lock").c_str()); }
 
-bool edit_job_file(Farm& farm, const std::string& from, const std::string& to,
-                   const std::string& host) {
+namespace {
+// Applies `edit` to the job file's text under its lock as an editor does, writes the text back
+// when the edit found what it looked for, then touches the pid file of `host`.
+bool edit_locked(Farm& farm, const std::string& host,
+                 const std::function<bool(std::string&)>& edit) {
   if (!take_lock(farm, "Render_Job_Control")) return false;
   std::string text = farm.read("Render_Job_Control");
-  size_t at = text.find(from);
-  bool found = at != std::string::npos;
-  if (found) farm.write("Render_Job_Control", text.replace(at, from.size(), to));
+  bool found = edit(text);
+  if (found) farm.write("Render_Job_Control", text);
   drop_lock(farm, "Render_Job_Control");
   utimensat(AT_FDCWD, farm.path(host + ".pid").c_str(), nullptr, 0);
   return found;
+}
+}  // namespace
+
+bool edit_job_file(Farm& farm, const std::string& from, const std::string& to,
+                   const std::string& host) {
+  return edit_locked(farm, host, [&](std::string& text) {
+    size_t at = text.find(from);
+    return at != std::string::npos && (text.replace(at, from.size(), to), true);
+  });
 }
 
 bool set_job_status(Farm& farm, const std::string& job, const std::string& status,
@@ -133,18 +145,10 @@ bool set_job_status(Farm& farm, const std::string& job, const std::string& statu
   // The status line is looked for inside the job's own block: another job
   // may show the very same line.
   const std::string key = "\tstatus \t\t= \"";
-  if (!take_lock(farm, "Render_Job_Control")) return false;
-  std::string text = farm.read("Render_Job_Control");
-  size_t block = text.find("\n" + job + " ");
-  size_t at = block == std::string::npos ? block : text.find(key, block);
-  size_t end = at == std::string::npos ? at : text.find(";\n", at);
-  bool found = end != std::string::npos;
-  if (found) {
-    text.replace(at, end - at, key + status + "\"");
-    farm.write("Render_Job_Control", text);
-  }
-  drop_lock(farm, "Render_Job_Control");
-  std::string pid_file = farm.path(host + ".pid");
-  utimensat(AT_FDCWD, pid_file.c_str(), nullptr, 0);
-  return found;
+  return edit_locked(farm, host, [&](std::string& text) {
+    size_t block = text.find("\n" + job + " ");
+    size_t at = block == std::string::npos ? block : text.find(key, block);
+    size_t end = at == std::string::npos ? at : text.find(";\n", at);
+    return end != std::string::npos && (text.replace(at, end - at, key + status + "\""), true);
+  });
 }

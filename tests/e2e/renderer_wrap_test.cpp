@@ -17,9 +17,7 @@ Ran run(const std::vector<std::string>& args, const std::string& dir, const std:
   return run_program(args, dir + "/run", cwd);
 }
 bool on_path(const std::string& program) {
-  return run_program({"sh", "-c", "command -v " + program},
-                     "/tmp/on_path." + std::to_string(getpid()))
-             .code() == 0;
+  return system(("command -v " + program + " >/dev/null 2>&1").c_str()) == 0;
 }
 
 // Width and height from a PNG's header; (0, 0) when it is not a PNG.
@@ -33,26 +31,21 @@ std::pair<int, int> png_size(const std::string& path) {
   return {static_cast<int>(ntohl(size[0])), static_cast<int>(ntohl(size[1]))};
 }
 
-struct Program {
-  const char* path;
-  std::vector<std::string> named;  // what the usage must name
-};
-
-class CommandLine : public ::testing::TestWithParam<Program> {};
+// Each installed program: its help goes to stdout with exit 0, a bad option to stderr with the
+// usage and exit 2.
+class CommandLine : public ::testing::TestWithParam<const char*> {};
 
 TEST_P(CommandLine, HelpExitsZeroAndABadOptionExitsTwoWithTheUsage) {
   Farm scratch;
   for (const char* help : {"-h", "--help"}) {
-    Ran r = run({GetParam().path, help}, scratch.dir());
-    EXPECT_EQ(r.code(), 0) << help << r.err;
-    for (const std::string& word : GetParam().named)
-      EXPECT_NE(r.out.find(word), std::string::npos) << word << " missing from\n" << r.out;
+    Ran r = run({GetParam(), help}, scratch.dir());
+    EXPECT_TRUE(r.code() == 0 && r.out.starts_with("usage:")) << help << r.out << r.err;
   }
   // The bad option first: the daemon must not start on the directory "p"
   // that getopt would read out of "--help-me".
   mkdir(scratch.path("p").c_str(), 0777);
   for (const char* bad : {"--help-me", "-x"}) {
-    Ran r = run({GetParam().path, bad, "-p", "pix/x", "scene"}, scratch.dir(), scratch.dir());
+    Ran r = run({GetParam(), bad, "-p", "pix/x", "scene"}, scratch.dir(), scratch.dir());
     EXPECT_TRUE(r.code() == 2 && r.err.find(bad) != std::string::npos &&
                 r.err.find("usage:") != std::string::npos)
         << bad << ": " << r.err;
@@ -60,18 +53,9 @@ TEST_P(CommandLine, HelpExitsZeroAndABadOptionExitsTwoWithTheUsage) {
   EXPECT_FALSE(access(scratch.path(this_host_name() + ".pid").c_str(), F_OK) == 0);
 }
 
-#define WRAPPER_WORDS \
-  "usage:", "-p", "-m", "-A", "-s", "-e", "-b", "-S", "-B", "-E", "-V", "-n", "OPTIONS"
-
-INSTANTIATE_TEST_SUITE_P(
-    InstalledPrograms, CommandLine,
-    testing::Values(Program{DAEMON_PATH,
-                            {"-l", "-u", "-d", "-s", "RNDCTL_DEBUG", "ZARNO_RNDCTL_LOCATION",
-                             "ZARNO_RNDCTL_ACCESS_LOG", "ZARNO_RNDCTL_HOST_TIMEOUT", "DRCTMPDIR",
-                             "ZARNO_LOCATION", "HOME", "ZARNO_RSH", "usage:"}},
-                    Program{FRAME_PAINTER_PATH, {WRAPPER_WORDS}},
-                    Program{BLENDER_RENDER_PATH, {WRAPPER_WORDS, "BLENDER"}},
-                    Program{POVRAY_RENDER_PATH, {WRAPPER_WORDS, "POVRAY"}}));
+INSTANTIATE_TEST_SUITE_P(InstalledPrograms, CommandLine,
+                         testing::Values(DAEMON_PATH, FRAME_PAINTER_PATH, BLENDER_RENDER_PATH,
+                                         POVRAY_RENDER_PATH));
 
 // The renderer itself, the job's executable (its wrapper), and the message in
 // the job's comment for a broken scene.

@@ -9,8 +9,8 @@
 #include <cstdlib>
 #include <filesystem>
 #include <string>
+#include <tuple>
 
-#include "Shared/memory/MA_rtns.h"
 #include "tests/support/task_text.h"
 #include "tests/support/test_support.h"
 
@@ -22,14 +22,9 @@ class TaskFixture : public ControlDirTest {
     ASSERT_NE(job_, nullptr);
     job_->executable.set("myrender");
     job_->pix.set(path("pix/img").c_str());
-    job_->animate = 1;
-    job_->frames[0] = 1.0f;
-    job_->frames[1] = 10.0f;
-    job_->frames[2] = 1.0f;
-    job_->totalframes = 10;
-    dev_ = Dev_new(nullptr, nullptr, "render1", 1);
-    ASSERT_NE(dev_, nullptr);
-    dev_->host_name.set("testhost");
+    std::tie(job_->animate, job_->frames[0], job_->frames[1], job_->frames[2], job_->totalframes) =
+        std::tuple(1, 1.0f, 10.0f, 1.0f, 10);
+    ASSERT_NE(dev_ = host_dev("render1", 1, "testhost"), nullptr);
     mkdir_p("proj/sdl");
     mkdir_p("pix");
   }
@@ -39,14 +34,8 @@ class TaskFixture : public ControlDirTest {
   /// A running-task entry of `job` for start..end on `dev`, in `status`.
   /// An entry on this host stands for a piece this daemon took.
   TASK* add_entry(Job* job, Dev* dev, float start, float end, int status, int id = 0) {
-    auto* rec = MA_new<TaskRec>(__LINE__, "tests/task_fixture");
-    rec->start = start;
-    rec->end = end;
-    rec->current = start;
-    rec->status = status;
-    rec->id = id;
-    rec->dev = dev;
-    TASK* entry = Task_add(job, rec);
+    TASK* entry =
+        Task_add(job, TaskRec_alloc(nullptr, start, end, start, dev, status, nullptr, id));
     if (entry != nullptr) entry->taken = rj_dev_is_this_host(dev) ? 1 : 0;
     return entry;
   }

@@ -3,6 +3,7 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <ftw.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -111,9 +112,19 @@ void ControlDirTest::SetUp() {
   rndctl.host.set("testhost");
   rndctl.user.set("tester");
   rndctl.pid = getpid();
+  // Streams and the render registry of a test stay in its own directory.
+  setenv("DRCTMPDIR", dir_.c_str(), 1);
+}
+
+void ControlDirTest::use_local_rsh() const {
+  write_file("local_rsh", "#!/bin/sh\nshift; shift\nexec /bin/sh -c \"$1\"\n");
+  chmod(path("local_rsh").c_str(), 0755);
+  setenv("ZARNO_RSH", path("local_rsh").c_str(), 1);
 }
 
 void ControlDirTest::TearDown() {
+  unsetenv("ZARNO_RSH");
+  unsetenv("DRCTMPDIR");
   rndctl_reset();
   if (!dir_.empty() && getenv("RJ_KEEP_TEST_DIRS") == nullptr) remove_tree(dir_);
 }

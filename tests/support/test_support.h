@@ -5,6 +5,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cstdlib>
+#include <cstring>
 #include <string>
 #include <vector>
 
@@ -32,6 +34,22 @@ inline pid_t sleeper() {
   setpgid(pid, pid);
   return pid;
 }
+/// The hexadecimal signal mask after `key` ("SigCgt:", ...) in a /proc status text, or
+/// `absent` when the text has none.
+inline unsigned long long signal_mask(const std::string& status, const char* key,
+                                      unsigned long long absent = ~0ULL) {
+  size_t at = status.find(key);
+  return at == std::string::npos ? absent
+                                 : strtoull(status.c_str() + at + strlen(key), nullptr, 16);
+}
+/// A resource `name` of `host`, added to the control block's list as a file's would be.
+inline Dev* host_dev(const char* name, int index, const char* host) {
+  Dev* dev = Add_a_dev(nullptr, name, index);
+  if (dev != nullptr) dev->host_name.set(host);
+  return dev;
+}
+/// Names each instance of a parameterised test by its case's `label`.
+inline constexpr auto by_label = [](const auto& info) { return std::string(info.param.label); };
 /// The sorted names in `dir`, without "." and "..".
 std::vector<std::string> dir_names(const std::string& dir);
 /// Forks `n` children that each run `body(i)` and _exit with its result,
@@ -55,7 +73,7 @@ Ran run_program(std::vector<std::string> args, const std::string& scratch,
 void remove_tree(const std::string& path);
 
 /// A fresh control directory under the temporary directory, made the control
-/// block's control directory, with the host name "testhost" and this pid.
+/// block's control directory and DRCTMPDIR, with the host name "testhost" and this pid.
 class ControlDirTest : public ::testing::Test {
  protected:
   void SetUp() override;
@@ -66,6 +84,9 @@ class ControlDirTest : public ::testing::Test {
     ASSERT_TRUE(write_text_file(path(name), content)) << name;
   }
   std::string read_file(const std::string& name) const { return read_text_file(path(name)); }
+  /// Makes probes of other hosts go through a stand-in remote shell that runs the command here
+  /// (until the test ends).
+  void use_local_rsh() const;
 
   std::string dir_;
 };
