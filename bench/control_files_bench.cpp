@@ -172,20 +172,28 @@ void BM_Reload(benchmark::State& state) {
 }
 BENCHMARK(BM_Reload)->Unit(benchmark::kMillisecond)->UseRealTime();
 
-void BM_Write(benchmark::State& state) {
+// The queue read once for the writers; false (the benchmark skipped) when
+// the control directory cannot be made.
+bool queue_loaded(benchmark::State& state) {
   if (!ready()) {
     state.SkipWithError("cannot set up the control directory");
-    return;
+    return false;
   }
   if (rndctl.jobs == nullptr) {
     parse_file(dev_file, "Render_Resource_Control");
     parse_file(job_file, "Render_Job_Control");
   }
+  return rndctl.jobs != nullptr && rndctl.devs != nullptr;
+}
+
+// Times `write` (false: it failed) once an iteration.
+template <class Write>
+void time_writes(benchmark::State& state, Write write) {
+  if (!queue_loaded(state)) return;
   Clock::duration spent{};
   for (auto _ : state) {
     const auto start = Clock::now();
-    bool ok = write_file(dev_file, Resource_control_write_dev) &&
-              write_file(job_file, Job_control_write_dev);
+    bool ok = write();
     spent += Clock::now() - start;
     if (!ok) {
       state.SkipWithError("write failed");
@@ -193,55 +201,35 @@ void BM_Write(benchmark::State& state) {
     }
   }
   report(state, spent);
+}
+
+void BM_Write(benchmark::State& state) {
+  time_writes(state, [] {
+    return write_file(dev_file, Resource_control_write_dev) &&
+           write_file(job_file, Job_control_write_dev);
+  });
 }
 BENCHMARK(BM_Write)->Unit(benchmark::kMillisecond)->UseRealTime();
 
 // The same write into /dev/null: what the writers themselves cost, without
 // the kernel's work of filling a fresh file.
 void BM_WriteUserSpace(benchmark::State& state) {
-  if (!ready()) {
-    state.SkipWithError("cannot set up the control directory");
-    return;
-  }
-  if (rndctl.jobs == nullptr) {
-    parse_file(dev_file, "Render_Resource_Control");
-    parse_file(job_file, "Render_Job_Control");
-  }
-  Clock::duration spent{};
-  for (auto _ : state) {
-    const auto start = Clock::now();
-    bool ok = write_file("/dev/null", Resource_control_write_dev) &&
-              write_file("/dev/null", Job_control_write_dev);
-    spent += Clock::now() - start;
-    if (!ok) {
-      state.SkipWithError("write failed");
-      break;
-    }
-  }
-  report(state, spent);
+  time_writes(state, [] {
+    return write_file("/dev/null", Resource_control_write_dev) &&
+           write_file("/dev/null", Job_control_write_dev);
+  });
 }
 BENCHMARK(BM_WriteUserSpace)->Unit(benchmark::kMillisecond)->UseRealTime();
 
 void BM_WriteReplace(benchmark::State& state) {
-  if (!ready()) {
-    state.SkipWithError("cannot set up the control directory");
-    return;
-  }
-  if (rndctl.jobs == nullptr) {
-    parse_file(dev_file, "Render_Resource_Control");
-    parse_file(job_file, "Render_Job_Control");
-  }
-  Clock::duration spent{};
-  for (auto _ : state) {
+  time_writes(state, [] {
     // A file that would not change is not written at all.
     rndctl.jobs->doneframes ^= 1;
     rndctl.devs->max_frames ^= 1;
-    const auto start = Clock::now();
     Resource_control_write(nullptr);
     Job_control_write(nullptr);
-    spent += Clock::now() - start;
-  }
-  report(state, spent);
+    return true;  // a failed write is reported on stderr
+  });
 }
 BENCHMARK(BM_WriteReplace)->Unit(benchmark::kMillisecond)->UseRealTime();
 
