@@ -66,8 +66,7 @@ bool any_to_put_back(Wanted wanted) {
 // once the lock is gone.
 template <class Pick>
 int put_back_cycle(Pick pick) {
-  std::vector<Job*> touched;
-  std::vector<const Dev*> full;
+  TaskAfterLock after;
   int count = 0;
   (void)Task_file_rewrite([&](TaskGroup** groups) {  // a failure is reported there
     for (TaskGroup* g = *groups; g != nullptr; g = g->next) {
@@ -76,15 +75,13 @@ int put_back_cycle(Pick pick) {
         if (!held(rec) || !pick(g, rec)) continue;
         Task_put_back(groups, g, rec);
         ++count;
-        if (std::find(touched.begin(), touched.end(), g->job) == touched.end()) {
-          touched.push_back(g->job);
-        }
+        after.wake(g->job);
       }
     }
-    if (count > 0) full = Task_full_devs(*groups, touched);
+    after.note_full(*groups);
     return count > 0;
   });
-  for (Job* j : touched) Job_wake_other_hosts(j, &full);
+  after.run();
   return count;
 }
 

@@ -133,7 +133,7 @@ void Task_file_update(Job* job) {
 int Task_file_check(Job* job) {
   dbgpnt("\nTask_file_check-----------------------------\n");
   int set_back = 0;
-  std::vector<const Dev*> full;
+  TaskAfterLock after;
   (void)Task_file_rewrite([&](TaskGroup** groups) {  // reported there
     TaskGroup* g = TaskGroup_by_job(*groups, job);
     if (g != nullptr) {
@@ -148,10 +148,11 @@ int Task_file_check(Job* job) {
         }
       }
     }
-    if (set_back) full = Task_full_devs(*groups, {job});
+    if (set_back) after.wake(job);
+    after.note_full(*groups);
     return true;
   });
-  if (set_back) Job_wake_other_hosts(job, &full);
+  after.run();
   dbgpnt("Task_file_check-------------------------DONE\n");
   return set_back;
 }
